@@ -1,0 +1,30 @@
+// A program that links an installed libzorvnotifyd: builds a queue from
+// JSON, copies it, asks a matching question and writes it back.  The build
+// checks run it against the staged install; it needs no privileges.
+
+#include <iostream>
+#include <sstream>
+
+#include <monitor_queue.h>
+#include <thread.h>
+
+using ZORV::ZORVNOTIFYD::MonitorQueue;
+
+int main() {
+  Json::Value json;
+  std::istringstream(R"({"queue": "backup",
+      "config": [{"path": "/vol/share", "mask": 258, "ignore": ["\\.tmp$"]}]})") >> json;
+  const MonitorQueue queue(json);
+  MonitorQueue copy = queue;
+  const bool wanted = copy.IsMonitoring("/vol/share/report.txt", 2);
+  const bool ignored = !copy.IsMonitoring("/vol/share/report.tmp", 2);
+  Json::StreamWriterBuilder writer;
+  writer["indentation"] = "";
+  std::cout << Json::writeString(writer, copy.ToJson()) << "\n";
+  if (!wanted || !ignored || copy.ToJson() != queue.ToJson()) {
+    std::cerr << "consumer: unexpected answer from the library\n";
+    return 1;
+  }
+  std::cout << "consumer: ok\n";
+  return 0;
+}

@@ -1,0 +1,60 @@
+// Queue files: one JSON array of queue objects per file.
+
+#include <errno.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <exception>
+
+#include "monitor_queue.h"
+#include "monitor_queue/log.h"
+#include "monitor_queue/privileged_section.h"
+#include "syslog_percent_m.h"
+#include "platform/platform.h"
+
+namespace ZORV {
+namespace ZORVNOTIFYD {
+
+namespace {
+
+constexpr mode_t kQueueFileMode = 0600;
+
+}  // namespace
+
+bool MonitorQueue::SaveToFile(const std::vector<MonitorQueue>& queues, const std::string& path) {
+  Json::Value root(Json::arrayValue);
+  PrivilegedSection section(kSource, __LINE__);
+  if (!RootCheck(kSource, __LINE__)) return false;
+  for (const MonitorQueue& queue : queues) root.append(queue.ToJson());
+  if (!platform::JsonToFile(root, path)) {
+    syslog(LOG_ERR, "%s:%d Failed to save json", kSource, __LINE__);
+    return false;
+  }
+  if (chmod(path.c_str(), kQueueFileMode) < 0) {
+    ZORV_PERCENT_M_BEGIN
+    syslog(LOG_ERR, "%s:%d chmod failed, path=%s, reason=%m", kSource, __LINE__, path.c_str());
+    ZORV_PERCENT_M_END
+    unlink(path.c_str());
+    return false;
+  }
+  return true;
+}
+
+bool MonitorQueue::LoadFromFile(std::vector<MonitorQueue>& queues, const std::string& path) {
+  Json::Value root(Json::arrayValue);
+  PrivilegedSection section(kSource, __LINE__);
+  if (!RootCheck(kSource, __LINE__)) return false;
+  if (ZORBCFileExist(path.c_str()) == 1 && !platform::JsonFromFile(root, path)) return false;
+  if (!root.isArray()) return false;
+  try {
+    for (Json::Value::ArrayIndex i = 0; i < root.size(); ++i) {
+      queues.push_back(MonitorQueue(root[i]));
+    }
+  } catch (const std::exception&) {
+    return false;  // the queues of the elements before the faulty one stay
+  }
+  return true;
+}
+
+}  // namespace ZORVNOTIFYD
+}  // namespace ZORV

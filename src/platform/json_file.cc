@@ -1,0 +1,152 @@
+// Reading and writing whole JSON files.
+//
+// A write never exposes a partial file: the text goes to a temporary file in
+// the target's directory, which is synced and renamed over the target, and
+// the directory is synced so that the rename survives a crash.  The
+// temporary file is named ".<name>.tmp.XXXXXX": the leading "." keeps the
+// catalogue scan away from it.  Its writer holds an flock on it while it
+// lives, so a later writer can tell a file abandoned by a killed process
+// (no lock) from one still being written (locked) and remove only the first.
+
+#include <dirent.h>
+#include <errno.h>
+#include <fcntl.h>
+#include <stdlib.h>
+#include <string.h>
+#include <sys/file.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <exception>
+#include <memory>
+#include <string>
+
+#include "platform/platform.h"
+#include "platform/scoped.h"
+
+namespace ZORV {
+namespace ZORVNOTIFYD {
+namespace platform {
+
+namespace {
+
+// Splits |path| into its directory ("." when there is none) and last name.
+void SplitPath(const std::string& path, std::string& dir, std::string& name) {
+  const std::string::size_type slash = path.rfind('/');
+  if (slash == std::string::npos) {
+    dir = ".";
+    name = path;
+  } else {
+    dir = slash == 0 ? "/" : path.substr(0, slash);
+    name = path.substr(slash + 1);
+  }
+}
+
+bool WriteAll(int fd, const std::string& text) {
+  const char* data = text.data();
+  size_t left = text.size();
+  while (left > 0) {
+    const ssize_t n = write(fd, data, left);
+    if (n < 0) {
+      if (errno == EINTR) continue;
+      return false;
+    }
+    data += n;
+    left -= static_cast<size_t>(n);
+  }
+  return true;
+}
+
+bool ReadAll(int fd, std::string& text) {
+  char buffer[8192];
+  for (;;) {
+    const ssize_t n = read(fd, buffer, sizeof buffer);
+    if (n == 0) return true;
+    if (n < 0) {
+      if (errno == EINTR) continue;
+      return false;
+    }
+    text.append(buffer, static_cast<size_t>(n));
+  }
+}
+
+bool SyncDirectory(const std::string& dir) {
+  ScopedFd fd(open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  return fd.valid() && fsync(fd.get()) == 0;
+}
+
+// Removes the temporary files of |dir| that begin with |prefix| and whose
+// writer is gone (nobody holds their flock).
+void RemoveAbandoned(const std::string& dir, const std::string& prefix) {
+  ScopedDir stream(opendir(dir.c_str()));
+  if (stream.get() == nullptr) return;
+  while (const struct dirent* entry = readdir(stream.get())) {
+    if (strncmp(entry->d_name, prefix.c_str(), prefix.size()) != 0) continue;
+    const std::string path = dir + "/" + entry->d_name;
+    ScopedFd fd(open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
+    if (!fd.valid() || flock(fd.get(), LOCK_EX | LOCK_NB) != 0) continue;
+    struct stat held;
+    struct stat named;
+    // Unlink only the very file we hold, not one renamed into its place.
+    if (fstat(fd.get(), &held) == 0 && lstat(path.c_str(), &named) == 0 &&
+        held.st_dev == named.st_dev && held.st_ino == named.st_ino) {
+      unlink(path.c_str());
+    }
+  }
+}
+
+}  // namespace
+
+bool JsonFromFile(Json::Value& value, const std::string& path) {
+  ScopedFd fd(open(path.c_str(), O_RDONLY | O_CLOEXEC));
+  std::string text;
+  if (!fd.valid() || !ReadAll(fd.get(), text)) return false;
+  fd.Reset();
+
+  Json::CharReaderBuilder builder;
+  builder["collectComments"] = false;
+  builder["failIfExtra"] = true;
+  builder["allowSingleQuotes"] = false;
+  builder["allowSpecialFloats"] = false;
+  builder["allowDroppedNullPlaceholders"] = false;
+  builder["allowNumericKeys"] = false;
+  const std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
+  Json::Value parsed;
+  try {
+    if (!reader->parse(text.data(), text.data() + text.size(), &parsed, nullptr)) return false;
+  } catch (const std::exception&) {
+    return false;  // nesting beyond the reader's stack limit
+  }
+  value.swap(parsed);
+  return true;
+}
+
+bool JsonToFile(const Json::Value& value, const std::string& path) {
+  Json::StreamWriterBuilder builder;
+  builder["indentation"] = "  ";
+  std::string text = Json::writeString(builder, value);
+  text.push_back('\n');
+
+  std::string dir;
+  std::string name;
+  SplitPath(path, dir, name);
+  if (name.empty()) return false;
+  const std::string prefix = "." + name + ".tmp.";
+  std::string temp = dir + "/" + prefix + "XXXXXX";
+
+  ScopedFd fd(mkostemp(&temp[0], O_CLOEXEC));  // created with mode 0600
+  if (!fd.valid()) return false;
+  bool ok = flock(fd.get(), LOCK_EX) == 0 && WriteAll(fd.get(), text) && fsync(fd.get()) == 0 &&
+            rename(temp.c_str(), path.c_str()) == 0;
+  if (!ok) {
+    unlink(temp.c_str());
+    return false;
+  }
+  ok = SyncDirectory(dir);
+  RemoveAbandoned(dir, prefix);
+  return ok;
+}
+
+}  // namespace platform
+}  // namespace ZORVNOTIFYD
+}  // namespace ZORV

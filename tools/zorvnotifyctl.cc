@@ -1,0 +1,201 @@
+// zorvnotifyctl: inspects and edits the catalogue of monitor queues of the
+// zorvnotifyd daemon through the public API of libzorvnotifyd.
+//
+// Exit status: 0 done, 1 the library refused or failed, 2 bad command line
+// or invalid input (nothing was changed).  The library's own log lines go
+// to standard error as well as to syslog.
+
+#include <syslog.h>
+
+#include <cstring>
+#include <exception>
+#include <iostream>
+#include <string>
+
+#include "command_line.h"
+#include "commands.h"
+#include "monitor_queue.h"
+#include "queue_types.h"
+
+namespace zorvnotifyctl {
+namespace {
+
+// One command: its arguments, whether it reads a single queue file (and so
+// takes --type), what runs it, and its help.
+struct CommandInfo {
+  const char* name;
+  size_t min_args;
+  size_t max_args;
+  bool takes_type;
+  int (*run)(const Invocation&);
+  const char* synopsis;     // the arguments, e.g. "NAME FILE"
+  const char* description;  // the paragraph of its --help
+};
+
+constexpr CommandInfo kCommands[] = {
+    {"list", 1, 1, true, RunList, "FILE",
+     "Shows the queues of queue file FILE of the chosen type, in file order.  A file\n"
+     "that does not exist holds no queues.  With --json: the queues as a JSON array\n"
+     "in the file's own form.\n"},
+    {"get", 2, 2, true, RunGet, "NAME FILE",
+     "Shows the first queue named NAME (exactly, case included) of queue file FILE.\n"
+     "Exit status 1 when the file holds no such queue.  With --json: the queue\n"
+     "object, which upsert accepts back.\n"},
+    {"upsert", 1, 2, true, RunUpsert, "FILE [SOURCE]",
+     "Stores one queue object, read from SOURCE (a file; standard input when SOURCE\n"
+     "is absent or \"-\"), in queue file FILE: it replaces the first queue of the\n"
+     "same name or is appended.  The library then asks for the service zorvnotifyd\n"
+     "to be started.  The object must look like\n"
+     "  {\"queue\": \"NAME\", \"config\": [{\"path\": \"/DIR\", \"mask\": 258,\n"
+     "                                 \"ignore\": [\"\\\\.tmp$\"]}]}\n"
+     "with \"queue\" a string, each \"path\" a string, each \"mask\" an integer from 0\n"
+     "to 4294967295 and \"ignore\" (optional) an array of POSIX extended regular\n"
+     "expressions.  Unknown keys, wrong types, missing keys and patterns that do\n"
+     "not compile are refused with exit status 2, before anything is written.\n"},
+    {"delete", 2, 2, true, RunDelete, "NAME FILE",
+     "Removes the first queue named NAME from queue file FILE.  A name the file does\n"
+     "not hold changes nothing and is not an error.  When no queue is left in the\n"
+     "whole catalogue, the library asks for the service zorvnotifyd to be stopped.\n"},
+    {"catalogue", 0, 0, false, RunCatalogue, "",
+     "Shows every queue of every type (share, etc, local-etc), with its type.\n"
+     "With --json: an array of queue objects, each with an added \"type\".\n"},
+    {"match", 2, 2, false, RunMatch, "PATH MASK",
+     "Shows the queues of the catalogue that want an event of the kinds MASK on\n"
+     "PATH: some configuration shares a bit with MASK, PATH is its directory or\n"
+     "below it, and none of its ignore patterns matches PATH.  MASK is decimal or\n"
+     "hexadecimal after 0x.\n"},
+    {"dirs", 1, 1, false, RunDirs, "DIR",
+     "Shows the queues of the catalogue that watch DIR itself or a directory below\n"
+     "it, each with the union of the masks of those configurations, and the union\n"
+     "of all of them: the event kinds a watch on DIR must report.\n"},
+    {"shares", 0, 0, false, RunShares, "",
+     "Shows the share set of the catalogue: the distinct first two components\n"
+     "(such as /vol/share) of the absolute paths the queues watch.\n"},
+};
+
+const char kProgram[] = "zorvnotifyctl";
+
+const char kOverview[] =
+    "Inspects or edits the catalogue of monitor queues of the zorvnotifyd daemon.\n"
+    "\n"
+    "Commands on one queue file (of the type given by --type):\n"
+    "  list FILE              show the queues of queue file FILE\n"
+    "  get NAME FILE          show the queue NAME of queue file FILE\n"
+    "  upsert FILE [SOURCE]   store the queue object of SOURCE (default: stdin)\n"
+    "  delete NAME FILE       remove the queue NAME from queue file FILE\n"
+    "Commands on the whole catalogue:\n"
+    "  catalogue              show every queue of every type\n"
+    "  match PATH MASK        show the queues that want an event MASK on PATH\n"
+    "  dirs DIR               show the queues that watch DIR or below, and their masks\n"
+    "  shares                 show the share set of the catalogue\n"
+    "  help [COMMAND]         show this text, or the help of COMMAND\n"
+    "\n"
+    "Options (anywhere on the line):\n"
+    "  -t, --type TYPE   queue type of FILE: share, etc (default) or local-etc\n"
+    "      --json        write JSON instead of tables\n"
+    "  -v, --verbose     also show the library's detailed log lines\n"
+    "  -h, --help        show help; after a command, that command's help\n"
+    "\n"
+    "FILE is a plain name inside the configuration directory of the type, not\n"
+    "beginning with \".\".  The store operations need root.\n"
+    "Exit status: 0 done, 1 the library refused or failed, 2 bad usage or input.\n"
+    "See zorvnotifyctl(1).\n";
+
+const CommandInfo* FindCommand(const std::string& name) {
+  for (const CommandInfo& info : kCommands) {
+    if (name == info.name) return &info;
+  }
+  return nullptr;
+}
+
+std::string UsageLine(const CommandInfo& info) {
+  std::string line = std::string("Usage: ") + kProgram;
+  line += info.takes_type ? " [--type TYPE] [--json] " : " [--json] ";
+  line += info.name;
+  if (*info.synopsis != '\0') line += std::string(" ") + info.synopsis;
+  return line;
+}
+
+void PrintOverview(std::ostream& out) {
+  out << "Usage: " << kProgram << " [OPTIONS] COMMAND [ARGS]\n\n" << kOverview;
+}
+
+void PrintCommandHelp(const CommandInfo& info, std::ostream& out) {
+  out << UsageLine(info) << "\n\n" << info.description;
+  if (info.takes_type) out << "\nTYPE is share, etc (default) or local-etc.\n";
+}
+
+int UsageError(const std::string& message) {
+  Fail(kExitUsage, message);
+  std::cerr << "Try '" << kProgram << " --help'.\n";
+  return kExitUsage;
+}
+
+// "help [COMMAND]", "--help" and "COMMAND --help".
+int RunHelp(const CommandLine& line) {
+  const bool help_command = line.command == "help";
+  const std::string topic =
+      help_command ? (line.args.empty() ? std::string() : line.args[0]) : line.command;
+  if (help_command && line.args.size() > 1) return UsageError("help takes at most one COMMAND");
+  if (topic.empty()) {
+    PrintOverview(std::cout);
+    return kExitOk;
+  }
+  const CommandInfo* info = FindCommand(topic);
+  if (info == nullptr) return UsageError("unknown command \"" + topic + "\"");
+  PrintCommandHelp(*info, std::cout);
+  return kExitOk;
+}
+
+int Dispatch(int argc, char** argv) {
+  CommandLine line;
+  const std::string error = ParseCommandLine(argc, argv, &line);
+  if (!error.empty()) return UsageError(error);
+  if (line.help || line.command == "help") return RunHelp(line);
+  if (line.command.empty()) {
+    PrintOverview(std::cerr);
+    return kExitUsage;
+  }
+  const CommandInfo* info = FindCommand(line.command);
+  if (info == nullptr) return UsageError("unknown command \"" + line.command + "\"");
+  if (line.args.size() < info->min_args || line.args.size() > info->max_args) {
+    Fail(kExitUsage, std::string(info->name) + ": wrong number of arguments");
+    std::cerr << UsageLine(*info) << '\n';
+    return kExitUsage;
+  }
+  Invocation invocation{line.args, ZORV::ZORVNOTIFYD::MONITOR_QUEUE_TYPE_ETC_DIR, line.json};
+  if (line.type_given) {
+    if (!info->takes_type) {
+      return UsageError(std::string("--type does not apply to ") + info->name +
+                        ", which covers every type");
+    }
+    if (!ParseQueueType(line.type, &invocation.type)) {
+      return UsageError("unknown queue type \"" + line.type + "\" (use share, etc or local-etc)");
+    }
+  }
+  if (line.verbose) ZORV::ZORVNOTIFYD::LOG_LEVEL = 7;
+  return info->run(invocation);
+}
+
+}  // namespace
+}  // namespace zorvnotifyctl
+
+int main(int argc, char** argv) {
+  // The library logs through syslog and never opens the log itself;
+  // LOG_PERROR puts its lines on standard error too, where the user sees
+  // why an operation was refused.
+  openlog("zorvnotifyctl", LOG_PERROR, LOG_USER);
+  int status;
+  try {
+    status = zorvnotifyctl::Dispatch(argc, argv);
+  } catch (const std::exception& e) {
+    status = zorvnotifyctl::Fail(zorvnotifyctl::kExitRefused,
+                                 std::string("unexpected failure: ") + e.what());
+  }
+  std::cout.flush();
+  if (!std::cout) {
+    status = zorvnotifyctl::Fail(zorvnotifyctl::kExitRefused, "cannot write the output");
+  }
+  closelog();
+  return status;
+}
