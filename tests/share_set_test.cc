@@ -3,67 +3,38 @@
 
 #include <gtest/gtest.h>
 
-#include <set>
-#include <string>
-#include <vector>
-
 #include "monitor_queue.h"
 
-namespace ZORV {
-namespace ZORVNOTIFYD {
-namespace {
-
-MonitorQueue MakeQueue(const std::vector<std::string>& paths) {
-  Json::Value value(Json::objectValue);
-  value["config"] = Json::Value(Json::arrayValue);
-  for (const std::string& path : paths) {
-    Json::Value config(Json::objectValue);
-    config["path"] = path;
-    value["config"].append(config);
-  }
-  return MonitorQueue(value);
-}
+namespace ZORV::ZORVNOTIFYD {
 
 using Shares = std::set<std::string>;
 
-TEST(ShareSetTest, PrefixOfOnePath) {
-  const struct {
-    const char* path;
-    Shares want;
-  } rows[] = {
-      {"/vol/share/a/b", {"/vol/share"}},
-      {"/vol/share", {"/vol/share"}},
-      {"/vol/share/", {"/vol/share"}},
-      {"/vol/", {"/vol/"}},
-      {"/vol", {}},
-      {"/", {}},
-      {"vol/share", {}},
-      {"", {}},
-      {"//x", {"//x"}},
-      {"//x/y", {"//x"}},
-      {"/a//b", {"/a/"}},
-      {"//", {"//"}},
+static MonitorQueue MakeQueue(const std::vector<std::string>& paths) {
+  MonitorQueue queue{Json::Value()};
+  for (const std::string& path : paths) queue._configs.emplace_back(Json::Value())._path = path;
+  return queue;
+}
+
+TEST(ShareSetTest, PrefixesOfEveryConfigurationPath) {
+  // A path and the length of its share prefix, which leads it (0: none).
+  const std::pair<const char*, std::size_t> rows[] = {
+      {"/vol/share/a/b", 10}, {"/vol/share", 10}, {"/vol/share/", 10},
+      {"/vol/", 5},           {"/vol", 0},        {"/", 0},
+      {"vol/share", 0},       {"//x", 3},         {"//x/y", 3},
+      {"/a//b", 3},           {"//", 2},
   };
-  for (const auto& row : rows) {
-    Shares shares;
-    MakeQueue({row.path}).CollectShareSet(shares);
-    EXPECT_EQ(shares, row.want) << row.path;
+  for (const auto& [path, length] : rows) {
+    Shares shares = {"/held"};  // what the set held stays
+    MakeQueue({path}).CollectShareSet(shares);
+    EXPECT_EQ(shares, (length ? Shares{"/held", std::string(path, length)} : Shares{"/held"}))
+        << path;
   }
-}
-
-TEST(ShareSetTest, MergesQueuesAndKeepsWhatTheSetHeld) {
+  // GetShareSet joins every configuration of every queue.
   const MonitorQueue first = MakeQueue({"/vol/share/a", "/x", "/vol/share/b"});
-  const MonitorQueue second = MakeQueue({"/vol/share", "/pub/docs/", "rel/a"});
+  const MonitorQueue second = MakeQueue({"/vol/share", "/pub/docs/", "rel/a", ""});
   EXPECT_EQ(MonitorQueue::GetShareSet({first, second}), (Shares{"/pub/docs", "/vol/share"}));
-
-  Shares shares = {"/zzz", "/pub/docs"};
-  second.CollectShareSet(shares);
-  EXPECT_EQ(shares, (Shares{"/pub/docs", "/vol/share", "/zzz"}));
-
-  EXPECT_TRUE(MonitorQueue::GetShareSet({}).empty());
-  EXPECT_TRUE(MonitorQueue::GetShareSet({MakeQueue({}), MakeQueue({})}).empty());
+  EXPECT_TRUE(MonitorQueue::GetShareSet({}).empty() &&
+              MonitorQueue::GetShareSet({MakeQueue({}), MakeQueue({})}).empty());
 }
 
-}  // namespace
-}  // namespace ZORVNOTIFYD
-}  // namespace ZORV
+}  // namespace ZORV::ZORVNOTIFYD

@@ -1,16 +1,15 @@
-// Worker thread: start/stop and their log lines, refusals without a signal,
-// delivery of actions and their text, one request in flight at a time.
+// Worker thread: start and stop with their log lines, actions and their text
+// delivered on the worker one request at a time, refusals that send no signal.
 
 #include "thread.h"
 
 #include <dlfcn.h>
 #include <sched.h>
 #include <signal.h>
-#include <syslog.h>
-#include <unistd.h>
 
 #include <atomic>
 #include <cerrno>
+#include <chrono>
 #include <cstring>
 #include <string>
 #include <thread>
@@ -21,34 +20,22 @@
 
 using ZORV::ZORVNOTIFYD::Thread;
 
-namespace {
-
-// The library's pthread_kill and pthread_create calls land in the
-// definitions below (the test exports its symbols): requests are counted and
-// failures injected, then the call is forwarded.
-std::atomic<int> g_kills{0};
-std::atomic<int> g_fail_kill{0};
-std::atomic<int> g_fail_create{0};
-
-template <typename Fn>
-Fn Next(const char* name) {
-  return reinterpret_cast<Fn>(dlsym(RTLD_NEXT, name));
-}
-
-}  // namespace
+// The library's pthread_kill and pthread_create calls land in the definitions
+// below (the test exports its symbols): request signals are counted, failures
+// injected on demand, and every call otherwise forwarded.
+static std::atomic<int> g_kills{0}, g_fail_kill{0}, g_fail_create{0};
 
 extern "C" int pthread_kill(pthread_t tid, int sig) noexcept {
-  static const auto real = Next<int (*)(pthread_t, int)>("pthread_kill");
-  if (sig != SIGRTMAX - 1) return real(tid, sig);
-  ++g_kills;
-  const int err = g_fail_kill.exchange(0);
+  static const auto real =
+      reinterpret_cast<decltype(&pthread_kill)>(dlsym(RTLD_NEXT, "pthread_kill"));
+  const int err = sig == SIGRTMAX - 1 ? (++g_kills, g_fail_kill.exchange(0)) : 0;
   return err != 0 ? err : real(tid, sig);
 }
 
 extern "C" int pthread_create(pthread_t* tid, const pthread_attr_t* attr, void* (*fn)(void*),
                               void* arg) noexcept {
   static const auto real =
-      Next<int (*)(pthread_t*, const pthread_attr_t*, void* (*)(void*), void*)>("pthread_create");
+      reinterpret_cast<decltype(&pthread_create)>(dlsym(RTLD_NEXT, "pthread_create"));
   const int err = g_fail_create.exchange(0);
   return err != 0 ? err : real(tid, attr, fn, arg);
 }
@@ -56,219 +43,191 @@ extern "C" int pthread_create(pthread_t* tid, const pthread_attr_t* attr, void* 
 namespace {
 
 // What the last action saw; written in signal context, so plain stores only.
+std::atomic<int> g_calls{0};
 struct Seen {
-  std::atomic<int> calls{0};
-  pthread_t thread{};
-  Thread* target = nullptr;
-  const char* ptr = nullptr;
-  char text[64] = {};
+  pthread_t thread;
+  Thread* target;
+  const char* ptr;
+  char text[64];
 } g_seen;
 
 void Record(Thread* target, char* text) {
-  g_seen.thread = pthread_self();
-  g_seen.target = target;
-  g_seen.ptr = text;
-  strncpy(g_seen.text, text != nullptr ? text : "", sizeof(g_seen.text) - 1);
-  ++g_seen.calls;
+  g_seen = {pthread_self(), target, text, {}};
+  strncpy(g_seen.text, text != nullptr ? text : "", sizeof g_seen.text - 1);
+  ++g_calls;
 }
 
-// Run yields instead of sleeping: ThreadSanitizer's runtime can drop a signal
-// that arrives while its thread sleeps in an intercepted call.
-class Looper : public Thread {
+// Loops until stopped, returns at once, or calls Stop on itself.  The loop
+// yields, never sleeps: ThreadSanitizer's runtime drops a signal that arrives
+// while its thread sleeps in an intercepted call, which hung the TSan run.
+class Worker : public Thread {
  public:
-  ~Looper() override { Stop(); }
+  enum Kind { kLoop, kReturn, kStopSelf };
+  explicit Worker(Kind kind = kLoop) : kind_(kind) {}
+  ~Worker() override { Stop(); }
   int Run() override {
-    while (!_stop) sched_yield();
+    if (kind_ == kStopSelf) self_stop = Stop();
+    while (kind_ == kLoop && !_stop) sched_yield();
     return 0;
   }
+  const Kind kind_;
+  std::atomic<int> self_stop{-1};  // Stop's result on the worker, once it returned
 };
 
-class OneShot : public Thread {
- public:
-  int Run() override { return 0; }
-};
+// Each captured line as "<priority> <format> = <source>: <message>", the source
+// line number left out.
+std::string Logs() {
+  std::string out;
+  for (const auto& l : zorv_test::CapturedLogs())
+    out += std::to_string(l.priority) + " " + l.format + " = " +
+           l.text.substr(0, l.text.find(':') + 1) + l.text.substr(l.text.find(' ')) + "\n";
+  return out;
+}
 
-// Stops itself from Run: the join of its own thread fails.
-class SelfStopper : public Thread {
- public:
-  int Run() override {
-    stopped = Stop();
-    return 0;
+// Spins in the worker's signal handler until released.
+std::atomic<bool> g_holding{false}, g_release{false};
+void Hold(Thread*, char*) {
+  while (!g_release) g_holding = true;
+}
+
+// Sends SIGRTMAX-1 to a helper thread and waits up to a second for it.
+// Empty when it arrived, else what went wrong: every request to a worker
+// travels as that signal, and qemu-user 7.2 does not deliver the highest
+// real-time signals to its guest (its pthread_kill fails with EINVAL).
+std::atomic<bool> g_probe_arrived{false};
+std::string RequestSignalProblem() {
+  const int signo = SIGRTMAX - 1;
+  struct sigaction probe = {}, old = {};
+  probe.sa_handler = [](int) { g_probe_arrived = true; };
+  if (sigaction(signo, &probe, &old) != 0) return std::string("sigaction: ") + strerror(errno);
+  std::atomic<bool> give_up{false};
+  std::thread helper([&give_up] {  // yields, like Worker, for ThreadSanitizer
+    while (!g_probe_arrived && !give_up) sched_yield();
+  });
+  const int rc = pthread_kill(helper.native_handle(), signo);
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(1);
+  while (rc == 0 && !g_probe_arrived && std::chrono::steady_clock::now() < deadline) {
+    std::this_thread::sleep_for(std::chrono::milliseconds(1));
   }
-  bool stopped = true;
-};
+  give_up = true;
+  helper.join();  // a signal still on its way to the ended thread is discarded
+  sigaction(signo, &old, nullptr);
+  const std::string name = "SIGRTMAX-1 (" + std::to_string(signo) + ")";
+  if (rc != 0) return "sending " + name + " to a thread failed: " + strerror(rc);
+  return g_probe_arrived ? "" : name + " sent to a thread did not arrive within 1 s";
+}
 
 class ThreadTest : public ::testing::Test {
  protected:
-  static void SetUpTestSuite() { ASSERT_TRUE(Thread::InitThreadLock()); }
+  static void SetUpTestSuite() {
+    ASSERT_TRUE(Thread::InitThreadLock());
+    request_signal_problem_ = RequestSignalProblem();
+  }
   static void TearDownTestSuite() { Thread::DestroyThreadLock(); }
   void SetUp() override {
+    if (!request_signal_problem_.empty()) {
+      GTEST_SKIP() << request_signal_problem_
+                   << ": this system (qemu-user, for one) does not deliver the worker's request "
+                      "signal, so no worker-thread test can run here";
+    }
     zorv_test::ClearLogs();
-    g_seen.calls = 0;
   }
   void TearDown() override { ZORV::ZORVNOTIFYD::LOG_LEVEL = 3; }
+  static inline std::string request_signal_problem_;
 };
 
-// Checks |line| is "thread:<line> <message><arg>" logged with |format|.
-void ExpectLine(const zorv_test::LogLine& line, const char* format, const std::string& message) {
-  EXPECT_EQ(LOG_ERR, line.priority);
-  EXPECT_EQ(format, line.format);
-  EXPECT_EQ(0u, line.text.rfind("thread:", 0)) << line.text;
-  const std::string tail = " " + message;
-  EXPECT_EQ(line.text.size() - tail.size(), line.text.rfind(tail)) << line.text;
-}
-
-TEST_F(ThreadTest, StartStopLogTheSameIdAtLevel7AndASecondStopSendsNothing) {
-  ZORV::ZORVNOTIFYD::LOG_LEVEL = 7;
-  Looper t;
-  ASSERT_TRUE(t.Start());
-  const std::string id = std::to_string(static_cast<unsigned long>(t._tid));
-  EXPECT_TRUE(t.Stop());
-  const int kills = g_kills;
-  EXPECT_FALSE(t.Stop());
-  EXPECT_EQ(kills, g_kills);
-  const auto logs = zorv_test::CapturedLogs();
-  ASSERT_EQ(2u, logs.size()) << zorv_test::DumpLogs();
-  ExpectLine(logs[0], "%s:%d thread start %lu", "thread start " + id);
-  ExpectLine(logs[1], "%s:%d thread stop %lu", "thread stop " + id);
-
-  ZORV::ZORVNOTIFYD::LOG_LEVEL = 8;
-  ASSERT_TRUE(t.Start());
-  EXPECT_TRUE(t.Stop());
-  EXPECT_EQ(2u, zorv_test::CapturedLogs().size()) << zorv_test::DumpLogs();
-}
-
-TEST_F(ThreadTest, IdleFailedAndEndedThreadsAreNeverSignalled) {
-  const int kills = g_kills;
-  OneShot idle;
-  EXPECT_FALSE(idle.DoAction(Record, "x"));
-  EXPECT_FALSE(idle.Stop());
-
-  g_fail_create = EAGAIN;
-  Looper failed;
-  EXPECT_FALSE(failed.Start());
-  EXPECT_EQ(pthread_t{}, failed._tid);
-  EXPECT_FALSE(failed.Stop());
-  const auto logs = zorv_test::CapturedLogs();
-  ASSERT_EQ(1u, logs.size()) << zorv_test::DumpLogs();
-  ExpectLine(logs[0], "%s:%d pthread_create failed, reason=%m",
-             std::string("pthread_create failed, reason=") + strerror(EAGAIN));
-
-  OneShot ended;
-  ASSERT_TRUE(ended.Start());
-  while (!ended._stop) usleep(100);
-  EXPECT_FALSE(ended.Stop());
-  EXPECT_FALSE(ended.DoAction(Record, nullptr));
-  EXPECT_EQ(kills, g_kills);
-  EXPECT_EQ(0, g_seen.calls);
-  EXPECT_EQ(0, pthread_join(ended._tid, nullptr));  // still joinable: Stop left it alone
-}
-
-TEST_F(ThreadTest, NullActionAndRaisedStopRefuseWithoutTakingTheSlot) {
-  Looper t;
-  ASSERT_TRUE(t.Start());
-  const int kills = g_kills;
-  // Held here: a refusal that took the slot first would deadlock.
-  ASSERT_EQ(0, pthread_mutex_lock(&Thread::_lock));
-  EXPECT_FALSE(t.DoAction(nullptr, "x"));
-  t._stop = true;
-  EXPECT_FALSE(t.DoAction(Record, "x"));
-  EXPECT_EQ(nullptr, Thread::_this);
-  ASSERT_EQ(0, pthread_mutex_unlock(&Thread::_lock));
-  EXPECT_EQ(kills, g_kills);
-  EXPECT_EQ(0, pthread_join(t._tid, nullptr));
-}
-
-TEST_F(ThreadTest, TextReachesTheWorkerAsACopyAndNoTextGivesNullAfterAFailedSend) {
-  Looper t;
-  ASSERT_TRUE(t.Start());
+TEST_F(ThreadTest, ActionsRunOnTheWorkerOneAtATime) {
+  Worker t, other;
+  ASSERT_TRUE(t.Start() && other.Start());
+  // A text reaches the action on the worker as an equal copy elsewhere; the
+  // action has run when DoAction returns.
   const char text[] = "queue changed";
   ASSERT_TRUE(t.DoAction(Record, text));
-  EXPECT_EQ(1, g_seen.calls);  // the action has run when DoAction returns
-  EXPECT_TRUE(pthread_equal(t._tid, g_seen.thread));
-  EXPECT_EQ(&t, g_seen.target);
-  EXPECT_STREQ(text, g_seen.text);
-  EXPECT_NE(text, g_seen.ptr);
-  EXPECT_EQ(nullptr, Thread::_data);
+  EXPECT_EQ(g_calls, 1);
+  EXPECT_TRUE(pthread_equal(g_seen.thread, t._tid) && g_seen.target == &t);
+  EXPECT_STREQ(g_seen.text, text);
+  EXPECT_NE(g_seen.ptr, text);
 
+  // A failed send drops its text: the next request without one gives null.
   g_fail_kill = ESRCH;
   EXPECT_FALSE(t.DoAction(Record, "lost"));
-  EXPECT_EQ(1, g_seen.calls);
-  const auto logs = zorv_test::CapturedLogs();
-  ASSERT_EQ(1u, logs.size()) << zorv_test::DumpLogs();
-  ExpectLine(logs[0], "%s:%d pthread_kill failed, reason=%s",
-             std::string("pthread_kill failed, reason=") + strerror(ESRCH));
-  struct sigaction now = {};
-  ASSERT_EQ(0, sigaction(SIGRTMAX - 1, nullptr, &now));
-  EXPECT_EQ(SIG_DFL, now.sa_handler);
-  EXPECT_EQ(nullptr, Thread::_data);
-  EXPECT_EQ(nullptr, Thread::_action);
-
+  struct sigaction now = {};  // the handler is reset
+  EXPECT_TRUE(sigaction(SIGRTMAX - 1, nullptr, &now) == 0 && now.sa_handler == SIG_DFL);
   ASSERT_TRUE(t.DoAction(Record, nullptr));
-  EXPECT_EQ(2, g_seen.calls);
-  EXPECT_EQ(nullptr, g_seen.ptr);
-  EXPECT_TRUE(pthread_equal(t._tid, g_seen.thread));
-}
+  EXPECT_EQ(g_calls, 2);
+  EXPECT_EQ(g_seen.ptr, nullptr);
+  EXPECT_TRUE(pthread_equal(g_seen.thread, t._tid));
+  EXPECT_EQ(Thread::_data, nullptr);
 
-std::atomic<bool> g_holding{false};
-std::atomic<bool> g_release{false};
-std::atomic<bool> g_overlap{false};
-
-void Hold(Thread*, char*) {
-  g_holding = true;
-  while (!g_release) {
-  }
-  g_holding = false;
-}
-
-void MarkOverlap(Thread* target, char* text) {
-  if (g_holding) g_overlap = true;
-  Record(target, text);
-}
-
-TEST_F(ThreadTest, RequestsOnTwoObjectsAreSerialised) {
-  Looper a;
-  Looper b;
-  ASSERT_TRUE(a.Start());
-  ASSERT_TRUE(b.Start());
-  std::thread first([&a] { EXPECT_TRUE(a.DoAction(Hold, nullptr)); });
-  while (!g_holding) usleep(100);
-  const int busy = pthread_mutex_trylock(&Thread::_lock);
-  if (busy == 0) pthread_mutex_unlock(&Thread::_lock);
-  EXPECT_EQ(EBUSY, busy);  // the slot stays taken while the action runs
-  std::thread second([&b] { EXPECT_TRUE(b.DoAction(MarkOverlap, "b")); });
-  usleep(20000);  // time for a request that does not wait to overtake
+  // Two requesters on two objects: the second waits for the first action.
+  std::thread first([&t] { EXPECT_TRUE(t.DoAction(Hold, nullptr)); });
+  while (!g_holding) sched_yield();
+  std::thread second([&other] { EXPECT_TRUE(other.DoAction(Record, "b")); });
+  std::this_thread::sleep_for(std::chrono::milliseconds(20));  // time to overtake
+  EXPECT_EQ(g_calls, 2);
   g_release = true;
   first.join();
   second.join();
-  EXPECT_FALSE(g_overlap);
-  EXPECT_EQ(1, g_seen.calls);
-  EXPECT_TRUE(pthread_equal(b._tid, g_seen.thread));
+  EXPECT_EQ(g_calls, 3);
+  EXPECT_TRUE(pthread_equal(g_seen.thread, other._tid));
+  EXPECT_EQ(Logs(),
+            "3 %s:%d pthread_kill failed, reason=%s = thread: pthread_kill failed, reason=" +
+                std::string(strerror(ESRCH)) + "\n");
+}
+
+// Start and Stop log the same id at LOG_LEVEL 7 only.  Idle, never created,
+// joined and ended objects refuse requests without a signal.
+TEST_F(ThreadTest, StartStopAndRefusals) {
+  Worker idle, failed, joined, ended(Worker::kReturn);
+  g_fail_create = EAGAIN;
+  EXPECT_FALSE(failed.Start());
+  EXPECT_EQ(failed._tid, pthread_t{});
+  ZORV::ZORVNOTIFYD::LOG_LEVEL = 7;
+  ASSERT_TRUE(joined.Start());
+  const std::string id = std::to_string(static_cast<unsigned long>(joined._tid));
+  ASSERT_EQ(pthread_mutex_lock(&Thread::_lock), 0);  // a refusal that took it would hang
+  EXPECT_FALSE(joined.DoAction(nullptr, "x"));
+  ASSERT_EQ(pthread_mutex_unlock(&Thread::_lock), 0);
+  ASSERT_TRUE(joined.Stop());
+  ZORV::ZORVNOTIFYD::LOG_LEVEL = 8;
+  ASSERT_TRUE(ended.Start());
+  while (!ended._stop) sched_yield();
+  const int kills = g_kills;
+  for (Worker* t : {&idle, &failed, &joined, &ended}) {
+    EXPECT_FALSE(t->DoAction(Record, "x") || t->Stop());
+  }
+  EXPECT_EQ(g_kills, kills);
+  EXPECT_EQ(pthread_join(ended._tid, nullptr), 0);  // still joinable: Stop left it alone
+  EXPECT_EQ(Logs(),
+            "3 %s:%d pthread_create failed, reason=%m = thread: pthread_create failed, reason=" +
+                std::string(strerror(EAGAIN)) +
+                "\n3 %s:%d thread start %lu = thread: thread start " + id +
+                "\n3 %s:%d thread stop %lu = thread: thread stop " + id + "\n");
+}
+
+TEST_F(ThreadTest, StopFromTheWorkerItselfFailsToJoin) {
+#if defined(__SANITIZE_THREAD__)
+  GTEST_SKIP() << "ThreadSanitizer's runtime can abort on joining a thread whose join of itself "
+                  "failed; the plain and ASan runs cover this case";
+#endif
+  Worker self(Worker::kStopSelf);
+  ASSERT_TRUE(self.Start());
+  ASSERT_EQ(pthread_join(self._tid, nullptr), 0);
+  EXPECT_EQ(self.self_stop, 0);
+  EXPECT_EQ(Logs(),
+            "3 %s:%d pthread_join failed, reason=%m = thread: pthread_join failed, reason=" +
+                std::string(strerror(EDEADLK)) + "\n");
 }
 
 TEST_F(ThreadTest, StopRightAfterStartAlwaysReturns) {
   for (int i = 0; i < 200; ++i) {
-    Looper looper;
-    ASSERT_TRUE(looper.Start());
-    ASSERT_TRUE(looper.Stop()) << i;
+    Worker loop, shot(Worker::kReturn);
+    ASSERT_TRUE(loop.Start());
+    ASSERT_TRUE(loop.Stop()) << i;
     // Racing Run's own return: delivered and joined, or refused and joinable.
-    OneShot shot;
     ASSERT_TRUE(shot.Start());
-    if (!shot.Stop()) {
-      ASSERT_EQ(0, pthread_join(shot._tid, nullptr)) << i;
-    }
+    ASSERT_TRUE(shot.Stop() || pthread_join(shot._tid, nullptr) == 0) << i;
   }
-}
-
-TEST_F(ThreadTest, StopFromTheWorkerItselfFailsToJoin) {
-  SelfStopper t;
-  ASSERT_TRUE(t.Start());
-  ASSERT_EQ(0, pthread_join(t._tid, nullptr));
-  EXPECT_FALSE(t.stopped);
-  const auto logs = zorv_test::CapturedLogs();
-  ASSERT_EQ(1u, logs.size()) << zorv_test::DumpLogs();
-  ExpectLine(logs[0], "%s:%d pthread_join failed, reason=%m",
-             std::string("pthread_join failed, reason=") + strerror(EDEADLK));
 }
 
 }  // namespace

@@ -4,7 +4,6 @@
 #include <stdio.h>
 
 #include <gmock/gmock.h>
-#include <gtest/gtest.h>
 
 #include "support/sandbox.h"
 

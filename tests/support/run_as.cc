@@ -1,263 +1,95 @@
-// Forked children with chosen ids, reporting back through a pipe.
+// Forked children with chosen ids, reporting back through shared memory.
 
 #include "support/run_as.h"
 
-#include <fcntl.h>
 #include <grp.h>
-#include <signal.h>
-#include <stdint.h>
+#include <stdio.h>
 #include <string.h>
+#include <sys/mman.h>
 #include <sys/wait.h>
 #include <unistd.h>
-
-#include <cerrno>
 
 namespace zorv_test {
 namespace {
 
-// Closes a descriptor when the scope ends, unless it was closed already.
-class Fd {
- public:
-  explicit Fd(int fd) : fd_(fd) {}
-  Fd(const Fd&) = delete;
-  Fd& operator=(const Fd&) = delete;
-  ~Fd() { Close(); }
-  int get() const { return fd_; }
-  void Close() {
-    if (fd_ >= 0) close(fd_);
-    fd_ = -1;
-  }
-
- private:
-  int fd_;
+// What the child reports, in memory it shares with the parent (zero-filled).
+struct Report {
+  char error[64];  // why the child could not set its ids, or ""
+  bool done;       // the child ran the function and reported
+  int result, err;
+  Ids after;
+  size_t size;          // bytes of |lines| in use
+  char lines[1 << 20];  // the captured lines, each as "priority\0format\0text\0"
 };
 
-// The report starts with a tag: a result, or the failure of a set-up step.
-constexpr char kResultTag = 'R';
-constexpr char kSetupFailedTag = 'E';
-
-void PutInt(std::string& out, int64_t value) {
-  uint32_t bits = static_cast<uint32_t>(value);
-  out.append(reinterpret_cast<const char*>(&bits), sizeof(bits));
-}
-
-void PutString(std::string& out, const std::string& value) {
-  PutInt(out, static_cast<int64_t>(value.size()));
-  out += value;
-}
-
-// Reads what PutInt and PutString wrote; ok() turns false on a short report.
-class Reader {
- public:
-  explicit Reader(const std::string& data) : data_(data) {}
-  uint32_t Int() {
-    uint32_t bits = 0;
-    if (!Take(sizeof(bits))) return 0;
-    memcpy(&bits, data_.data() + pos_ - sizeof(bits), sizeof(bits));
-    return bits;
-  }
-  std::string String() {
-    uint32_t size = Int();
-    if (!Take(size)) return std::string();
-    return data_.substr(pos_ - size, size);
-  }
-  char Tag() { return Take(1) ? data_[pos_ - 1] : '\0'; }
-  bool ok() const { return ok_; }
-  bool AtEnd() const { return pos_ == data_.size(); }
-
- private:
-  bool Take(size_t size) {
-    if (!ok_ || data_.size() - pos_ < size) {
-      ok_ = false;
-      return false;
-    }
-    pos_ += size;
-    return true;
-  }
-  const std::string& data_;
-  size_t pos_ = 0;
-  bool ok_ = true;
-};
-
-void PutIds(std::string& out, const Ids& ids) {
-  for (int64_t id : {ids.ruid, ids.euid, ids.suid, ids.rgid, ids.egid, ids.sgid}) PutInt(out, id);
-}
-
-Ids GetIds(Reader& in) {
-  Ids ids;
-  ids.ruid = in.Int();
-  ids.euid = in.Int();
-  ids.suid = in.Int();
-  ids.rgid = in.Int();
-  ids.egid = in.Int();
-  ids.sgid = in.Int();
-  return ids;
-}
-
-bool WriteAll(int fd, const std::string& data) {
-  size_t done = 0;
-  while (done < data.size()) {
-    ssize_t n = write(fd, data.data() + done, data.size() - done);
-    if (n < 0 && errno == EINTR) continue;
-    if (n <= 0) return false;
-    done += static_cast<size_t>(n);
-  }
-  return true;
-}
-
-std::string ReadAll(int fd) {
-  std::string data;
-  char buffer[4096];
-  for (;;) {
-    ssize_t n = read(fd, buffer, sizeof(buffer));
-    if (n < 0 && errno == EINTR) continue;
-    if (n <= 0) return data;
-    data.append(buffer, static_cast<size_t>(n));
-  }
-}
-
-// Returns the name of the call that failed, with its errno in |err|, or
-// nullptr.
-const char* SetIds(const Ids& ids, int& err) {
-  const char* failed = nullptr;
-  if (setgroups(0, nullptr) != 0) {
-    failed = "setgroups";
-  } else if (setresgid(ids.rgid, ids.egid, ids.sgid) != 0) {
-    failed = "setresgid";
-  } else if (setresuid(ids.ruid, ids.euid, ids.suid) != 0) {
-    failed = "setresuid";
-  }
-  err = errno;
-  return failed;
-}
-
-// The child's side: never returns.
-[[noreturn]] void ChildMain(int report_fd, const Ids* ids, const std::function<int()>& fn) {
+[[noreturn]] void Child(Report& report, const Ids& ids, const std::function<int()>& fn) {
   ClearLogs();
-  std::string report;
-  int setup_err = 0;
-  const char* failed_step = ids != nullptr ? SetIds(*ids, setup_err) : nullptr;
-  if (failed_step != nullptr) {
-    report += kSetupFailedTag;
-    PutInt(report, setup_err);
-    PutString(report, failed_step);
-    _exit(WriteAll(report_fd, report) ? 0 : 2);
+  const char* failed = setgroups(0, nullptr) != 0                     ? "setgroups"
+                       : setresgid(ids.rgid, ids.egid, ids.sgid) != 0 ? "setresgid"
+                       : setresuid(ids.ruid, ids.euid, ids.suid) != 0 ? "setresuid"
+                                                                      : nullptr;
+  if (failed != nullptr) {
+    snprintf(report.error, sizeof(report.error), "%s failed: %s", failed, strerror(errno));
+    _exit(0);
   }
   errno = 0;
-  int result = fn();
-  int err = errno;
-  Ids after = CurrentIds();
-  std::vector<LogLine> logs = CapturedLogs();
-  report += kResultTag;
-  PutInt(report, result);
-  PutInt(report, err);
-  PutIds(report, after);
-  PutInt(report, static_cast<int64_t>(logs.size()));
-  for (const LogLine& line : logs) {
-    PutInt(report, line.priority);
-    PutString(report, line.format);
-    PutString(report, line.text);
+  report.result = fn();
+  report.err = errno;
+  getresuid(&report.after.ruid, &report.after.euid, &report.after.suid);
+  getresgid(&report.after.rgid, &report.after.egid, &report.after.sgid);
+  for (const LogLine& line : CapturedLogs()) {
+    const std::string fields =
+        std::to_string(line.priority) + '\0' + line.format + '\0' + line.text + '\0';
+    if (report.size + fields.size() > sizeof(report.lines)) _exit(3);
+    report.size += fields.copy(report.lines + report.size, fields.size());
   }
-  _exit(WriteAll(report_fd, report) ? 0 : 2);
-}
-
-std::string DescribeStatus(int status) {
-  if (WIFSIGNALED(status)) return "child killed by signal " + std::to_string(WTERMSIG(status));
-  if (WIFEXITED(status)) return "child exited with status " + std::to_string(WEXITSTATUS(status));
-  return "child stopped";
-}
-
-// Fills |result| from the report and the wait status.
-void Decode(const std::string& report, int status, ChildResult& result) {
-  if (!WIFEXITED(status) || WEXITSTATUS(status) != 0) {
-    result.error = DescribeStatus(status);
-    return;
-  }
-  Reader in(report);
-  char tag = in.Tag();
-  if (tag == kSetupFailedTag) {
-    int err = static_cast<int>(in.Int());
-    std::string step = in.String();
-    result.error = step + " failed: " + strerror(err);
-    return;
-  }
-  if (tag != kResultTag) {
-    result.error = "child exited without reporting";
-    return;
-  }
-  result.result = static_cast<int>(in.Int());
-  result.err = static_cast<int>(in.Int());
-  result.after = GetIds(in);
-  uint32_t count = in.Int();
-  for (uint32_t i = 0; i < count && in.ok(); ++i) {
-    LogLine line;
-    line.priority = static_cast<int>(in.Int());
-    line.format = in.String();
-    line.text = in.String();
-    result.logs.push_back(std::move(line));
-  }
-  if (!in.ok() || !in.AtEnd()) {
-    result.error = "child sent a malformed report";
-    return;
-  }
-  result.exited = true;
-}
-
-ChildResult Run(const Ids* ids, const std::function<int()>& fn) {
-  ChildResult result{false, 0, 0, Ids{}, {}, std::string()};
-  int pipe_fds[2];
-  if (pipe2(pipe_fds, O_CLOEXEC) != 0) {
-    result.error = std::string("pipe2: ") + strerror(errno);
-    return result;
-  }
-  Fd read_end(pipe_fds[0]);
-  Fd write_end(pipe_fds[1]);
-  pid_t pid = fork();
-  if (pid < 0) {
-    result.error = std::string("fork: ") + strerror(errno);
-    return result;
-  }
-  if (pid == 0) {
-    read_end.Close();
-    ChildMain(write_end.get(), ids, fn);
-  }
-  // The parent's write end must go, or reading never sees the end.
-  write_end.Close();
-  std::string report = ReadAll(read_end.get());
-  int status = 0;
-  while (waitpid(pid, &status, 0) < 0) {
-    if (errno != EINTR) {
-      result.error = std::string("waitpid: ") + strerror(errno);
-      return result;
-    }
-  }
-  Decode(report, status, result);
-  return result;
+  report.done = true;
+  _exit(0);
 }
 
 }  // namespace
 
-bool operator==(const Ids& a, const Ids& b) {
-  return a.ruid == b.ruid && a.euid == b.euid && a.suid == b.suid && a.rgid == b.rgid &&
-         a.egid == b.egid && a.sgid == b.sgid;
+ChildResult RunAs(const Ids& ids, const std::function<int()>& fn) {
+  void* shared =
+      mmap(nullptr, sizeof(Report), PROT_READ | PROT_WRITE, MAP_SHARED | MAP_ANONYMOUS, -1, 0);
+  if (shared == MAP_FAILED) return {false, 0, 0, Ids{}, {}, "mmap failed"};
+  const Report& report = *static_cast<Report*>(shared);
+  const pid_t pid = fork();
+  if (pid == 0) Child(*static_cast<Report*>(shared), ids, fn);
+  int status = 0;
+  while (pid > 0 && waitpid(pid, &status, 0) < 0 && errno == EINTR) {
+  }
+  ChildResult result{false, report.result, report.err, report.after, {}, report.error};
+  if (pid < 0) {
+    result.error = "fork failed";
+  } else if (WIFSIGNALED(status)) {
+    result.error = "child killed by signal " + std::to_string(WTERMSIG(status));
+  } else if (WEXITSTATUS(status) != 0) {
+    result.error = "child exited with status " + std::to_string(WEXITSTATUS(status));
+  } else if (!report.done && result.error.empty()) {
+    result.error = "child exited without reporting";
+  }
+  result.exited = result.error.empty();
+  // Braced initializers are evaluated in order.
+  const char* field = report.lines;
+  auto next = [&field] {
+    std::string value = field;
+    field += value.size() + 1;
+    return value;
+  };
+  while (result.exited && field < report.lines + report.size) {
+    result.logs.push_back({std::stoi(next()), next(), next()});
+  }
+  munmap(shared, sizeof(Report));
+  return result;
 }
 
-bool operator!=(const Ids& a, const Ids& b) { return !(a == b); }
+// Six ids of one type, without padding.
+bool operator==(const Ids& a, const Ids& b) { return memcmp(&a, &b, sizeof(Ids)) == 0; }
 
 std::ostream& operator<<(std::ostream& out, const Ids& ids) {
   return out << "uid " << ids.ruid << '/' << ids.euid << '/' << ids.suid << " gid " << ids.rgid
              << '/' << ids.egid << '/' << ids.sgid;
 }
-
-Ids CurrentIds() {
-  Ids ids{};
-  getresuid(&ids.ruid, &ids.euid, &ids.suid);
-  getresgid(&ids.rgid, &ids.egid, &ids.sgid);
-  return ids;
-}
-
-ChildResult RunAs(const Ids& ids, const std::function<int()>& fn) { return Run(&ids, fn); }
-
-ChildResult RunInChild(const std::function<int()>& fn) { return Run(nullptr, fn); }
 
 }  // namespace zorv_test

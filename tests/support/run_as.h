@@ -10,7 +10,6 @@
 #include <functional>
 #include <ostream>
 #include <string>
-#include <vector>
 
 #include "support/syslog_capture.h"
 
@@ -23,18 +22,14 @@ struct Ids {
 };
 
 bool operator==(const Ids& a, const Ids& b);
-bool operator!=(const Ids& a, const Ids& b);
 // Prints "uid r/e/s gid r/e/s", for failure messages.
 std::ostream& operator<<(std::ostream& out, const Ids& ids);
 
-// The ids of the calling process (getresuid/getresgid).
-Ids CurrentIds();
-
 // What a child reported.
 struct ChildResult {
-  bool exited;                // the child set its ids, ran the function, reported and
-                              // exited normally; false when it crashed, was killed, exited
-                              // on its own or could not set its ids (see |error|)
+  bool exited;                // the child set its ids, ran the function, reported and exited
+                              // normally; false when it could not set its ids, crashed, was
+                              // killed or exited on its own (see |error|)
   int result;                 // the int the function returned
   int err;                    // errno right after the function returned
   Ids after;                  // ids right after the function returned
@@ -43,15 +38,12 @@ struct ChildResult {
 };
 
 // Forks.  The child forgets the captured lines, drops its supplementary
-// groups, sets its gids then its uids to |ids| with setresgid/setresuid
-// (the caller must be root), runs |fn|, records errno and its ids at once,
-// sends everything to the parent through a pipe and _exit(0)s.  Returns
-// only after the child has been reaped.  gtest assertions made inside |fn|
-// are lost with the child: report through the result instead.
+// groups, sets its gids then its uids to |ids| with setresgid/setresuid (the
+// caller must be root), runs |fn|, records errno and its ids at once, sends
+// everything to the parent through a pipe and _exit(0)s.  Returns after the
+// child has been reaped.  gtest assertions made inside |fn| are lost with the
+// child: report through the result instead.
 ChildResult RunAs(const Ids& ids, const std::function<int()>& fn);
-
-// As RunAs, but the child keeps the caller's ids and groups.
-ChildResult RunInChild(const std::function<int()>& fn);
 
 }  // namespace zorv_test
 

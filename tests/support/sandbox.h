@@ -15,39 +15,31 @@
 
 namespace zorv_test {
 
-// Sets the sandbox up.  Called by main() before any test and before any
-// thread exists.  Enters a private mount namespace, mounts the overlay on
-// /usr (upper and work directories on a tmpfs hidden under the new /tmp), a
-// fresh tmpfs on /tmp, and installs the fake systemctl.  True on success.
-// On failure records the reason, undoes the mounts it made and returns
-// false; the host is never touched.  Calling it again after a success does
-// nothing and returns true.
+// Sets the sandbox up; main() calls it before any test and any thread.  On
+// failure it records the reason, undoes its mounts and returns false; the
+// host is never touched.
 bool EnterSandbox();
 
 // True once EnterSandbox has succeeded.
 bool SandboxActive();
 
-// Why the sandbox is not active ("EnterSandbox was not called" before the
-// first call).  The pointer stays valid for the life of the program.
+// Why the sandbox is not active.
 const char* SandboxSkipReason();
 
-// Returns the store of the sandbox to its initial state: removes
-// /usr/zorv, /usr/local/etc/zorvnotifyd and /tmp/zorvnotifyd_monitor_q.lock
-// (whole trees, whatever their type), reinstalls the fake systemctl and
-// empties its records, and sets its exit status back to 0.  Does nothing
-// when the sandbox is inactive.  A step that fails is reported as a
-// non-fatal test failure.  Must run with effective root (tests call it in
-// SetUp).
+// Returns the store to its initial state: removes /usr/zorv,
+// /usr/local/etc/zorvnotifyd and /tmp/zorvnotifyd_monitor_q.lock (whole
+// trees), reinstalls the fake systemctl, empties its records and sets its
+// exit status back to 0.  A failure throws (gtest reports it as a failure of
+// the test).  Needs effective root; does nothing when the sandbox is inactive.
 void ResetStore();
 
-// The arguments of every fake systemctl call since the last ResetStore,
-// one entry per call, joined by single spaces (e.g. "--no-block start
-// zorvnotifyd").  Empty when the sandbox is inactive.
+// The arguments of every fake systemctl call since the last ResetStore, one
+// entry per call, joined by single spaces ("--no-block start zorvnotifyd").
 std::vector<std::string> SystemctlCalls();
 
-// What a fake systemctl process saw about itself when it started.  /bin/sh
-// drops privileges when its real and effective ids differ, so the ids show
-// the privileges systemctl would really run with.
+// What a fake systemctl process saw about itself.  /bin/sh drops privileges
+// when its real and effective ids differ, so the ids are those systemctl
+// would really run with.
 struct SystemctlProcess {
   uid_t ruid, euid, suid;
   gid_t rgid, egid, sgid;
@@ -56,22 +48,19 @@ struct SystemctlProcess {
   bool stdout_null;      // descriptor 1 is /dev/null
 };
 
-// One entry per fake systemctl process since the last ResetStore.  Under
-// concurrent calls the order may differ from SystemctlCalls().
+// One entry per fake systemctl process since the last ResetStore.
 std::vector<SystemctlProcess> SystemctlProcesses();
 
-// Makes every later fake systemctl call exit with |status| (0..255).
+// Makes every later fake systemctl call exit with |status| (0..255); throws on failure.
 void SetSystemctlExitStatus(int status);
 
-// Removes /usr/bin/systemctl, as on a host without it.  ResetStore puts it
-// back.
+// Removes /usr/bin/systemctl, as on a host without it; ResetStore puts it back.
 void RemoveSystemctl();
 
 }  // namespace zorv_test
 
-// Skips the current test when the sandbox is inactive.  Use it at the top of
-// every test (or in SetUp) that touches /usr/zorv, /usr/local/etc, /tmp or
-// the service: without the sandbox those are the host's.
+// Skips the current test when the sandbox is inactive: without it /usr,
+// /tmp and the service are the host's.
 #define ZORV_REQUIRE_SANDBOX()                                                     \
   do {                                                                             \
     if (!::zorv_test::SandboxActive()) {                                           \

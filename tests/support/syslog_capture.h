@@ -1,11 +1,10 @@
 // Capture of syslog output in test programs.
 //
 // The test support defines syslog, vsyslog, __syslog_chk and __vsyslog_chk
-// (and openlog/closelog) in the test executable.  Test programs export their
-// symbols, and the executable comes first in dynamic symbol lookup, so every
-// call made inside libzorvnotifyd.so lands here instead of in the C library.
-// Nothing reaches the system log.  Set the environment variable
-// ZORV_TEST_ECHO_LOGS to also echo each captured line to stderr.
+// in the test executable.  Test programs export their symbols, and the
+// executable comes first in dynamic symbol lookup, so every call made inside
+// libzorvnotifyd.so lands here instead of in the C library.  Nothing reaches
+// the system log.
 #ifndef ZORVNOTIFYD_TESTS_SUPPORT_SYSLOG_CAPTURE_H_
 #define ZORVNOTIFYD_TESTS_SUPPORT_SYSLOG_CAPTURE_H_
 
@@ -23,7 +22,7 @@ struct LogLine {
 };
 
 // Every line captured since the last ClearLogs, in call order.  Safe to call
-// from any thread.
+// from any thread, and in a child forked while another thread was logging.
 std::vector<LogLine> CapturedLogs();
 
 // Forgets every captured line.
@@ -32,13 +31,8 @@ void ClearLogs();
 // The captured lines whose text contains |needle|, in call order.
 std::vector<LogLine> LogsContaining(const std::string& needle);
 
-// All captured lines rendered one per line as "<priority> <text>", for
-// failure messages.
+// All captured lines, one per line as "<priority> <text>", for failure messages.
 std::string DumpLogs();
-
-// Number of openlog calls seen since the program started (the library must
-// never call it).
-int OpenlogCalls();
 
 }  // namespace zorv_test
 
