@@ -124,6 +124,12 @@ bool JsonFromFile(Json::Value& value, const std::string& path) {
 bool JsonToFile(const Json::Value& value, const std::string& path) {
   Json::StreamWriterBuilder builder;
   builder["indentation"] = "  ";
+  // Strings go out byte for byte (only quotes, backslashes and control
+  // bytes are escaped).  By default the writer decodes them as UTF-8 and
+  // writes \u escapes, which replaces any byte that is not valid UTF-8 and
+  // can swallow the bytes after it ("caf\xe9/x" came back as "caf\u9bf8"),
+  // so paths and names that are not UTF-8 would not survive a save.
+  builder["emitUTF8"] = true;
   std::string text = Json::writeString(builder, value);
   text.push_back('\n');
 
