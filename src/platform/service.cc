@@ -14,6 +14,8 @@
 #include <time.h>
 #include <unistd.h>
 
+#include <cstdint>
+
 #include "platform/platform.h"
 #include "platform/scoped.h"
 
@@ -55,10 +57,12 @@ constexpr int kTimeoutMs = 10000;
   _exit(127);
 }
 
-long MonotonicMs() {
+// 64 bits: with a 32-bit long and time_t (armhf), seconds * 1000 overflows
+// once the system has been up for 24.8 days.
+std::int64_t MonotonicMs() {
   struct timespec now;
   clock_gettime(CLOCK_MONOTONIC, &now);
-  return now.tv_sec * 1000L + now.tv_nsec / 1000000L;
+  return std::int64_t{now.tv_sec} * 1000 + now.tv_nsec / 1000000;
 }
 
 enum class WaitResult { kExited, kTimedOut, kLost };
@@ -66,12 +70,12 @@ enum class WaitResult { kExited, kTimedOut, kLost };
 // Waits until |pid| has exited (its status in |status|) or |deadline_ms|
 // has passed.  kLost when the child cannot be waited for (for instance
 // because the host process ignores SIGCHLD and the kernel reaped it).
-WaitResult WaitUntil(pid_t pid, long deadline_ms, int& status) {
+WaitResult WaitUntil(pid_t pid, std::int64_t deadline_ms, int& status) {
 #ifdef SYS_pidfd_open
   ScopedFd pidfd(static_cast<int>(syscall(SYS_pidfd_open, pid, 0)));  // close-on-exec
   if (pidfd.valid()) {
     for (;;) {
-      const long left = deadline_ms - MonotonicMs();
+      const std::int64_t left = deadline_ms - MonotonicMs();
       if (left <= 0) break;
       struct pollfd item = {pidfd.get(), POLLIN, 0};
       const int ready = poll(&item, 1, static_cast<int>(left));

@@ -22,6 +22,8 @@ namespace ZORVNOTIFYD {
 static_assert(sizeof(std::atomic<bool>) == 1, "_stop must be one byte");
 static_assert(std::atomic<bool>::is_always_lock_free, "_stop must be lock-free");
 static_assert(std::atomic<Thread*>::is_always_lock_free, "the target must be lock-free");
+// The start and stop lines print the worker's id with "%lu".
+static_assert(sizeof(pthread_t) <= sizeof(unsigned long), "pthread_t must fit an unsigned long");
 
 pthread_mutex_t Thread::_lock = PTHREAD_MUTEX_INITIALIZER;
 Thread* Thread::_this = nullptr;
