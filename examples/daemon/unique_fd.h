@@ -1,0 +1,42 @@
+// A file descriptor owned by exactly one object and closed with it.
+#ifndef ZORVNOTIFYD_EXAMPLES_DAEMON_UNIQUE_FD_H_
+#define ZORVNOTIFYD_EXAMPLES_DAEMON_UNIQUE_FD_H_
+
+#include <unistd.h>
+
+#include <utility>
+
+namespace zorvnotifyd {
+
+// Owns |fd| (negative: nothing) and closes it when destroyed or replaced.
+// Move-only.
+class UniqueFd {
+ public:
+  explicit UniqueFd(int fd = -1) : fd_(fd) {}
+  UniqueFd(UniqueFd&& other) noexcept : fd_(std::exchange(other.fd_, -1)) {}
+  UniqueFd& operator=(UniqueFd&& other) noexcept {
+    if (this != &other) {
+      Reset();
+      fd_ = std::exchange(other.fd_, -1);
+    }
+    return *this;
+  }
+  UniqueFd(const UniqueFd&) = delete;
+  UniqueFd& operator=(const UniqueFd&) = delete;
+  ~UniqueFd() { Reset(); }
+
+  // The descriptor, still owned by this object.
+  int get() const { return fd_; }
+  // Closes the descriptor now; get() then returns -1.
+  void Reset() {
+    if (fd_ >= 0) close(fd_);
+    fd_ = -1;
+  }
+
+ private:
+  int fd_;
+};
+
+}  // namespace zorvnotifyd
+
+#endif  // ZORVNOTIFYD_EXAMPLES_DAEMON_UNIQUE_FD_H_
