@@ -18,12 +18,6 @@ using ZORV::ZORVNOTIFYD::MonitorQueue;
 
 namespace {
 
-constexpr QueueType kTypes[] = {
-    ZORV::ZORVNOTIFYD::MONITOR_QUEUE_TYPE_SHARE_DIR,
-    ZORV::ZORVNOTIFYD::MONITOR_QUEUE_TYPE_ETC_DIR,
-    ZORV::ZORVNOTIFYD::MONITOR_QUEUE_TYPE_LOCAL_ETC_DIR,
-};
-
 // The names of the regular files (links followed) of |dir| whose name does
 // not begin with ".", sorted: the files the library's catalogue reads.
 std::vector<std::string> QueueFiles(const std::string& dir) {
@@ -46,20 +40,9 @@ std::vector<std::string> QueueFiles(const std::string& dir) {
 
 }  // namespace
 
-const char* TypeName(QueueType type) {
-  switch (type) {
-    case ZORV::ZORVNOTIFYD::MONITOR_QUEUE_TYPE_SHARE_DIR:
-      return "share";
-    case ZORV::ZORVNOTIFYD::MONITOR_QUEUE_TYPE_LOCAL_ETC_DIR:
-      return "local-etc";
-    default:
-      return "etc";
-  }
-}
-
 Catalogue LoadCatalogue() {
   Catalogue catalogue;
-  for (QueueType type : kTypes) {
+  for (QueueType type : zorvnotifyctl::kAllQueueTypes) {
     for (const std::string& file : QueueFiles(MonitorQueue::GetConfDir(type))) {
       std::vector<MonitorQueue> queues;
       MonitorQueue::List(queues, file, type);
@@ -80,7 +63,7 @@ std::vector<WatchRoot> WatchRoots(const Catalogue& catalogue) {
 bool CatalogueWatch::Open() {
   inotify_ = OpenInotify();
   if (inotify_.get() < 0) return false;
-  for (QueueType type : kTypes) {
+  for (QueueType type : zorvnotifyctl::kAllQueueTypes) {
     const std::string dir = MonitorQueue::GetConfDir(type);
     const uint32_t mask = IN_CLOSE_WRITE | IN_MOVED_TO | IN_DELETE | IN_MOVED_FROM | IN_ONLYDIR;
     if (inotify_add_watch(inotify_.get(), dir.c_str(), mask) < 0) {

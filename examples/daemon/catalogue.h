@@ -8,12 +8,13 @@
 #include <vector>
 
 #include "monitor_queue.h"
+#include "queue_types.h"
 #include "unique_fd.h"
 #include "watch_tree.h"
 
 namespace zorvnotifyd {
 
-using QueueType = ZORV::ZORVNOTIFYD::_tag_monitor_queue_type_;
+using zorvnotifyctl::QueueType;
 
 // One queue and where it is stored.
 struct CatalogueQueue {
@@ -23,9 +24,6 @@ struct CatalogueQueue {
 };
 
 using Catalogue = std::vector<CatalogueQueue>;
-
-// "share", "etc" or "local-etc".
-const char* TypeName(QueueType type);
 
 // Reads every queue of every type: types in the order share, etc,
 // local-etc; within a type the regular files whose name does not begin

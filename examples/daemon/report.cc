@@ -36,7 +36,7 @@ constexpr BitName kBitNames[] = {
 std::string JsonLine(const CatalogueQueue& entry, const std::string& path, uint32_t mask) {
   Json::Value line(Json::objectValue);
   line["queue"] = entry.queue._name;
-  line["type"] = TypeName(entry.type);
+  line["type"] = zorvnotifyctl::QueueTypeName(entry.type);
   line["file"] = entry.file;
   line["path"] = path;
   line["mask"] = Json::UInt(mask);
@@ -67,8 +67,9 @@ void ReportEvent(Catalogue& catalogue, const std::string& path, uint32_t mask, b
   for (CatalogueQueue& entry : catalogue) {
     if (!entry.queue.IsMonitoring(path, mask)) continue;
     const std::string line = json ? JsonLine(entry, path, mask)
-                                  : "queue " + entry.queue._name + " [" + TypeName(entry.type) +
-                                        "/" + entry.file + "]: " + MaskNames(mask) + " " + path;
+                                  : "queue " + entry.queue._name + " [" +
+                                        zorvnotifyctl::QueueTypeName(entry.type) + "/" +
+                                        entry.file + "]: " + MaskNames(mask) + " " + path;
     printf("%s\n", line.c_str());
     fflush(stdout);
   }
