@@ -10,7 +10,6 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <chrono>
 #include <cstdlib>
 #include <fstream>
 #include <sstream>
@@ -26,7 +25,6 @@
 namespace {
 
 using namespace ZORV::ZORVNOTIFYD;  // NOLINT
-using Clock = std::chrono::steady_clock;
 using Lines = std::vector<std::string>;
 
 // The daemon as a child process with --json.
@@ -155,13 +153,12 @@ TEST(DaemonTest, ReportsToEachQueueExactlyItsEventsAndFollowsTheCatalogue) {
   for (const char* path : {"/tmp/d/inner/z", "/tmp/w/marker"}) std::ofstream(path) << "x";
   Expect(daemon, {E('a', "w/marker", kCreate), E('a', "w/marker", kModify)});
 
-  // A queue registered now is served within a second, and the reload loses
-  // no event of the unchanged tree.
-  const Clock::time_point registered = Clock::now();
+  // A queue registered now is served without a restart (the reload follows
+  // the queue file's own inotify event), and the reload loses no event of
+  // the unchanged tree.
   Register("c", "fc", MONITOR_QUEUE_TYPE_LOCAL_ETC_DIR, "/tmp/w2", kCreate);
   std::ofstream("/tmp/w/during") << "x";
   ASSERT_TRUE(daemon.Logged("catalogue reloaded: watching 3 directories for 3 queues"));
-  EXPECT_LT(Clock::now() - registered, std::chrono::seconds(1));
   std::ofstream("/tmp/w2/p") << "x";
   Expect(daemon,
          {E('a', "w/during", kCreate), E('a', "w/during", kModify), E('c', "w2/p", kCreate)});

@@ -75,7 +75,13 @@ bool WatchTree::Sync(const std::vector<WatchRoot>& roots) {
   limit_hit_ = false;
   std::set<std::string> dirs, skipped;
   for (const WatchRoot& root : roots_) {
-    if (root.mask == 0 || dirs.count(root.path) != 0 || skipped.count(root.path) != 0) continue;
+    // A queue's mask may hold any bits; only inotify's event kinds are
+    // asked of the kernel (IN_ONESHOT, IN_MASK_CREATE and the like would
+    // break the watch for every queue on the tree).
+    if ((root.mask & IN_ALL_EVENTS) == 0 || dirs.count(root.path) != 0 ||
+        skipped.count(root.path) != 0) {
+      continue;
+    }
     struct stat st;
     const char* why = nullptr;
     if (root.path.empty() || root.path[0] != '/') {
@@ -112,7 +118,16 @@ bool WatchTree::ReadEvents(const EventSink& sink) {
   for (;;) {
     const ssize_t n = read(fd(), buffer, sizeof(buffer));
     if (n < 0 && errno == EINTR) continue;
-    if (n < 0 && errno == EAGAIN) break;
+    if (n < 0 && errno == EAGAIN) {
+      // Every event caused while a new directory was scanned was queued
+      // before the scan ended, so it has been read by now: the names the
+      // scan handed on must not swallow later events.
+      if (scanned_any_) {
+        for (auto& [wd, watch] : watches_) watch.scanned.clear();
+        scanned_any_ = false;
+      }
+      break;
+    }
     if (n <= 0) {
       syslog(LOG_ERR, "reading inotify events failed: %s", strerror(errno));
       return false;
@@ -129,7 +144,11 @@ bool WatchTree::ReadEvents(const EventSink& sink) {
   }
   if (overflow) {
     syslog(LOG_WARNING, "inotify event queue overflowed, events were lost: rescanning the trees");
-    Sync(std::vector<WatchRoot>(roots_));
+    // Deletions may be among the lost events, so no watch is trusted: all
+    // are dropped and the trees watched afresh.
+    const std::vector<WatchRoot> roots = roots_;
+    Clear();
+    Sync(roots);
   }
   return true;
 }
@@ -168,7 +187,9 @@ uint32_t WatchTree::MaskFor(const std::string& dir) const {
   uint32_t mask = 0;
   for (const WatchRoot& root : roots_) {
     const size_t n = root.path.size();
-    if (dir.compare(0, n, root.path) == 0 && (dir.size() == n || dir[n] == '/')) mask |= root.mask;
+    if (dir.compare(0, n, root.path) == 0 && (dir.size() == n || dir[n] == '/')) {
+      mask |= root.mask & IN_ALL_EVENTS;
+    }
   }
   return mask;
 }
@@ -205,6 +226,7 @@ void WatchTree::AddAndScan(const std::string& dir,
     const auto watch = watches_.find(wd);
     if (watch == watches_.end()) return;
     watch->second.scanned.insert(entry.name);
+    scanned_any_ = true;
     const std::string child = dir + "/" + entry.name;
     found->emplace_back(child, entry.is_dir ? IN_CREATE | IN_ISDIR : IN_CREATE);
     if (entry.is_dir) AddAndScan(child, found);

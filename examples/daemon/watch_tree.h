@@ -99,6 +99,7 @@ class WatchTree {
   std::map<std::string, int> by_path_;  // watch descriptor by path
   std::set<std::string> skipped_;       // roots the last Sync could not watch
   bool limit_hit_ = false;
+  bool scanned_any_ = false;  // some watch holds names handed on by a scan
 };
 
 }  // namespace zorvnotifyd

@@ -81,6 +81,11 @@ int Serve(bool json) {
       return 0;
     }
     if ((fds[1].revents & POLLIN) && !tree.ReadEvents(report)) return 1;
+    if (ferror(stdout)) {
+      syslog(LOG_ERR, "cannot write the report to standard output: stopping");
+      tree.Clear();
+      return 1;
+    }
     if ((fds[2].revents & POLLIN) && catalogue_watch.ReadChanges()) {
       catalogue = LoadCatalogue();
       tree.Sync(WatchRoots(catalogue));
@@ -107,6 +112,9 @@ int main(int argc, char** argv) {
     }
     json = true;
   }
+  // A reader of the report that goes away (zorvnotifyd | head) ends the
+  // daemon through a write error, not by a signal that skips the clean-up.
+  signal(SIGPIPE, SIG_IGN);
   openlog("zorvnotifyd", LOG_PID | LOG_PERROR, LOG_DAEMON);
   if (geteuid() != 0) {
     syslog(LOG_ERR, "must run as root: the catalogue and the watched trees are root's");
