@@ -131,6 +131,7 @@ class ThreadTest : public ::testing::Test {
                       "signal, so no worker-thread test can run here";
     }
     zorv_test::ClearLogs();
+    g_calls = 0;
   }
   void TearDown() override { ZORV::ZORVNOTIFYD::LOG_LEVEL = 3; }
   static inline std::string request_signal_problem_;
@@ -160,9 +161,15 @@ TEST_F(ThreadTest, ActionsRunOnTheWorkerOneAtATime) {
   EXPECT_EQ(Thread::_data, nullptr);
 
   // Two requesters on two objects: the second waits for the first action.
+  g_holding = g_release = false;
   std::thread first([&t] { EXPECT_TRUE(t.DoAction(Hold, nullptr)); });
   while (!g_holding) sched_yield();
-  std::thread second([&other] { EXPECT_TRUE(other.DoAction(Record, "b")); });
+  std::atomic<bool> asking{false};
+  std::thread second([&other, &asking] {
+    asking = true;
+    EXPECT_TRUE(other.DoAction(Record, "b"));
+  });
+  while (!asking) sched_yield();
   std::this_thread::sleep_for(std::chrono::milliseconds(20));  // time to overtake
   EXPECT_EQ(g_calls, 2);
   g_release = true;
