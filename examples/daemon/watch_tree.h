@@ -48,6 +48,8 @@ class WatchTree {
   int fd() const { return inotify_.get(); }
   // The number of directories watched.
   size_t size() const { return watches_.size(); }
+  // True when the last Sync left a root unwatched (missing, not a directory).
+  bool missing_roots() const { return !skipped_.empty(); }
 
   // Makes the watches match |roots|: every directory at or below a root
   // whose mask is not 0 is watched with the union of the masks of the roots

@@ -36,6 +36,8 @@ const char kUsage[] =
     "catalogue when a queue file changes and stops on SIGTERM or SIGINT (status 0).\n"
     "Log lines go to syslog and to standard error.\n";
 
+constexpr int kMissingRootRetryMs = 5000;
+
 // Blocks SIGTERM and SIGINT and returns a descriptor that reads them, or an
 // empty one (logged).
 UniqueFd OpenSignals() {
@@ -68,10 +70,17 @@ int Serve(bool json) {
   struct pollfd fds[] = {
       {signals.get(), POLLIN, 0}, {tree.fd(), POLLIN, 0}, {catalogue_watch.fd(), POLLIN, 0}};
   for (;;) {
-    if (poll(fds, 3, -1) < 0) {
+    // A configured tree that does not exist (yet) is looked for again every
+    // few seconds, so that a share mounted or created later gets watched.
+    const int ready = poll(fds, 3, tree.missing_roots() ? kMissingRootRetryMs : -1);
+    if (ready < 0) {
       if (errno == EINTR) continue;
       syslog(LOG_ERR, "poll failed: %s", strerror(errno));
       return 1;
+    }
+    if (ready == 0) {
+      tree.Sync(WatchRoots(catalogue));
+      continue;
     }
     struct signalfd_siginfo info;
     if ((fds[0].revents & POLLIN) && read(signals.get(), &info, sizeof(info)) == sizeof(info)) {
