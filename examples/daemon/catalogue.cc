@@ -62,10 +62,15 @@ std::vector<WatchRoot> WatchRoots(const Catalogue& catalogue) {
 
 bool CatalogueWatch::Open() {
   inotify_ = OpenInotify();
-  if (inotify_.get() < 0) return false;
+  return inotify_.get() >= 0 && WatchDirs();
+}
+
+bool CatalogueWatch::WatchDirs() {
   for (QueueType type : zorvnotifyctl::kAllQueueTypes) {
     const std::string dir = MonitorQueue::GetConfDir(type);
-    const uint32_t mask = IN_CLOSE_WRITE | IN_MOVED_TO | IN_DELETE | IN_MOVED_FROM | IN_ONLYDIR;
+    // IN_CREATE as well: a queue file added as a symbolic link gives no other event.
+    const uint32_t mask =
+        IN_CREATE | IN_CLOSE_WRITE | IN_MOVED_TO | IN_DELETE | IN_MOVED_FROM | IN_ONLYDIR;
     if (inotify_add_watch(inotify_.get(), dir.c_str(), mask) < 0) {
       syslog(LOG_ERR, "cannot watch the configuration directory %s: %s", dir.c_str(),
              strerror(errno));
@@ -78,6 +83,7 @@ bool CatalogueWatch::Open() {
 bool CatalogueWatch::ReadChanges() {
   alignas(struct inotify_event) char buffer[16 * 1024];
   bool changed = false;
+  bool dir_gone = false;
   for (;;) {
     const ssize_t n = read(inotify_.get(), buffer, sizeof(buffer));
     if (n < 0 && errno == EINTR) continue;
@@ -85,11 +91,16 @@ bool CatalogueWatch::ReadChanges() {
     for (const char* p = buffer; p < buffer + n;) {
       const auto* event = reinterpret_cast<const struct inotify_event*>(p);
       p += sizeof(struct inotify_event) + event->len;
-      if ((event->mask & IN_Q_OVERFLOW) || (event->len > 0 && event->name[0] != '.')) {
+      dir_gone = dir_gone || (event->mask & IN_IGNORED) != 0;
+      if ((event->mask & (IN_Q_OVERFLOW | IN_IGNORED)) ||
+          (event->len > 0 && event->name[0] != '.')) {
         changed = true;
       }
     }
   }
+  // A configuration directory that was removed (or unmounted) took its
+  // watch along: it is made again and watched anew.
+  if (dir_gone) WatchDirs();
   return changed;
 }
 

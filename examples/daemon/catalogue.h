@@ -43,12 +43,17 @@ class CatalogueWatch {
   bool Open();
   // The descriptor to poll.
   int fd() const { return inotify_.get(); }
-  // Reads the pending events.  True when a queue file changed or events
-  // were lost; names beginning with "." (the library's temporary files) do
-  // not count.
+  // Reads the pending events.  True when a queue file changed, events were
+  // lost or a configuration directory went away (it is then made and
+  // watched again); names beginning with "." (the library's temporary
+  // files) do not count.
   bool ReadChanges();
 
  private:
+  // Watches the three configuration directories, creating missing ones.
+  // False when a watch could not be added (logged).
+  bool WatchDirs();
+
   UniqueFd inotify_;
 };
 
