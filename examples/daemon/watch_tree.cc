@@ -54,6 +54,9 @@ void CollectDirs(const std::string& dir, std::set<std::string>* dirs) {
   }
 }
 
+// Buffers ReadEvents reads before its caller polls again.
+constexpr int kReadsPerRound = 16;
+
 }  // namespace
 
 UniqueFd OpenInotify() {
@@ -115,7 +118,9 @@ bool WatchTree::Sync(const std::vector<WatchRoot>& roots) {
 bool WatchTree::ReadEvents(const EventSink& sink) {
   alignas(struct inotify_event) char buffer[64 * 1024];
   bool overflow = false;
-  for (;;) {
+  // At most kReadsPerRound buffers before the caller polls again, so that a
+  // steady flood of events cannot keep it from stop signals and reloads.
+  for (int reads = 0; reads < kReadsPerRound; ++reads) {
     const ssize_t n = read(fd(), buffer, sizeof(buffer));
     if (n < 0 && errno == EINTR) continue;
     if (n < 0 && errno == EAGAIN) {

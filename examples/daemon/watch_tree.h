@@ -66,8 +66,9 @@ class WatchTree {
   // found in it is handed on as IN_CREATE (with IN_ISDIR for directories),
   // so entries made before its watch existed are not missed, and none is
   // reported twice.  A directory deleted or moved away loses its watches.
-  // On a queue overflow it logs and rescans the trees.  False when reading
-  // failed (logged).
+  // On a queue overflow it logs and rescans the trees.  Reads a bounded
+  // number of buffers; events left are read on the next call.  False when
+  // reading failed (logged).
   bool ReadEvents(const EventSink& sink);
 
   // Removes every watch; the descriptor stays open.
