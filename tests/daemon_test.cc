@@ -143,8 +143,8 @@ TEST(DaemonTest, ReportsToEachQueueExactlyItsEventsAndFollowsTheCatalogue) {
   ASSERT_EQ(rename("/tmp/d", "/tmp/w/d"), 0);
   Expect(daemon,
          {E('a', "w/new/h", kCreate), E('a', "w/new/h", kModify), E('a', "w/new/h", kDelete),
-          E('a', "w/new", kDelete | IN_ISDIR), E('a', "w/d/f", kCreate),
-          E('a', "w/d/inner", kCreate | IN_ISDIR), E('a', "w/d/inner/g", kCreate)});
+          E('a', "w/new", kDelete | IN_ISDIR), E('a', "w/d/f", kCreate | kModify),
+          E('a', "w/d/inner", kCreate | IN_ISDIR), E('a', "w/d/inner/g", kCreate | kModify)});
   std::ofstream("/tmp/w/d/inner/k") << "x";
   Expect(daemon, {E('a', "w/d/inner/k", kCreate), E('a', "w/d/inner/k", kModify)});
 

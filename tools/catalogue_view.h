@@ -9,6 +9,11 @@
 
 namespace zorvnotifyctl {
 
+using zorvcommon::kAllQueueTypes;
+using zorvcommon::ParseQueueType;
+using zorvcommon::QueueType;
+using zorvcommon::QueueTypeName;
+
 // One queue of the catalogue and the type of the directory it came from.
 struct TypedQueue {
   QueueType type;

@@ -11,6 +11,11 @@
 
 namespace zorvnotifyctl {
 
+using zorvcommon::kAllQueueTypes;
+using zorvcommon::ParseQueueType;
+using zorvcommon::QueueType;
+using zorvcommon::QueueTypeName;
+
 // Exit statuses of the tool.
 enum ExitStatus : int {
   kExitOk = 0,       // done

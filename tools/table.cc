@@ -3,7 +3,6 @@
 #include "table.h"
 
 #include <algorithm>
-#include <cstdio>
 #include <utility>
 
 namespace zorvnotifyctl {
@@ -41,22 +40,6 @@ void Table::Print(std::ostream& out) const {
     line.erase(line.find_last_not_of(' ') + 1);
     out << line << '\n';
   }
-}
-
-std::string Printable(const std::string& text) {
-  if (text.empty()) return "\"\"";
-  std::string shown;
-  for (char c : text) {
-    const auto byte = static_cast<unsigned char>(c);
-    if (byte < 0x20 || byte == 0x7F) {
-      char escaped[5];
-      snprintf(escaped, sizeof(escaped), "\\x%02X", byte);
-      shown += escaped;
-    } else {
-      shown += c;
-    }
-  }
-  return shown;
 }
 
 }  // namespace zorvnotifyctl

@@ -6,6 +6,8 @@
 #include <string>
 #include <vector>
 
+#include "text.h"
+
 namespace zorvnotifyctl {
 
 // A header row and data rows.  Printed with each column padded to its
@@ -31,11 +33,7 @@ class Table {
   std::vector<std::vector<std::string>> rows_;  // the header first
 };
 
-// |text| with every control byte (below 0x20, and 0x7F) written as "\xNN",
-// so that a name or path holding a newline or an escape sequence cannot
-// break or forge the table.  The empty text becomes "\"\"" so that it stays
-// visible.
-std::string Printable(const std::string& text);
+using zorvcommon::Printable;
 
 }  // namespace zorvnotifyctl
 

@@ -2,7 +2,7 @@
 
 #include "queue_types.h"
 
-namespace zorvnotifyctl {
+namespace zorvcommon {
 
 bool ParseQueueType(const std::string& text, QueueType* type) {
   for (QueueType candidate : kAllQueueTypes) {
@@ -25,4 +25,4 @@ const char* QueueTypeName(QueueType type) {
   }
 }
 
-}  // namespace zorvnotifyctl
+}  // namespace zorvcommon

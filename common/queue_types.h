@@ -1,13 +1,13 @@
-// The queue types as the tool names them on its command line and in its
-// output.
-#ifndef ZORVNOTIFYD_TOOLS_QUEUE_TYPES_H_
-#define ZORVNOTIFYD_TOOLS_QUEUE_TYPES_H_
+// The queue types as zorvnotifyctl and zorvnotifyd name them on their
+// command lines and in their output.
+#ifndef ZORVNOTIFYD_COMMON_QUEUE_TYPES_H_
+#define ZORVNOTIFYD_COMMON_QUEUE_TYPES_H_
 
 #include <string>
 
 #include "monitor_queue.h"
 
-namespace zorvnotifyctl {
+namespace zorvcommon {
 
 using QueueType = ZORV::ZORVNOTIFYD::_tag_monitor_queue_type_;
 
@@ -26,6 +26,6 @@ bool ParseQueueType(const std::string& text, QueueType* type);
 // maps every other value to the directory of the etc type.
 const char* QueueTypeName(QueueType type);
 
-}  // namespace zorvnotifyctl
+}  // namespace zorvcommon
 
-#endif  // ZORVNOTIFYD_TOOLS_QUEUE_TYPES_H_
+#endif  // ZORVNOTIFYD_COMMON_QUEUE_TYPES_H_

@@ -12,7 +12,11 @@
 #include <syslog.h>
 #include <unistd.h>
 
+#include <algorithm>
+#include <cstdint>
 #include <cstdio>
+#include <cstdlib>
+#include <ctime>
 #include <string>
 
 #include "catalogue.h"
@@ -24,19 +28,31 @@ namespace zorvnotifyd {
 namespace {
 
 const char kUsage[] =
-    "Usage: zorvnotifyd [--json] [--help]\n"
+    "Usage: zorvnotifyd [--json] [--retry SECONDS] [--version] [--help]\n"
     "\n"
     "Watches, with inotify, every directory tree that a monitor queue of the catalogue\n"
     "names and writes one line on standard output for every queue that wants an event.\n"
     "With --json the line is a JSON object with the keys \"queue\", \"type\" (share, etc or\n"
     "local-etc), \"file\", \"path\" and \"mask\" (the inotify IN_* bits of the event).\n"
     "\n"
+    "  --json           JSON lines instead of readable ones\n"
+    "  --retry SECONDS  how often trees that are missing, replaced or over the watch\n"
+    "                   limit are looked at again (default 5; fractions allowed)\n"
+    "  --version        print the version and exit\n"
+    "\n"
     "The daemon runs in the foreground and never forks: start it from a service\n"
-    "manager (see zorvnotifyd.service for systemd).  It needs root.  It reloads the\n"
+    "manager (zorvnotifyd.service for systemd).  It needs root.  It reloads the\n"
     "catalogue when a queue file changes and stops on SIGTERM or SIGINT (status 0).\n"
-    "Log lines go to syslog and to standard error.\n";
+    "Log lines go to syslog and to standard error.  See zorvnotifyd(8).\n";
 
-constexpr int kMissingRootRetryMs = 5000;
+constexpr double kDefaultRetrySeconds = 5;
+
+// Milliseconds of CLOCK_MONOTONIC.
+int64_t NowMs() {
+  struct timespec now;
+  clock_gettime(CLOCK_MONOTONIC, &now);
+  return int64_t(now.tv_sec) * 1000 + now.tv_nsec / 1000000;
+}
 
 // Blocks SIGTERM and SIGINT and returns a descriptor that reads them, or an
 // empty one (logged).
@@ -55,51 +71,52 @@ UniqueFd OpenSignals() {
 }
 
 // Serves events until a stop signal (returns 0) or a fatal error (1).
-int Serve(bool json) {
+int Serve(bool json, double retry_seconds) {
   UniqueFd signals = OpenSignals();
   CatalogueWatch catalogue_watch;
   UniqueFd inotify = OpenInotify();
   if (signals.get() < 0 || inotify.get() < 0 || !catalogue_watch.Open()) return 1;
-  Catalogue catalogue = LoadCatalogue();
-  WatchTree tree(std::move(inotify));
-  if (!tree.Sync(WatchRoots(catalogue))) return 1;
+  CatalogueLoader loader;
+  Catalogue catalogue = loader.Load();
+  Reporter reporter(catalogue, json);
+  WatchTree tree(std::move(inotify), retry_seconds);
+  tree.Sync(loader.Roots(catalogue));
   syslog(LOG_INFO, "ready: watching %zu directories for %zu queues", tree.size(), catalogue.size());
-  const EventSink report = [&](const std::string& path, uint32_t mask) {
-    ReportEvent(catalogue, path, mask, json);
-  };
+  const int64_t retry_ms = std::max<int64_t>(1, int64_t(retry_seconds * 1000));
+  int64_t next_tick = NowMs() + retry_ms;
   struct pollfd fds[] = {
       {signals.get(), POLLIN, 0}, {tree.fd(), POLLIN, 0}, {catalogue_watch.fd(), POLLIN, 0}};
   for (;;) {
-    // A configured tree that does not exist (yet) is looked for again every
-    // few seconds, so that a share mounted or created later gets watched.
-    const int ready = poll(fds, 3, tree.missing_roots() ? kMissingRootRetryMs : -1);
-    if (ready < 0) {
-      if (errno == EINTR) continue;
+    // Trees that went away, were replaced or did not fit under the watch
+    // limit are looked at again on a fixed period, whatever the load.
+    const int ready = poll(fds, 3, int(std::max<int64_t>(0, next_tick - NowMs())));
+    if (ready < 0 && errno != EINTR) {
       syslog(LOG_ERR, "poll failed: %s", strerror(errno));
       return 1;
     }
-    if (ready == 0) {
-      tree.Sync(WatchRoots(catalogue));
-      continue;
-    }
     struct signalfd_siginfo info;
-    if ((fds[0].revents & POLLIN) && read(signals.get(), &info, sizeof(info)) == sizeof(info)) {
+    if (ready > 0 && (fds[0].revents & POLLIN) &&
+        read(signals.get(), &info, sizeof(info)) == sizeof(info)) {
       syslog(LOG_INFO, "stopping on %s: releasing %zu watches", strsignal(int(info.ssi_signo)),
              tree.size());
       tree.Clear();
       return 0;
     }
-    if ((fds[1].revents & POLLIN) && !tree.ReadEvents(report)) return 1;
-    if (ferror(stdout)) {
+    if (ready > 0 && (fds[1].revents & POLLIN) && !tree.ReadEvents(reporter)) return 1;
+    if (ready > 0 && (fds[2].revents & POLLIN) && catalogue_watch.ReadChanges()) {
+      catalogue = loader.Load();
+      tree.Sync(loader.Roots(catalogue));
+      syslog(LOG_INFO, "catalogue reloaded: watching %zu directories for %zu queues", tree.size(),
+             catalogue.size());
+    }
+    if (NowMs() >= next_tick) {
+      tree.Tick(reporter);
+      next_tick = NowMs() + retry_ms;
+    }
+    if (fflush(stdout) != 0 || ferror(stdout)) {
       syslog(LOG_ERR, "cannot write the report to standard output: stopping");
       tree.Clear();
       return 1;
-    }
-    if ((fds[2].revents & POLLIN) && catalogue_watch.ReadChanges()) {
-      catalogue = LoadCatalogue();
-      tree.Sync(WatchRoots(catalogue));
-      syslog(LOG_INFO, "catalogue reloaded: watching %zu directories for %zu queues", tree.size(),
-             catalogue.size());
     }
   }
 }
@@ -109,17 +126,30 @@ int Serve(bool json) {
 
 int main(int argc, char** argv) {
   bool json = false;
+  double retry_seconds = zorvnotifyd::kDefaultRetrySeconds;
   for (int i = 1; i < argc; ++i) {
     const std::string arg = argv[i];
     if (arg == "--help" || arg == "-h") {
       fputs(zorvnotifyd::kUsage, stdout);
       return 0;
     }
-    if (arg != "--json") {
-      fprintf(stderr, "zorvnotifyd: unknown argument \"%s\" (see --help)\n", argv[i]);
+    if (arg == "--version") {
+      printf("zorvnotifyd %s\n", ZORVNOTIFYD_VERSION_STRING);
+      return 0;
+    }
+    if (arg == "--json") {
+      json = true;
+      continue;
+    }
+    if (arg == "--retry" && i + 1 < argc) {
+      char* end = nullptr;
+      retry_seconds = strtod(argv[++i], &end);
+      if (*end == '\0' && retry_seconds >= 0.001 && retry_seconds <= 86400) continue;
+      fprintf(stderr, "zorvnotifyd: --retry takes a number of seconds from 0.001 to 86400\n");
       return 2;
     }
-    json = true;
+    fprintf(stderr, "zorvnotifyd: unknown argument \"%s\" (see --help)\n", argv[i]);
+    return 2;
   }
   // A reader of the report that goes away (zorvnotifyd | head) ends the
   // daemon through a write error, not by a signal that skips the clean-up.
@@ -129,7 +159,7 @@ int main(int argc, char** argv) {
     syslog(LOG_ERR, "must run as root: the catalogue and the watched trees are root's");
     return 1;
   }
-  const int status = zorvnotifyd::Serve(json);
+  const int status = zorvnotifyd::Serve(json, retry_seconds);
   closelog();
   return status;
 }

@@ -1,0 +1,17 @@
+// Text from queue files and file systems made safe to print.
+#ifndef ZORVNOTIFYD_COMMON_TEXT_H_
+#define ZORVNOTIFYD_COMMON_TEXT_H_
+
+#include <string>
+
+namespace zorvcommon {
+
+// |text| with every control byte (below 0x20, and 0x7F) written as "\xNN",
+// so that a name or path holding a newline or an escape sequence cannot
+// break or forge a line of output.  The empty text becomes "\"\"" so that
+// it stays visible.  Other bytes pass unchanged.
+std::string Printable(const std::string& text);
+
+}  // namespace zorvcommon
+
+#endif  // ZORVNOTIFYD_COMMON_TEXT_H_

@@ -1,0 +1,200 @@
+// Loading the catalogue file by file and noticing when it changes.
+
+#include "catalogue.h"
+
+#include <dirent.h>
+#include <errno.h>
+#include <fcntl.h>
+#include <string.h>
+#include <sys/inotify.h>
+#include <sys/stat.h>
+#include <syslog.h>
+
+#include <json/json.h>
+
+#include <algorithm>
+#include <cstdio>
+#include <memory>
+
+#include "text.h"
+#include "watch_path.h"
+
+namespace zorvnotifyd {
+
+using ZORV::ZORVNOTIFYD::MonitorQueue;
+using zorvcommon::Printable;
+
+namespace {
+
+// The names of the regular files (links followed) of |dir| whose name does
+// not begin with ".", sorted: the files the library's catalogue reads.
+std::vector<std::string> QueueFiles(const std::string& dir) {
+  std::vector<std::string> names;
+  std::unique_ptr<DIR, int (*)(DIR*)> handle(opendir(dir.c_str()), closedir);
+  if (!handle) {
+    syslog(LOG_ERR, "cannot read %s: %s", dir.c_str(), strerror(errno));
+    return names;
+  }
+  while (const struct dirent* entry = readdir(handle.get())) {
+    struct stat st;
+    if (entry->d_name[0] != '.' && stat((dir + "/" + entry->d_name).c_str(), &st) == 0 &&
+        S_ISREG(st.st_mode)) {
+      names.emplace_back(entry->d_name);
+    }
+  }
+  std::sort(names.begin(), names.end());
+  return names;
+}
+
+// The event kinds the watcher reports: inotify's, on files and directories.
+constexpr uint32_t kDeliverable = IN_ALL_EVENTS | IN_ISDIR;
+
+// Queue files larger than this are not read to say why they failed.
+constexpr off_t kMaxExplainedSize = 16 << 20;
+
+// Why the library could not load the queue file |path|, in words: read
+// without blocking and within a bound, and parsed as strictly as the
+// library does.
+std::string WhyUnloadable(const std::string& path) {
+  UniqueFd fd(open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
+  struct stat st;
+  if (fd.get() < 0 || fstat(fd.get(), &st) != 0) return strerror(errno);
+  if (!S_ISREG(st.st_mode)) return "not a regular file";
+  if (st.st_size > kMaxExplainedSize) return "too large (" + std::to_string(st.st_size) + " bytes)";
+  std::string text(static_cast<size_t>(st.st_size), '\0');
+  const ssize_t n = read(fd.get(), &text[0], text.size());
+  if (n < 0) return strerror(errno);
+  text.resize(static_cast<size_t>(n));
+  Json::CharReaderBuilder builder;
+  Json::CharReaderBuilder::strictMode(&builder.settings_);
+  builder["failIfExtra"] = true;
+  std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
+  Json::Value root;
+  std::string errors;
+  if (!reader->parse(text.data(), text.data() + text.size(), &root, &errors)) {
+    errors = errors.substr(0, errors.find('\n'));
+    return "not valid JSON (" + Printable(errors) + ")";
+  }
+  if (!root.isArray()) return "not a JSON array of queues";
+  return "a queue in it has a value of the wrong type";
+}
+
+}  // namespace
+
+Catalogue CatalogueLoader::Load() {
+  Catalogue catalogue;
+  std::map<FileKey, std::vector<MonitorQueue>> good;
+  std::map<FileKey, std::string> failing;
+  for (QueueType type : zorvcommon::kAllQueueTypes) {
+    const std::string dir = MonitorQueue::GetConfDir(type);
+    for (const std::string& file : QueueFiles(dir)) {
+      const FileKey key(type, file);
+      const std::string label =
+          Printable(std::string(zorvcommon::QueueTypeName(type)) + "/" + file);
+      std::vector<MonitorQueue> queues;
+      if (MonitorQueue::List(queues, file, type)) {
+        good[key] = queues;
+        if (failing_.count(key) != 0) {
+          syslog(LOG_NOTICE, "queue file %s loads again: %zu queues", label.c_str(), queues.size());
+        }
+      } else {
+        const std::string why = WhyUnloadable(dir + "/" + file);
+        const auto last = last_good_.find(key);
+        queues.clear();
+        if (last != last_good_.end()) {
+          queues = last->second;
+          good[key] = queues;
+        }
+        const auto known = failing_.find(key);
+        if (known == failing_.end() || known->second != why) {
+          syslog(LOG_ERR, "queue file %s cannot be loaded: %s; %s", label.c_str(), why.c_str(),
+                 last == last_good_.end() ? "it has no earlier content to keep"
+                                          : ("keeping its last good content (" +
+                                             std::to_string(queues.size()) + " queues)")
+                                                .c_str());
+        }
+        failing[key] = why;
+      }
+      for (const MonitorQueue& queue : queues) catalogue.push_back({type, file, queue});
+    }
+  }
+  last_good_ = std::move(good);
+  failing_ = std::move(failing);
+  return catalogue;
+}
+
+std::vector<WatchRoot> CatalogueLoader::Roots(const Catalogue& catalogue) {
+  std::vector<WatchRoot> roots;
+  std::set<std::string> skipped;
+  for (const CatalogueQueue& entry : catalogue) {
+    for (const auto& config : entry.queue._configs) {
+      std::string why = zorvcommon::WatchPathProblem(config._path);
+      if (why.empty() && (config._mask & kDeliverable) == 0) {
+        char mask[16];
+        snprintf(mask, sizeof(mask), "0x%x", config._mask);
+        why = config._mask == 0 ? std::string("its mask is 0, so it wants no event")
+                                : std::string("its mask ") + mask +
+                                      " holds no event kind the watcher reports (inotify's "
+                                      "IN_ALL_EVENTS bits and IN_ISDIR)";
+      }
+      if (why.empty()) {
+        roots.push_back({config._path, config._mask});
+        continue;
+      }
+      const std::string line = "skipping configuration \"" + Printable(config._path) +
+                               "\" of queue \"" + Printable(entry.queue._name) + "\" (" +
+                               zorvcommon::QueueTypeName(entry.type) + "/" + Printable(entry.file) +
+                               "): " + why;
+      if (skipped_.count(line) == 0) syslog(LOG_WARNING, "%s", line.c_str());
+      skipped.insert(line);
+    }
+  }
+  skipped_ = std::move(skipped);
+  return roots;
+}
+
+bool CatalogueWatch::Open() {
+  inotify_ = OpenInotify();
+  return inotify_.get() >= 0 && WatchDirs();
+}
+
+bool CatalogueWatch::WatchDirs() {
+  for (QueueType type : zorvcommon::kAllQueueTypes) {
+    const std::string dir = MonitorQueue::GetConfDir(type);
+    // IN_CREATE as well: a queue file added as a symbolic link gives no other event.
+    const uint32_t mask =
+        IN_CREATE | IN_CLOSE_WRITE | IN_MOVED_TO | IN_DELETE | IN_MOVED_FROM | IN_ONLYDIR;
+    if (inotify_add_watch(inotify_.get(), dir.c_str(), mask) < 0) {
+      syslog(LOG_ERR, "cannot watch the configuration directory %s: %s", dir.c_str(),
+             strerror(errno));
+      return false;
+    }
+  }
+  return true;
+}
+
+bool CatalogueWatch::ReadChanges() {
+  alignas(struct inotify_event) char buffer[16 * 1024];
+  bool changed = false;
+  bool dir_gone = false;
+  for (;;) {
+    const ssize_t n = read(inotify_.get(), buffer, sizeof(buffer));
+    if (n < 0 && errno == EINTR) continue;
+    if (n <= 0) break;  // EAGAIN: drained
+    for (const char* p = buffer; p < buffer + n;) {
+      const auto* event = reinterpret_cast<const struct inotify_event*>(p);
+      p += sizeof(struct inotify_event) + event->len;
+      dir_gone = dir_gone || (event->mask & IN_IGNORED) != 0;
+      if ((event->mask & (IN_Q_OVERFLOW | IN_IGNORED)) ||
+          (event->len > 0 && event->name[0] != '.')) {
+        changed = true;
+      }
+    }
+  }
+  // A configuration directory that was removed (or unmounted) took its
+  // watch along: it is made again and watched anew.
+  if (dir_gone) WatchDirs();
+  return changed;
+}
+
+}  // namespace zorvnotifyd

@@ -1,0 +1,82 @@
+// The catalogue as the daemon needs it: every queue with the type and the
+// file it came from, the trees its configurations name, and a watch on the
+// configuration directories that tells when it must be read again.
+#ifndef ZORVNOTIFYD_DAEMON_CATALOGUE_H_
+#define ZORVNOTIFYD_DAEMON_CATALOGUE_H_
+
+#include <map>
+#include <set>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "monitor_queue.h"
+#include "queue_types.h"
+#include "unique_fd.h"
+#include "watch_tree.h"
+
+namespace zorvnotifyd {
+
+using zorvcommon::QueueType;
+
+// One queue and where it is stored.
+struct CatalogueQueue {
+  QueueType type;
+  std::string file;  // the queue file's name in the configuration directory of |type|
+  ZORV::ZORVNOTIFYD::MonitorQueue queue;
+};
+
+using Catalogue = std::vector<CatalogueQueue>;
+
+// Reads the catalogue file by file and remembers, per file, its last good
+// content, so that a queue file that turns malformed while the daemon runs
+// does not make its queues vanish.
+class CatalogueLoader {
+ public:
+  // Every queue of every type: types in the order share, etc, local-etc;
+  // within a type the regular files whose name does not begin with "." in
+  // name order; within a file the queues in file order.  A file that fails
+  // to load contributes the queues of its last good load (none if it never
+  // loaded); its name and why it failed are logged once, and again when it
+  // loads once more.
+  Catalogue Load();
+
+  // One tree per configuration of |catalogue| that the watcher can honour:
+  // an absolute, normalised path and a mask with an event kind it
+  // delivers.  Every other configuration is logged once, by queue and
+  // file, with the reason, while it stays in the catalogue.
+  std::vector<WatchRoot> Roots(const Catalogue& catalogue);
+
+ private:
+  using FileKey = std::pair<QueueType, std::string>;
+  std::map<FileKey, std::vector<ZORV::ZORVNOTIFYD::MonitorQueue>> last_good_;
+  std::map<FileKey, std::string> failing_;  // files that fail to load, and why
+  std::set<std::string> skipped_;           // skipped configurations, as logged
+};
+
+// A watch on the three configuration directories.
+class CatalogueWatch {
+ public:
+  // Opens an inotify instance of its own and watches the directories
+  // (created first when missing) for files written, renamed in or out, or
+  // removed.  False when that failed (logged).
+  bool Open();
+  // The descriptor to poll.
+  int fd() const { return inotify_.get(); }
+  // Reads the pending events.  True when a queue file changed, events were
+  // lost or a configuration directory went away (it is then made and
+  // watched again); names beginning with "." (the library's temporary
+  // files) do not count.
+  bool ReadChanges();
+
+ private:
+  // Watches the three configuration directories, creating missing ones.
+  // False when a watch could not be added (logged).
+  bool WatchDirs();
+
+  UniqueFd inotify_;
+};
+
+}  // namespace zorvnotifyd
+
+#endif  // ZORVNOTIFYD_DAEMON_CATALOGUE_H_

@@ -1,0 +1,446 @@
+// Keeping the inotify watches of the configured trees.
+
+#include "watch_tree.h"
+
+#include <errno.h>
+#include <string.h>
+#include <sys/inotify.h>
+#include <syslog.h>
+#include <unistd.h>
+
+#include <cstdio>
+
+#include "directory.h"
+#include "text.h"
+
+namespace zorvnotifyd {
+namespace {
+
+using zorvcommon::Printable;
+
+// Watched on every directory whatever the queues want: they tell the tree
+// that directories came, went or moved, and why a watch ends.
+constexpr uint32_t kTreeKeeping =
+    IN_CREATE | IN_MOVED_TO | IN_MOVED_FROM | IN_DELETE | IN_MOVE_SELF | IN_DELETE_SELF;
+
+// Buffers ReadEvents reads before its caller polls again.
+constexpr int kReadsPerRound = 16;
+
+// |path| and every path below it in |paths|, in order.
+template <typename Map>
+std::vector<std::pair<std::string, int>> Subtree(const Map& paths, const std::string& path) {
+  std::vector<std::pair<std::string, int>> found;
+  for (auto it = paths.lower_bound(path);
+       it != paths.end() && it->first.compare(0, path.size(), path) == 0; ++it) {
+    if (it->first.size() == path.size() || it->first[path.size()] == '/') found.push_back(*it);
+  }
+  return found;
+}
+
+std::string ParentOf(const std::string& path) { return path.substr(0, path.rfind('/')); }
+
+}  // namespace
+
+UniqueFd OpenInotify() {
+  UniqueFd fd(inotify_init1(IN_NONBLOCK | IN_CLOEXEC));
+  if (fd.get() < 0 && errno == EMFILE) {
+    syslog(LOG_ERR, "inotify instance limit reached (raise fs.inotify.max_user_instances)");
+  } else if (fd.get() < 0) {
+    syslog(LOG_ERR, "cannot open an inotify instance: %s", strerror(errno));
+  }
+  return fd;
+}
+
+WatchTree::WatchTree(UniqueFd inotify, double retry_seconds)
+    : inotify_(std::move(inotify)), retry_seconds_(retry_seconds) {}
+
+WatchTree::~WatchTree() { Clear(); }
+
+std::vector<WatchRoot> WatchTree::Roots() const {
+  std::vector<WatchRoot> roots;
+  for (const auto& [path, mask] : roots_) roots.push_back({path, mask});
+  return roots;
+}
+
+void WatchTree::Sync(const std::vector<WatchRoot>& roots) {
+  roots_.clear();
+  for (const WatchRoot& root : roots) roots_[root.path] |= root.mask & IN_ALL_EVENTS;
+  std::set<int> synced;
+  std::set<std::string> visited;
+  std::map<std::string, std::string> was_missing = std::move(missing_);
+  std::map<std::string, size_t> was_limited = std::move(limited_);
+  missing_.clear();
+  limited_.clear();
+  for (const auto& [root, mask] : roots_) {
+    // A root that was missing stays so until Tick finds it and reports
+    // what it holds; one inside a tree walked already is watched.
+    if (const auto known = was_missing.find(root); known != was_missing.end()) {
+      missing_.insert(*known);
+      continue;
+    }
+    if (visited.count(root) != 0) continue;
+    WalkContext context;
+    context.synced = &synced;
+    context.visited = &visited;
+    std::string why;
+    if (!WatchRootTree(root, context, &why)) {
+      NoteRootMissing(root, why);
+      continue;
+    }
+    const auto before = was_limited.find(root);
+    if (context.unwatched == 0) {
+      if (before != was_limited.end()) {
+        syslog(LOG_NOTICE, "all %zu directories of tree \"%s\" are watched now", context.dirs,
+               Printable(root).c_str());
+      }
+      continue;
+    }
+    limited_[root] = context.unwatched;
+    if (before == was_limited.end() || before->second != context.unwatched) {
+      syslog(LOG_ERR,
+             "cannot watch %zu of %zu directories of tree \"%s\": inotify watch limit reached "
+             "(raise fs.inotify.max_user_watches); trying again every %g s",
+             context.unwatched, context.dirs, Printable(root).c_str(), retry_seconds_);
+    }
+  }
+  // Paths not met in this round are no longer wanted, or no longer there.
+  std::vector<std::string> stale;
+  for (const auto& [path, wd] : by_path_) {
+    if (visited.count(path) == 0) stale.push_back(path);
+  }
+  for (const std::string& path : stale) Unmap(path, true, nullptr);
+}
+
+void WatchTree::Tick(EventSink& sink) {
+  for (const auto& [root, mask] : roots_) {
+    struct stat st;
+    const bool exists = stat(root.c_str(), &st) == 0 && S_ISDIR(st.st_mode);
+    const auto known = by_path_.find(root);
+    if (known != by_path_.end()) {
+      const Watch& watch = watches_.at(known->second);
+      if (!exists || (watch.dev == st.st_dev && watch.ino == st.st_ino)) continue;
+      // Another directory now answers to the path (a file system mounted
+      // on it, or it was replaced while events were lost).
+      syslog(LOG_NOTICE, "tree \"%s\" is another directory now: watching it afresh",
+             Printable(root).c_str());
+      Drop(root, nullptr);
+    }
+    if (!exists) continue;  // logged as missing already, when it went
+    WalkContext context;
+    context.found = &sink;
+    std::string why;
+    if (!WatchRootTree(root, context, &why)) continue;
+    if (missing_.erase(root) != 0) {
+      syslog(LOG_NOTICE, "watching tree \"%s\" again: %zu directories", Printable(root).c_str(),
+             context.dirs);
+    }
+    if (context.unwatched != 0) limited_[root] += context.unwatched;
+  }
+  if (!limited_.empty()) Sync(Roots());
+}
+
+bool WatchTree::Fill(bool* failed) {
+  alignas(struct inotify_event) char buffer[64 * 1024];
+  ssize_t n;
+  do {
+    n = read(fd(), buffer, sizeof(buffer));
+  } while (n < 0 && errno == EINTR);
+  if (n < 0 && errno == EAGAIN) return false;
+  if (n <= 0) {
+    syslog(LOG_ERR, "reading inotify events failed: %s", strerror(errno));
+    *failed = true;
+    return false;
+  }
+  for (const char* p = buffer; p < buffer + n;) {
+    const auto* event = reinterpret_cast<const struct inotify_event*>(p);
+    p += sizeof(struct inotify_event) + event->len;
+    pending_.push_back(
+        {event->wd, event->mask, event->cookie, event->len > 0 ? event->name : std::string()});
+  }
+  return true;
+}
+
+bool WatchTree::ReadEvents(EventSink& sink) {
+  bool failed = false;
+  // At most kReadsPerRound buffers before the caller polls again, so that a
+  // steady flood of events cannot keep it from stop signals and reloads.
+  for (int reads = 0; reads < kReadsPerRound; ++reads) {
+    if (pending_.empty() && !Fill(&failed)) break;
+    while (!pending_.empty()) {
+      const RawEvent event = std::move(pending_.front());
+      pending_.pop_front();
+      if ((event.mask & IN_Q_OVERFLOW) == 0) {
+        Handle(event, sink);
+        continue;
+      }
+      syslog(LOG_WARNING, "inotify event queue overflowed, events were lost: rescanning the trees");
+      sink.Lost();
+      // Deletions and moves may be among the lost events, so no watch is
+      // trusted: all are dropped and the trees watched afresh.
+      const std::vector<WatchRoot> roots = Roots();
+      Clear();
+      Sync(roots);
+    }
+  }
+  return !failed;
+}
+
+void WatchTree::Clear() {
+  for (const auto& [wd, watch] : watches_) inotify_rm_watch(fd(), wd);
+  watches_.clear();
+  by_path_.clear();
+  by_inode_.clear();
+  pending_.clear();
+  moves_.clear();
+}
+
+void WatchTree::Handle(const RawEvent& event, EventSink& sink) {
+  const auto it = watches_.find(event.wd);
+  if (it == watches_.end()) return;  // the last events of a watch removed earlier
+  Watch& watch = it->second;
+  if (event.mask & IN_IGNORED) {
+    // The kernel ended the watch: the directory is gone or was unmounted.
+    const char* why = watch.gone != nullptr ? watch.gone : "removed";
+    for (const std::string& path :
+         std::vector<std::string>(watch.paths.begin(), watch.paths.end())) {
+      Drop(path, why);
+    }
+    return;
+  }
+  if (event.mask & IN_UNMOUNT) {
+    watch.gone = "unmounted";
+    return;
+  }
+  if (event.mask & IN_DELETE_SELF) watch.gone = "deleted";
+  // Handling may change the paths: work on a copy.
+  const std::vector<std::string> paths(watch.paths.begin(), watch.paths.end());
+  std::vector<std::string> targets;
+  for (const std::string& path : paths) {
+    targets.push_back(event.name.empty() ? path : path + "/" + event.name);
+    sink.Event(targets.back(), event.mask);
+  }
+  const bool is_dir = (event.mask & IN_ISDIR) != 0;
+  if (is_dir && (event.mask & IN_MOVED_FROM)) {
+    // The other half of a move within the trees follows at once in the
+    // queue; when it is not there, the directory left the trees.
+    auto match = [&] {
+      for (const RawEvent& next : pending_) {
+        if ((next.mask & IN_MOVED_TO) && next.cookie == event.cookie) return &next;
+      }
+      return static_cast<const RawEvent*>(nullptr);
+    };
+    bool failed = false;
+    const RawEvent* to = match();
+    if (to == nullptr && Fill(&failed)) to = match();
+    const auto parent = to == nullptr ? watches_.end() : watches_.find(to->wd);
+    if (parent == watches_.end()) {
+      for (const std::string& target : targets) Drop(target, "moved away");
+      return;
+    }
+    std::vector<std::string> destinations;
+    for (const std::string& path : parent->second.paths)
+      destinations.push_back(path + "/" + to->name);
+    Move(targets, destinations);
+    moves_.insert(event.cookie);
+  } else if (is_dir && (event.mask & IN_DELETE)) {
+    for (const std::string& target : targets) Drop(target, "deleted");
+  } else if (is_dir && (event.mask & (IN_CREATE | IN_MOVED_TO))) {
+    if ((event.mask & IN_MOVED_TO) && moves_.erase(event.cookie) != 0) return;  // moved within
+    for (const std::string& target : targets) AddAndScan(target, sink);
+  } else if (event.mask & IN_MOVE_SELF) {
+    // A directory whose parent is watched moves with its parent's events;
+    // one whose parent is not is a root that moved away.
+    for (const std::string& path : paths) {
+      if (by_path_.count(ParentOf(path)) == 0) Drop(path, "moved away");
+    }
+  }
+}
+
+uint32_t WatchTree::MaskFor(std::string_view dir) const {
+  uint32_t mask = 0;
+  for (size_t i = 1; i <= dir.size(); ++i) {
+    if (i < dir.size() && dir[i] != '/') continue;
+    const auto root = roots_.find(dir.substr(0, i));
+    if (root != roots_.end()) mask |= root->second;
+  }
+  return mask;
+}
+
+std::string WatchTree::RootOf(const std::string& dir) const {
+  std::string found;
+  for (size_t i = 1; i <= dir.size(); ++i) {
+    if (i < dir.size() && dir[i] != '/') continue;
+    if (roots_.find(std::string_view(dir).substr(0, i)) != roots_.end()) found = dir.substr(0, i);
+  }
+  return found;
+}
+
+bool WatchTree::WatchRootTree(const std::string& root, WalkContext& context, std::string* why) {
+  UniqueFd dir = OpenConfiguredDir(root);
+  if (dir.get() < 0) {
+    *why = errno == ENOTDIR ? "not a directory" : strerror(errno);
+    return false;
+  }
+  Walk(dir.get(), root, context);
+  return true;
+}
+
+void WatchTree::Walk(int dir, const std::string& path, WalkContext& context) {
+  struct stat st;
+  if (fstat(dir, &st) != 0) return;
+  const std::pair<dev_t, ino_t> id(st.st_dev, st.st_ino);
+  for (const auto& ancestor : context.ancestors) {
+    if (ancestor == id) return;  // a bind mount of a directory inside itself
+  }
+  ++context.dirs;
+  const size_t refused = context.unwatched;
+  if (Add(dir, st, path, context) < 0 && context.unwatched == refused) return;
+  context.ancestors.push_back(id);
+  for (const DirEntry& entry : ListDir(dir)) {
+    const std::string child = path + "/" + entry.name;
+    if (context.found != nullptr) context.found->Found(child, entry.is_dir);
+    if (!entry.is_dir) continue;
+    UniqueFd sub = OpenSubdir(dir, entry.name);
+    if (sub.get() >= 0) Walk(sub.get(), child, context);
+  }
+  context.ancestors.pop_back();
+}
+
+int WatchTree::Add(int dir, const struct stat& st, const std::string& path, WalkContext& context) {
+  const uint32_t wanted = MaskFor(path);
+  const std::pair<dev_t, ino_t> id(st.st_dev, st.st_ino);
+  // In a Sync the first path of a directory sets its mask exactly, so kinds
+  // no longer wanted go; every other path, and every later add, adds to it.
+  const auto known = by_inode_.find(id);
+  const bool exact = context.synced != nullptr &&
+                     (known == by_inode_.end() || context.synced->count(known->second) == 0);
+  // The open directory itself, never a path that a link could redirect.
+  char self[40];
+  snprintf(self, sizeof(self), "/proc/self/fd/%d", dir);
+  const int wd =
+      inotify_add_watch(fd(), self, wanted | kTreeKeeping | IN_ONLYDIR | (exact ? 0 : IN_MASK_ADD));
+  if (wd < 0) {
+    if (errno == ENOSPC) {
+      ++context.unwatched;
+    } else if (errno != ENOENT) {
+      syslog(LOG_WARNING, "cannot watch \"%s\": %s", Printable(path).c_str(), strerror(errno));
+    }
+    return -1;
+  }
+  Watch& watch = watches_[wd];
+  if (watch.dev != st.st_dev || watch.ino != st.st_ino) {
+    // A descriptor the kernel handed out again: what it named is gone.
+    for (const std::string& old :
+         std::vector<std::string>(watch.paths.begin(), watch.paths.end())) {
+      by_path_.erase(old);
+    }
+    by_inode_.erase({watch.dev, watch.ino});
+    watch = Watch();
+    watch.dev = st.st_dev;
+    watch.ino = st.st_ino;
+  }
+  watch.mask = exact ? wanted : watch.mask | wanted;
+  by_inode_[id] = wd;
+  if (context.synced != nullptr) context.synced->insert(wd);
+  if (context.visited != nullptr) context.visited->insert(path);
+  const auto old = by_path_.find(path);
+  if (old != by_path_.end() && old->second != wd) Unmap(path, true, nullptr);  // replaced
+  watch.paths.insert(path);
+  by_path_[path] = wd;
+  return wd;
+}
+
+void WatchTree::AddAndScan(const std::string& path, EventSink& sink) {
+  const std::string root = RootOf(path);
+  if (root.empty()) return;
+  UniqueFd dir = OpenBelow(root, path);
+  if (dir.get() < 0) return;  // gone again, or a link put in its place
+  WalkContext context;
+  context.found = &sink;
+  Walk(dir.get(), path, context);
+  if (context.unwatched == 0) return;
+  if (limited_.empty()) {
+    syslog(LOG_ERR,
+           "cannot watch %zu new directories at \"%s\": inotify watch limit reached (raise "
+           "fs.inotify.max_user_watches); trying again every %g s",
+           context.unwatched, Printable(path).c_str(), retry_seconds_);
+  }
+  limited_[root] += context.unwatched;
+}
+
+void WatchTree::Move(const std::vector<std::string>& from, const std::vector<std::string>& to) {
+  // What lies below the moved directory, relative to it, and its watch.
+  std::set<std::pair<std::string, int>> below;
+  std::set<int> moved;
+  for (const std::string& path : from) {
+    for (const auto& [old, wd] : Subtree(by_path_, path)) {
+      below.insert({old.substr(path.size()), wd});
+      moved.insert(wd);
+      by_path_.erase(old);
+      watches_.at(wd).paths.erase(old);
+    }
+  }
+  for (const std::string& path : to) {
+    for (const auto& [relative, wd] : below) {
+      const std::string now = path + relative;
+      const auto old = by_path_.find(now);
+      if (old != by_path_.end() && old->second != wd) Unmap(now, true, nullptr);
+      by_path_[now] = wd;
+      watches_.at(wd).paths.insert(now);
+    }
+  }
+  // The new place may want other kinds of events.
+  for (int wd : moved) {
+    Watch& watch = watches_.at(wd);
+    if (watch.paths.empty()) {
+      inotify_rm_watch(fd(), wd);
+      by_inode_.erase({watch.dev, watch.ino});
+      watches_.erase(wd);
+      continue;
+    }
+    uint32_t wanted = 0;
+    for (const std::string& path : watch.paths) wanted |= MaskFor(path);
+    if (wanted == watch.mask) continue;
+    const std::string& path = *watch.paths.begin();
+    UniqueFd dir = OpenBelow(RootOf(path), path);
+    struct stat st;
+    if (dir.get() < 0 || fstat(dir.get(), &st) != 0 || st.st_dev != watch.dev ||
+        st.st_ino != watch.ino) {
+      continue;  // moved again since; its own events follow
+    }
+    WalkContext context;
+    std::set<int> synced;
+    context.synced = &synced;  // an exact mask
+    Add(dir.get(), st, path, context);
+  }
+}
+
+void WatchTree::Drop(const std::string& path, const char* why) {
+  for (const auto& [gone, wd] : Subtree(by_path_, path)) Unmap(gone, true, why);
+}
+
+void WatchTree::Unmap(const std::string& path, bool release, const char* why) {
+  const auto it = by_path_.find(path);
+  if (it == by_path_.end()) return;
+  const int wd = it->second;
+  by_path_.erase(it);
+  const auto watch = watches_.find(wd);
+  if (watch != watches_.end()) {
+    watch->second.paths.erase(path);
+    if (watch->second.paths.empty()) {
+      if (release) inotify_rm_watch(fd(), wd);
+      by_inode_.erase({watch->second.dev, watch->second.ino});
+      watches_.erase(watch);
+    }
+  }
+  if (why != nullptr && roots_.count(path) != 0)
+    NoteRootMissing(path, std::string("it was ") + why);
+}
+
+void WatchTree::NoteRootMissing(const std::string& path, const std::string& why) {
+  if (!missing_.emplace(path, why).second) return;
+  syslog(LOG_NOTICE, "not watching tree \"%s\": %s; looking for it again every %g s",
+         Printable(path).c_str(), why.c_str(), retry_seconds_);
+}
+
+}  // namespace zorvnotifyd

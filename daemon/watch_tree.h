@@ -1,0 +1,180 @@
+// The inotify watches of the daemon: every directory of every configured
+// tree, each watched for the union of the event kinds wanted there, kept in
+// step with the trees as directories come, go, move, and as whole trees
+// disappear and come back.
+#ifndef ZORVNOTIFYD_DAEMON_WATCH_TREE_H_
+#define ZORVNOTIFYD_DAEMON_WATCH_TREE_H_
+
+#include <sys/inotify.h>
+#include <sys/stat.h>
+#include <sys/types.h>
+
+#include <cstdint>
+#include <deque>
+#include <map>
+#include <set>
+#include <string>
+#include <string_view>
+#include <unordered_map>
+#include <vector>
+
+#include "unique_fd.h"
+
+namespace zorvnotifyd {
+
+// Opens an inotify instance, non-blocking and close-on-exec.  On failure
+// logs why (naming the kernel limit when it is the instance limit) and
+// returns an empty descriptor.
+UniqueFd OpenInotify();
+
+// One configured tree: its top directory, an absolute normalised path (see
+// common/watch_path.h), and the event kinds (inotify IN_* bits) wanted at
+// and below it.
+struct WatchRoot {
+  std::string path;
+  uint32_t mask;
+};
+
+// Where the watcher's findings go.
+class EventSink {
+ public:
+  virtual ~EventSink() = default;
+  // An event the kernel reported: its full path and inotify mask.
+  virtual void Event(const std::string& path, uint32_t mask) = 0;
+  // An entry found by scanning a directory that was not watched before
+  // (new, moved in, or a tree that appeared): it may have been created,
+  // written and closed before the watch existed.
+  virtual void Found(const std::string& path, bool is_dir) = 0;
+  // Events were lost: the kernel's event queue overflowed.
+  virtual void Lost() = 0;
+};
+
+// The watches of one inotify instance over a set of trees.  Paths are byte
+// strings built from the roots as configured: a child's path is its
+// directory's path, "/" and its name.  One directory reached through
+// several paths (a symbolic link or bind mount to a watched directory) is
+// one inotify watch reported under each of its paths.  Symbolic links
+// inside a tree are never followed; a root that is a link is.
+class WatchTree {
+ public:
+  // Takes an inotify descriptor opened with IN_NONBLOCK.  Tick is called
+  // every |retry_seconds| (said in log lines).
+  WatchTree(UniqueFd inotify, double retry_seconds);
+  // Removes every watch, then closes the descriptor.
+  ~WatchTree();
+  WatchTree(const WatchTree&) = delete;
+  WatchTree& operator=(const WatchTree&) = delete;
+
+  // The descriptor to poll for events.
+  int fd() const { return inotify_.get(); }
+  // The number of directories (inodes) watched.
+  size_t size() const { return watches_.size(); }
+
+  // Makes the watches match |roots|: every directory at or below a root is
+  // watched with the union of the masks of the roots it lies in (masks
+  // limited to inotify's event kinds); other watches are removed.  A
+  // watch whose mask does not change keeps its events.  Roots that do not
+  // exist or are not directories are logged once and looked for by Tick.
+  // Over the kernel's watch limit it watches what it can, logs per tree
+  // how many directories it could not watch, and Tick tries again.
+  void Sync(const std::vector<WatchRoot>& roots);
+
+  // The periodic check: watches again every root that is missing or whose
+  // directory was replaced (deleted and made again, moved back, a file
+  // system mounted on it), reporting its entries to |sink| as Found; and
+  // after a watch-limit failure, tries the whole Sync again.
+  void Tick(EventSink& sink);
+
+  // Reads the pending events (a bounded number of buffers; the rest wait
+  // for the next call) and hands them to |sink| in the kernel's order:
+  //  - a directory created in or moved into a tree from outside is watched
+  //    and scanned after its own event, everything in it handed on as
+  //    Found, so nothing made before its watch existed is missed;
+  //  - a directory moved within the watched trees keeps its watches under
+  //    the new path: the two move events are handed on, nothing else;
+  //  - a directory deleted or moved away loses its watches; a root that
+  //    goes away is logged and looked for again by Tick;
+  //  - on a queue overflow, Lost, and every tree is watched afresh.
+  // False when reading failed (logged).
+  bool ReadEvents(EventSink& sink);
+
+  // Removes every watch; the descriptor stays open.
+  void Clear();
+
+ private:
+  struct Watch {
+    std::set<std::string> paths;  // every path it is watched under
+    uint32_t mask = 0;            // the wanted kinds asked of the kernel
+    dev_t dev = 0;
+    ino_t ino = 0;
+    const char* gone = nullptr;  // why it is about to go away, once the kernel said so
+  };
+  // One inotify event, copied out of the read buffer.
+  struct RawEvent {
+    int wd;
+    uint32_t mask;
+    uint32_t cookie;
+    std::string name;
+  };
+  // What one walk of a tree does (see Walk).
+  struct WalkContext {
+    std::set<int>* synced = nullptr;           // Sync: watches given their exact mask this round
+    std::set<std::string>* visited = nullptr;  // Sync: every path watched this round
+    EventSink* found = nullptr;                // report entries as Found
+    size_t dirs = 0;                           // directories met
+    size_t unwatched = 0;                      // of which the watch limit refused
+    std::vector<std::pair<dev_t, ino_t>> ancestors;  // loop guard
+  };
+
+  // Reads one buffer of events into pending_.  False when nothing was read
+  // (|*failed| set when reading failed rather than found nothing).
+  bool Fill(bool* failed);
+  // Handles the event at the front of pending_ (not an overflow).
+  void Handle(const RawEvent& event, EventSink& sink);
+  // The union of the masks of the roots that |dir| is or lies below.
+  uint32_t MaskFor(std::string_view dir) const;
+  // The innermost root that |dir| is or lies below; empty when none.
+  std::string RootOf(const std::string& dir) const;
+  // Watches the open directory |dir| as |path| and walks below it,
+  // without following links.
+  void Walk(int dir, const std::string& path, WalkContext& context);
+  // Watches the open directory |dir|, whose status is |st|, as |path|.
+  // The watch descriptor, or -1 (ENOSPC counted in |context|, other
+  // failures logged).
+  int Add(int dir, const struct stat& st, const std::string& path, WalkContext& context);
+  // Watches and walks the directory at |path| (inside a watched tree),
+  // reporting what it holds as Found.
+  void AddAndScan(const std::string& path, EventSink& sink);
+  // Watches the tree |root| and walks it; with |sink|, reports its entries
+  // as Found.  False (with |why|) when the root cannot be opened.
+  bool WatchRootTree(const std::string& root, WalkContext& context, std::string* why);
+  // Moves the watches at and below each path of |from| to each path of
+  // |to| (a rename within the trees; several paths when the directories
+  // have several), then sets the kernel masks that the new place changes.
+  void Move(const std::vector<std::string>& from, const std::vector<std::string>& to);
+  // Forgets |path| and every path below it; |why| says why when a root is
+  // among them ("deleted", "moved away", ...).
+  void Drop(const std::string& path, const char* why);
+  // Forgets one path of a watch; the watch itself goes (removed from the
+  // kernel when |release|) once it has no path left.
+  void Unmap(const std::string& path, bool release, const char* why);
+  // Logs, once while it lasts, that root |path| is not watched and why.
+  void NoteRootMissing(const std::string& path, const std::string& why);
+  // The roots as Sync takes them.
+  std::vector<WatchRoot> Roots() const;
+
+  UniqueFd inotify_;
+  std::map<std::string, uint32_t, std::less<>> roots_;  // merged masks by root path
+  std::unordered_map<int, Watch> watches_;              // by watch descriptor
+  std::map<std::string, int> by_path_;                  // watch descriptor by path
+  std::map<std::pair<dev_t, ino_t>, int> by_inode_;     // watch descriptor by directory
+  std::map<std::string, std::string> missing_;          // unwatched roots and why
+  std::map<std::string, size_t> limited_;  // roots the watch limit kept partly unwatched
+  std::deque<RawEvent> pending_;           // events read but not yet handled
+  std::set<uint32_t> moves_;  // cookies of directory moves within the trees, already done
+  double retry_seconds_;
+};
+
+}  // namespace zorvnotifyd
+
+#endif  // ZORVNOTIFYD_DAEMON_WATCH_TREE_H_
