@@ -23,4 +23,8 @@ std::string Printable(const std::string& text) {
   return shown;
 }
 
+std::string Quoted(const std::string& text) {
+  return text.empty() ? "\"\"" : "\"" + Printable(text) + "\"";
+}
+
 }  // namespace zorvcommon

@@ -12,6 +12,9 @@ namespace zorvcommon {
 // it stays visible.  Other bytes pass unchanged.
 std::string Printable(const std::string& text);
 
+// |text| as Printable writes it, in double quotes ("\"\"" when empty).
+std::string Quoted(const std::string& text);
+
 }  // namespace zorvcommon
 
 #endif  // ZORVNOTIFYD_COMMON_TEXT_H_

@@ -23,6 +23,7 @@ namespace zorvnotifyd {
 
 using ZORV::ZORVNOTIFYD::MonitorQueue;
 using zorvcommon::Printable;
+using zorvcommon::Quoted;
 
 namespace {
 
@@ -123,10 +124,11 @@ Catalogue CatalogueLoader::Load() {
   return catalogue;
 }
 
-std::vector<WatchRoot> CatalogueLoader::Roots(const Catalogue& catalogue) {
+std::vector<WatchRoot> CatalogueLoader::Honour(Catalogue* catalogue) {
   std::vector<WatchRoot> roots;
   std::set<std::string> skipped;
-  for (const CatalogueQueue& entry : catalogue) {
+  for (CatalogueQueue& entry : *catalogue) {
+    std::vector<MonitorQueue::MonitorQueueConfig> honoured;
     for (const auto& config : entry.queue._configs) {
       std::string why = zorvcommon::WatchPathProblem(config._path);
       if (why.empty() && (config._mask & kDeliverable) == 0) {
@@ -139,15 +141,17 @@ std::vector<WatchRoot> CatalogueLoader::Roots(const Catalogue& catalogue) {
       }
       if (why.empty()) {
         roots.push_back({config._path, config._mask});
+        honoured.push_back(config);
         continue;
       }
-      const std::string line = "skipping configuration \"" + Printable(config._path) +
-                               "\" of queue \"" + Printable(entry.queue._name) + "\" (" +
+      const std::string line = "skipping configuration " + Quoted(config._path) + " of queue " +
+                               Quoted(entry.queue._name) + " (" +
                                zorvcommon::QueueTypeName(entry.type) + "/" + Printable(entry.file) +
                                "): " + why;
       if (skipped_.count(line) == 0) syslog(LOG_WARNING, "%s", line.c_str());
       skipped.insert(line);
     }
+    entry.queue._configs = std::move(honoured);
   }
   skipped_ = std::move(skipped);
   return roots;

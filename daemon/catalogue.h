@@ -41,11 +41,12 @@ class CatalogueLoader {
   // loads once more.
   Catalogue Load();
 
-  // One tree per configuration of |catalogue| that the watcher can honour:
-  // an absolute, normalised path and a mask with an event kind it
-  // delivers.  Every other configuration is logged once, by queue and
-  // file, with the reason, while it stays in the catalogue.
-  std::vector<WatchRoot> Roots(const Catalogue& catalogue);
+  // Keeps in |catalogue| only the configurations the watcher can honour
+  // (an absolute, normalised path and a mask with an event kind it
+  // delivers) and returns their trees.  A configuration taken out gets no
+  // event; each is logged once, by queue and file, with the reason, while
+  // it stays in the catalogue.
+  std::vector<WatchRoot> Honour(Catalogue* catalogue);
 
  private:
   using FileKey = std::pair<QueueType, std::string>;

@@ -3,6 +3,7 @@
 #include "watch_tree.h"
 
 #include <errno.h>
+#include <poll.h>
 #include <string.h>
 #include <sys/inotify.h>
 #include <syslog.h>
@@ -16,7 +17,7 @@
 namespace zorvnotifyd {
 namespace {
 
-using zorvcommon::Printable;
+using zorvcommon::Quoted;
 
 // Watched on every directory whatever the queues want: they tell the tree
 // that directories came, went or moved, and why a watch ends.
@@ -90,17 +91,17 @@ void WatchTree::Sync(const std::vector<WatchRoot>& roots) {
     const auto before = was_limited.find(root);
     if (context.unwatched == 0) {
       if (before != was_limited.end()) {
-        syslog(LOG_NOTICE, "all %zu directories of tree \"%s\" are watched now", context.dirs,
-               Printable(root).c_str());
+        syslog(LOG_NOTICE, "all %zu directories of tree %s are watched now", context.dirs,
+               Quoted(root).c_str());
       }
       continue;
     }
     limited_[root] = context.unwatched;
     if (before == was_limited.end() || before->second != context.unwatched) {
       syslog(LOG_ERR,
-             "cannot watch %zu of %zu directories of tree \"%s\": inotify watch limit reached "
+             "cannot watch %zu of %zu directories of tree %s: inotify watch limit reached "
              "(raise fs.inotify.max_user_watches); trying again every %g s",
-             context.unwatched, context.dirs, Printable(root).c_str(), retry_seconds_);
+             context.unwatched, context.dirs, Quoted(root).c_str(), retry_seconds_);
     }
   }
   // Paths not met in this round are no longer wanted, or no longer there.
@@ -121,8 +122,8 @@ void WatchTree::Tick(EventSink& sink) {
       if (!exists || (watch.dev == st.st_dev && watch.ino == st.st_ino)) continue;
       // Another directory now answers to the path (a file system mounted
       // on it, or it was replaced while events were lost).
-      syslog(LOG_NOTICE, "tree \"%s\" is another directory now: watching it afresh",
-             Printable(root).c_str());
+      syslog(LOG_NOTICE, "tree %s is another directory now: watching it afresh",
+             Quoted(root).c_str());
       Drop(root, nullptr);
     }
     if (!exists) continue;  // logged as missing already, when it went
@@ -131,7 +132,7 @@ void WatchTree::Tick(EventSink& sink) {
     std::string why;
     if (!WatchRootTree(root, context, &why)) continue;
     if (missing_.erase(root) != 0) {
-      syslog(LOG_NOTICE, "watching tree \"%s\" again: %zu directories", Printable(root).c_str(),
+      syslog(LOG_NOTICE, "watching tree %s again: %zu directories", Quoted(root).c_str(),
              context.dirs);
     }
     if (context.unwatched != 0) limited_[root] += context.unwatched;
@@ -229,9 +230,15 @@ void WatchTree::Handle(const RawEvent& event, EventSink& sink) {
       }
       return static_cast<const RawEvent*>(nullptr);
     };
+    // The kernel queues the two halves within one rename: a half that is
+    // not there yet comes within a moment.
     bool failed = false;
     const RawEvent* to = match();
-    if (to == nullptr && Fill(&failed)) to = match();
+    for (int tries = 0; to == nullptr && tries < 2 && !failed; ++tries) {
+      struct pollfd ready = {fd(), POLLIN, 0};
+      if (tries == 1) poll(&ready, 1, 1);
+      if (Fill(&failed)) to = match();
+    }
     const auto parent = to == nullptr ? watches_.end() : watches_.find(to->wd);
     if (parent == watches_.end()) {
       for (const std::string& target : targets) Drop(target, "moved away");
@@ -240,8 +247,9 @@ void WatchTree::Handle(const RawEvent& event, EventSink& sink) {
     std::vector<std::string> destinations;
     for (const std::string& path : parent->second.paths)
       destinations.push_back(path + "/" + to->name);
-    Move(targets, destinations);
-    moves_.insert(event.cookie);
+    // A directory that was not watched (gone again before its watch was
+    // made) is scanned where it arrives.
+    if (Move(targets, destinations)) moves_.insert(event.cookie);
   } else if (is_dir && (event.mask & IN_DELETE)) {
     for (const std::string& target : targets) Drop(target, "deleted");
   } else if (is_dir && (event.mask & (IN_CREATE | IN_MOVED_TO))) {
@@ -323,7 +331,7 @@ int WatchTree::Add(int dir, const struct stat& st, const std::string& path, Walk
     if (errno == ENOSPC) {
       ++context.unwatched;
     } else if (errno != ENOENT) {
-      syslog(LOG_WARNING, "cannot watch \"%s\": %s", Printable(path).c_str(), strerror(errno));
+      syslog(LOG_WARNING, "cannot watch %s: %s", Quoted(path).c_str(), strerror(errno));
     }
     return -1;
   }
@@ -361,14 +369,14 @@ void WatchTree::AddAndScan(const std::string& path, EventSink& sink) {
   if (context.unwatched == 0) return;
   if (limited_.empty()) {
     syslog(LOG_ERR,
-           "cannot watch %zu new directories at \"%s\": inotify watch limit reached (raise "
+           "cannot watch %zu new directories at %s: inotify watch limit reached (raise "
            "fs.inotify.max_user_watches); trying again every %g s",
-           context.unwatched, Printable(path).c_str(), retry_seconds_);
+           context.unwatched, Quoted(path).c_str(), retry_seconds_);
   }
   limited_[root] += context.unwatched;
 }
 
-void WatchTree::Move(const std::vector<std::string>& from, const std::vector<std::string>& to) {
+bool WatchTree::Move(const std::vector<std::string>& from, const std::vector<std::string>& to) {
   // What lies below the moved directory, relative to it, and its watch.
   std::set<std::pair<std::string, int>> below;
   std::set<int> moved;
@@ -413,6 +421,7 @@ void WatchTree::Move(const std::vector<std::string>& from, const std::vector<std
     context.synced = &synced;  // an exact mask
     Add(dir.get(), st, path, context);
   }
+  return !moved.empty();
 }
 
 void WatchTree::Drop(const std::string& path, const char* why) {
@@ -439,8 +448,8 @@ void WatchTree::Unmap(const std::string& path, bool release, const char* why) {
 
 void WatchTree::NoteRootMissing(const std::string& path, const std::string& why) {
   if (!missing_.emplace(path, why).second) return;
-  syslog(LOG_NOTICE, "not watching tree \"%s\": %s; looking for it again every %g s",
-         Printable(path).c_str(), why.c_str(), retry_seconds_);
+  syslog(LOG_NOTICE, "not watching tree %s: %s; looking for it again every %g s",
+         Quoted(path).c_str(), why.c_str(), retry_seconds_);
 }
 
 }  // namespace zorvnotifyd

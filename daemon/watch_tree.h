@@ -151,7 +151,8 @@ class WatchTree {
   // Moves the watches at and below each path of |from| to each path of
   // |to| (a rename within the trees; several paths when the directories
   // have several), then sets the kernel masks that the new place changes.
-  void Move(const std::vector<std::string>& from, const std::vector<std::string>& to);
+  // False when nothing was watched there.
+  bool Move(const std::vector<std::string>& from, const std::vector<std::string>& to);
   // Forgets |path| and every path below it; |why| says why when a root is
   // among them ("deleted", "moved away", ...).
   void Drop(const std::string& path, const char* why);

@@ -80,7 +80,7 @@ int Serve(bool json, double retry_seconds) {
   Catalogue catalogue = loader.Load();
   Reporter reporter(catalogue, json);
   WatchTree tree(std::move(inotify), retry_seconds);
-  tree.Sync(loader.Roots(catalogue));
+  tree.Sync(loader.Honour(&catalogue));
   syslog(LOG_INFO, "ready: watching %zu directories for %zu queues", tree.size(), catalogue.size());
   const int64_t retry_ms = std::max<int64_t>(1, int64_t(retry_seconds * 1000));
   int64_t next_tick = NowMs() + retry_ms;
@@ -105,7 +105,7 @@ int Serve(bool json, double retry_seconds) {
     if (ready > 0 && (fds[1].revents & POLLIN) && !tree.ReadEvents(reporter)) return 1;
     if (ready > 0 && (fds[2].revents & POLLIN) && catalogue_watch.ReadChanges()) {
       catalogue = loader.Load();
-      tree.Sync(loader.Roots(catalogue));
+      tree.Sync(loader.Honour(&catalogue));
       syslog(LOG_INFO, "catalogue reloaded: watching %zu directories for %zu queues", tree.size(),
              catalogue.size());
     }

@@ -1,17 +1,23 @@
-// End-to-end test of the zorvnotifyd daemon, run with --json in this program's
-// sandbox over trees under /tmp.  Each step compares the exact sequence of
-// lines, so a line that must not come shows up in place of one that must.
+// End-to-end tests of the zorvnotifyd daemon, run in this program's sandbox
+// over trees under /tmp with real inotify events.  Where the order of lines
+// is fixed, each step compares the exact sequence, so a line that must not
+// come shows up in place of one that must.
 
 #include <fcntl.h>
 #include <poll.h>
+#include <sched.h>
 #include <signal.h>
 #include <sys/inotify.h>
+#include <sys/mount.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <cstdlib>
 #include <fstream>
+#include <functional>
+#include <map>
+#include <set>
 #include <sstream>
 #include <string>
 #include <vector>
@@ -27,14 +33,27 @@ namespace {
 using namespace ZORV::ZORVNOTIFYD;  // NOLINT
 using Lines = std::vector<std::string>;
 
-// The daemon as a child process with --json.
+// Writes |text| to |path|; false on failure.
+bool Put(const std::string& path, const std::string& text) {
+  std::ofstream out(path);
+  out << text;
+  return static_cast<bool>(out.flush());
+}
+
+// The daemon as a child process.  |in_child| runs in the child before the
+// daemon is executed; it exits with 126 when it fails.
 class Daemon {
  public:
-  Daemon() {
+  explicit Daemon(Lines args = {"--json"}, const std::function<bool()>& in_child = nullptr) {
     EXPECT_TRUE(pipe2(out_, O_CLOEXEC) == 0 && pipe2(err_, O_CLOEXEC) == 0);
     if ((pid_ = fork()) == 0) {
       if (dup2(out_[1], 1) < 0 || dup2(err_[1], 2) < 0) _exit(125);
-      execl(ZORVNOTIFYD_PATH, ZORVNOTIFYD_PATH, "--json", nullptr);
+      if (in_child && !in_child()) _exit(126);
+      args.insert(args.begin(), ZORVNOTIFYD_PATH);
+      std::vector<char*> argv;
+      for (std::string& arg : args) argv.push_back(&arg[0]);
+      argv.push_back(nullptr);
+      execv(ZORVNOTIFYD_PATH, argv.data());
       _exit(127);
     }
     for (int fd : {out_[1], err_[1]}) close(fd);
@@ -43,15 +62,24 @@ class Daemon {
     if (pid_ > 0 && kill(pid_, SIGKILL) == 0) waitpid(pid_, nullptr, 0);
     for (int fd : {out_[0], err_[0]}) close(fd);
   }
+  pid_t pid() const { return pid_; }
   // The next line of standard output (standard error when |err|), waiting
-  // up to 5 s; "" on timeout or at the end.  Lines come whole.
+  // up to 10 s; "" on timeout or at the end.
   std::string Read(bool err = false) {
-    struct pollfd p = {err ? err_[0] : out_[0], POLLIN, 0};
-    std::string text;
-    char c;
-    if (poll(&p, 1, 5000) <= 0) return "";
-    while (read(p.fd, &c, 1) == 1 && c != '\n') text += c;
-    return text;
+    std::string& buffered = err ? err_text_ : out_text_;
+    for (;;) {
+      const size_t end = buffered.find('\n');
+      if (end != std::string::npos) {
+        const std::string line = buffered.substr(0, end);
+        buffered.erase(0, end + 1);
+        return line;
+      }
+      struct pollfd p = {err ? err_[0] : out_[0], POLLIN, 0};
+      char chunk[65536];
+      ssize_t n = 0;
+      if (poll(&p, 1, 10000) <= 0 || (n = read(p.fd, chunk, sizeof(chunk))) <= 0) return "";
+      buffered.append(chunk, size_t(n));
+    }
   }
   // True once a line of standard error holds |text|.
   bool Logged(const std::string& text) {
@@ -59,6 +87,26 @@ class Daemon {
       if (line.find(text) != std::string::npos) return true;
     }
     return false;
+  }
+  // Reads JSON lines, each as "queue path mask" ("queue lost" for a lost
+  // notice), until one equal to |last|; every line read, |last| included.
+  // Stops early (the result then lacks |last|) on a timeout.
+  Lines ReadUntil(const std::string& last) {
+    Lines lines;
+    for (std::string text = Read(); !text.empty(); text = Read()) {
+      Json::Value v;
+      std::istringstream in(text);
+      if (!Json::parseFromStream(Json::CharReaderBuilder(), in, &v, nullptr)) {
+        lines.push_back(text);
+      } else if (v.isMember("lost")) {
+        lines.push_back(v["queue"].asString() + " lost");
+      } else {
+        lines.push_back(v["queue"].asString() + " " + v["path"].asString() + " " +
+                        std::to_string(v["mask"].asUInt()));
+      }
+      if (lines.back() == last) break;
+    }
+    return lines;
   }
   // Sends SIGTERM and returns the exit status, -1 when it did not exit.
   int Stop() {
@@ -71,12 +119,13 @@ class Daemon {
  private:
   pid_t pid_ = -1;
   int out_[2] = {-1, -1}, err_[2] = {-1, -1};
+  std::string out_text_, err_text_;
 };
 
 constexpr unsigned kCreate = IN_CREATE, kModify = IN_MODIFY, kDelete = IN_DELETE;
 
-// The expected line of queue 'a', 'b' or 'c' of the test for |path| below
-// /tmp.
+// The expected line of queue 'a', 'b' or 'c' of the first test for |path|
+// below /tmp.
 std::string E(char queue, const std::string& path, unsigned mask) {
   const char* id = queue == 'a' ? "a etc fa" : queue == 'b' ? "b share fb" : "c local-etc fc";
   return std::string(id) + " /tmp/" + path + " " + std::to_string(mask);
@@ -110,16 +159,18 @@ void Expect(Daemon& daemon, const Lines& expected) {
   EXPECT_EQ(got, expected);
 }
 
+void MakeDirs(const Lines& dirs) {
+  for (const std::string& dir : dirs) ASSERT_EQ(mkdir(dir.c_str(), 0755), 0) << dir;
+}
+
 // Files are written with std::ofstream: IN_CREATE, then IN_MODIFY when the
 // stream is flushed at its end, then IN_CLOSE_WRITE.
 TEST(DaemonTest, ReportsToEachQueueExactlyItsEventsAndFollowsTheCatalogue) {
   ZORV_REQUIRE_SANDBOX();
   zorv_test::ResetStore();
   ASSERT_EQ(std::system("rm -rf /tmp/w /tmp/w2 /tmp/d"), 0);
-  for (const char* dir : {"/tmp/w", "/tmp/w/b", "/tmp/w2", "/tmp/d", "/tmp/d/inner"}) {
-    ASSERT_EQ(mkdir(dir, 0755), 0) << dir;
-  }
-  for (const char* path : {"/tmp/d/f", "/tmp/d/inner/g"}) std::ofstream(path) << "x";
+  MakeDirs({"/tmp/w", "/tmp/w/b", "/tmp/w2", "/tmp/d", "/tmp/d/inner"});
+  for (const char* path : {"/tmp/d/f", "/tmp/d/inner/g"}) Put(path, "x");
   Register("a", "fa", MONITOR_QUEUE_TYPE_ETC_DIR, "/tmp/w", kCreate | kModify | kDelete, "\\.tmp$");
   Register("b", "fb", MONITOR_QUEUE_TYPE_SHARE_DIR, "/tmp/w/b", IN_CLOSE_WRITE | kDelete);
   Daemon daemon;
@@ -127,17 +178,18 @@ TEST(DaemonTest, ReportsToEachQueueExactlyItsEventsAndFollowsTheCatalogue) {
 
   // Two masks on overlapping trees (queues in catalogue order: share
   // first); the ignored file never shows.
-  for (const char* path : {"/tmp/w/f1", "/tmp/w/x.tmp", "/tmp/w/b/g"}) std::ofstream(path) << "x";
+  for (const char* path : {"/tmp/w/f1", "/tmp/w/x.tmp", "/tmp/w/b/g"}) Put(path, "x");
   for (const char* path : {"/tmp/w/x.tmp", "/tmp/w/f1", "/tmp/w/b/g"}) unlink(path);
   Expect(daemon, {E('a', "w/f1", kCreate), E('a', "w/f1", kModify), E('a', "w/b/g", kCreate),
                   E('a', "w/b/g", kModify), E('b', "w/b/g", IN_CLOSE_WRITE),
                   E('a', "w/f1", kDelete), E('b', "w/b/g", kDelete), E('a', "w/b/g", kDelete)});
 
   // A directory made while running is watched once reported.  One moved in
-  // has its older content reported, and is watched below once that is.
+  // has its older content reported with the kinds the queue wants of
+  // IN_CREATE|IN_MODIFY|IN_CLOSE_WRITE|IN_MOVED_TO, and is watched below.
   ASSERT_EQ(mkdir("/tmp/w/new", 0755), 0);
   Expect(daemon, {E('a', "w/new", kCreate | IN_ISDIR)});
-  std::ofstream("/tmp/w/new/h") << "x";
+  Put("/tmp/w/new/h", "x");
   unlink("/tmp/w/new/h");
   rmdir("/tmp/w/new");
   ASSERT_EQ(rename("/tmp/d", "/tmp/w/d"), 0);
@@ -145,26 +197,263 @@ TEST(DaemonTest, ReportsToEachQueueExactlyItsEventsAndFollowsTheCatalogue) {
          {E('a', "w/new/h", kCreate), E('a', "w/new/h", kModify), E('a', "w/new/h", kDelete),
           E('a', "w/new", kDelete | IN_ISDIR), E('a', "w/d/f", kCreate | kModify),
           E('a', "w/d/inner", kCreate | IN_ISDIR), E('a', "w/d/inner/g", kCreate | kModify)});
-  std::ofstream("/tmp/w/d/inner/k") << "x";
+  Put("/tmp/w/d/inner/k", "x");
   Expect(daemon, {E('a', "w/d/inner/k", kCreate), E('a', "w/d/inner/k", kModify)});
 
   // A directory moved away is no longer watched.
   ASSERT_EQ(rename("/tmp/w/d", "/tmp/d"), 0);
-  for (const char* path : {"/tmp/d/inner/z", "/tmp/w/marker"}) std::ofstream(path) << "x";
+  for (const char* path : {"/tmp/d/inner/z", "/tmp/w/marker"}) Put(path, "x");
   Expect(daemon, {E('a', "w/marker", kCreate), E('a', "w/marker", kModify)});
 
   // A queue registered now is served without a restart (the reload follows
   // the queue file's own inotify event), and the reload loses no event of
   // the unchanged tree.
   Register("c", "fc", MONITOR_QUEUE_TYPE_LOCAL_ETC_DIR, "/tmp/w2", kCreate);
-  std::ofstream("/tmp/w/during") << "x";
+  Put("/tmp/w/during", "x");
   ASSERT_TRUE(daemon.Logged("catalogue reloaded: watching 3 directories for 3 queues"));
-  std::ofstream("/tmp/w2/p") << "x";
+  Put("/tmp/w2/p", "x");
   Expect(daemon,
          {E('a', "w/during", kCreate), E('a', "w/during", kModify), E('c', "w2/p", kCreate)});
 
+  // A queue file that turns malformed keeps serving its last good content
+  // until it is valid again.
+  ASSERT_TRUE(Put("/usr/local/etc/zorvnotifyd/fc", "[{\"queue\": \"c\", "));
+  ASSERT_TRUE(daemon.Logged("queue file local-etc/fc cannot be loaded: not valid JSON"));
+  Put("/tmp/w2/q", "x");
+  Expect(daemon, {E('c', "w2/q", kCreate)});
+  ASSERT_TRUE(Put("/usr/local/etc/zorvnotifyd/fc",
+                  "[{\"queue\": \"c\", \"config\": [{\"path\": \"/tmp/w2\", \"mask\": 256}]}]"));
+  ASSERT_TRUE(daemon.Logged("queue file local-etc/fc loads again: 1 queues"));
+
   EXPECT_EQ(daemon.Stop(), 0);
   EXPECT_EQ(daemon.Read(), "") << "a line after the last expected one";
+}
+
+// Symbolic links and bind mounts to a watched directory, paths the watcher
+// cannot honour, links inside a tree, forged lines, and directory moves.
+TEST(DaemonTest, ServesEveryPathOfADirectoryAndNothingItCannotHonour) {
+  ZORV_REQUIRE_SANDBOX();
+  zorv_test::ResetStore();
+  ASSERT_EQ(std::system("umount /tmp/bind 2>/dev/null; rm -rf /tmp/w /tmp/bind /tmp/link "
+                        "/tmp/secret /tmp/d"),
+            0);
+  MakeDirs({"/tmp/w", "/tmp/bind", "/tmp/secret", "/tmp/d"});
+  ASSERT_TRUE(Put("/tmp/d/g", "x"));
+  ASSERT_EQ(symlink("/tmp/w", "/tmp/link"), 0);
+  ASSERT_EQ(symlink("/tmp/secret", "/tmp/w/lnk"), 0);
+  ASSERT_EQ(mount("/tmp/w", "/tmp/bind", nullptr, MS_BIND, nullptr), 0);
+  const unsigned mask = IN_CREATE | IN_MOVED_FROM | IN_MOVED_TO;
+  for (const char* path : {"/tmp/w", "/tmp/link", "/tmp/bind"}) {
+    Register(path + 5, "f", MONITOR_QUEUE_TYPE_ETC_DIR, path, mask);
+  }
+  Register("slash", "f", MONITOR_QUEUE_TYPE_ETC_DIR, "/tmp/w/", mask);
+  Register("root", "f", MONITOR_QUEUE_TYPE_ETC_DIR, "/", mask);
+  Register("empty", "f", MONITOR_QUEUE_TYPE_ETC_DIR, "", mask);
+  Register("unmount", "f", MONITOR_QUEUE_TYPE_ETC_DIR, "/tmp/w", IN_UNMOUNT);
+  Daemon daemon(Lines{});
+  for (const char* line :
+       {"skipping configuration \"/tmp/w/\" of queue \"slash\" (etc/f): it ends in \"/\", which no "
+        "reported path can match; write it as \"/tmp/w\"",
+        "skipping configuration \"/\" of queue \"root\" (etc/f): it is the root directory",
+        "skipping configuration \"\" of queue \"empty\" (etc/f): it is empty",
+        "skipping configuration \"/tmp/w\" of queue \"unmount\" (etc/f): its mask 0x2000 holds no "
+        "event kind",
+        "ready: watching 1 directories for 7 queues"}) {
+    ASSERT_TRUE(daemon.Logged(line)) << line;
+  }
+
+  // Each queue hears of every event under its own path; nothing through
+  // the link inside the tree; a newline in a name cannot forge a line.
+  ASSERT_TRUE(Put("/tmp/secret/s", "x"));
+  ASSERT_TRUE(Put("/tmp/w/x\nqueue w: IN_CREATE forged", "x"));
+  ASSERT_EQ(rename("/tmp/d", "/tmp/w/d"), 0);
+  // Each line three times, under the three paths in their order.
+  auto expect = [&daemon](const Lines& what) {
+    Lines expected, got;
+    for (const std::string& line : what) {
+      const size_t blank = line.find(' ');
+      for (const std::string queue : {"bind", "link", "w"}) {
+        expected.push_back("queue " + queue + " [etc/f]: " + line.substr(0, blank) + " /tmp/" +
+                           queue + line.substr(blank + 1));
+        got.push_back(daemon.Read());
+      }
+    }
+    EXPECT_EQ(got, expected);
+  };
+  expect({"IN_CREATE /x\\x0Aqueue w: IN_CREATE forged", "IN_MOVED_TO|IN_ISDIR /d",
+          "IN_MOVED_TO|IN_CREATE /d/g"});
+  // A move within the trees: the two halves, nothing for what it holds.
+  ASSERT_EQ(rename("/tmp/w/d", "/tmp/w/e"), 0);
+  ASSERT_TRUE(Put("/tmp/w/e/h", "x"));
+  expect({"IN_MOVED_FROM|IN_ISDIR /d", "IN_MOVED_TO|IN_ISDIR /e", "IN_CREATE /e/h"});
+  EXPECT_EQ(daemon.Stop(), 0);
+  EXPECT_EQ(daemon.Read(), "") << "a line after the last expected one";
+  umount2("/tmp/bind", MNT_DETACH);
+}
+
+// Every file written at once in a directory made by mkdir -p, several
+// levels deep, reaches both a queue that wants IN_CREATE and one that wants
+// only IN_CLOSE_WRITE, with both cores busy.
+TEST(DaemonTest, HearsOfEveryFileInNewDirectories) {
+  ZORV_REQUIRE_SANDBOX();
+  zorv_test::ResetStore();
+  ASSERT_EQ(std::system("rm -rf /tmp/t && mkdir /tmp/t"), 0);
+  Register("create", "f", MONITOR_QUEUE_TYPE_ETC_DIR, "/tmp/t", IN_CREATE);
+  Register("close", "f", MONITOR_QUEUE_TYPE_ETC_DIR, "/tmp/t", IN_CLOSE_WRITE);
+  Daemon daemon;
+  ASSERT_TRUE(daemon.Logged("ready: watching 1 directories"));
+  std::vector<pid_t> busy;
+  for (int i = 0; i < 2; ++i) {
+    if (const pid_t pid = fork(); pid == 0) {
+      for (;;) {
+      }
+    } else {
+      busy.push_back(pid);
+    }
+  }
+  constexpr int kFiles = 2000;
+  for (int i = 0; i < kFiles; ++i) {
+    std::string dir = "/tmp/t/" + std::to_string(i);
+    for (const char* level : {"", "/a", "/b"}) ASSERT_EQ(mkdir((dir += level).c_str(), 0755), 0);
+    ASSERT_TRUE(Put(dir + "/file", "x"));
+  }
+  for (pid_t pid : busy) kill(pid, SIGKILL), waitpid(pid, nullptr, 0);
+  ASSERT_TRUE(Put("/tmp/t/end", "x"));
+  std::map<std::string, std::set<std::string>> heard;
+  for (const std::string& line : daemon.ReadUntil("close /tmp/t/end 8")) {
+    const size_t space = line.find(' ');
+    const std::string queue = line.substr(0, space);
+    const unsigned mask = std::stoul(line.substr(line.rfind(' ') + 1));
+    if (line.find("/file ") != std::string::npos &&
+        (mask & (queue == "close" ? IN_CLOSE_WRITE : IN_CREATE)) != 0) {
+      heard[queue].insert(line.substr(space + 1, line.rfind(' ') - space - 1));
+    }
+  }
+  EXPECT_EQ(heard["create"].size(), size_t(kFiles));
+  EXPECT_EQ(heard["close"].size(), size_t(kFiles));
+}
+
+// A tree missing at start, deleted and made again, moved away and back,
+// and a file system mounted on it and unmounted: each is watched again
+// without a reload, and what it holds when it appears is reported.
+TEST(DaemonTest, WatchesTreesAgainThatWentAwayOrAppearedLater) {
+  ZORV_REQUIRE_SANDBOX();
+  zorv_test::ResetStore();
+  ASSERT_EQ(std::system("umount /tmp/r 2>/dev/null; rm -rf /tmp/r /tmp/r.old /tmp/late"), 0);
+  MakeDirs({"/tmp/r"});
+  Register("r", "f", MONITOR_QUEUE_TYPE_ETC_DIR, "/tmp/r", kCreate);
+  Register("late", "f", MONITOR_QUEUE_TYPE_ETC_DIR, "/tmp/late", kCreate);
+  Daemon daemon({"--json", "--retry", "0.05"});
+  ASSERT_TRUE(
+      daemon.Logged("not watching tree \"/tmp/late\": No such file or directory; looking "
+                    "for it again every 0.05 s"));
+  auto heard = [&daemon](const std::string& line) {
+    const Lines lines = daemon.ReadUntil(line);
+    return !lines.empty() && lines.back() == line;
+  };
+  MakeDirs({"/tmp/late"});
+  ASSERT_TRUE(Put("/tmp/late/a", "x"));
+  EXPECT_TRUE(heard("late /tmp/late/a 256"));
+
+  ASSERT_EQ(std::system("rm -r /tmp/r && mkdir /tmp/r && echo x > /tmp/r/b"), 0);
+  EXPECT_TRUE(daemon.Logged("not watching tree \"/tmp/r\": it was deleted;"));
+  EXPECT_TRUE(heard("r /tmp/r/b 256"));
+
+  // Nothing done to the tree while it is away reaches the queue under its
+  // path; what it holds when it is back does.
+  ASSERT_EQ(rename("/tmp/r", "/tmp/r.old"), 0);
+  EXPECT_TRUE(daemon.Logged("not watching tree \"/tmp/r\": it was moved away;"));
+  ASSERT_TRUE(Put("/tmp/r.old/x", "x") && Put("/tmp/late/marker", "x"));
+  const Lines away = daemon.ReadUntil("late /tmp/late/marker 256");
+  EXPECT_EQ(away, Lines({"late /tmp/late/marker 256"}));
+  ASSERT_EQ(rename("/tmp/r.old", "/tmp/r"), 0);
+  EXPECT_TRUE(daemon.Logged("watching tree \"/tmp/r\" again"));
+  EXPECT_TRUE(heard("r /tmp/r/x 256"));
+
+  ASSERT_EQ(mount("zorv-test", "/tmp/r", "tmpfs", 0, "mode=0755"), 0);
+  EXPECT_TRUE(daemon.Logged("tree \"/tmp/r\" is another directory now"));
+  ASSERT_TRUE(Put("/tmp/r/m", "x"));
+  EXPECT_TRUE(heard("r /tmp/r/m 256"));
+  ASSERT_EQ(umount("/tmp/r"), 0);
+  EXPECT_TRUE(daemon.Logged("not watching tree \"/tmp/r\": it was unmounted;"));
+  EXPECT_TRUE(daemon.Logged("watching tree \"/tmp/r\" again"));
+  ASSERT_TRUE(Put("/tmp/r/u", "x"));
+  EXPECT_TRUE(heard("r /tmp/r/u 256"));
+  EXPECT_EQ(daemon.Stop(), 0);
+}
+
+// In a user namespace of its own the daemon has a watch limit of its own:
+// max_inotify_watches there leaves the machine's settings alone.
+bool EnterUserNamespace() {
+  return unshare(CLONE_NEWUSER) == 0 && Put("/proc/self/setgroups", "deny") &&
+         Put("/proc/self/uid_map", "0 0 1") && Put("/proc/self/gid_map", "0 0 1");
+}
+
+// Sets the watch limit of the user namespace of process |pid|.
+bool SetWatchLimit(pid_t pid, int limit) {
+  const pid_t child = fork();
+  if (child == 0) {
+    const int ns = open(("/proc/" + std::to_string(pid) + "/ns/user").c_str(), O_RDONLY);
+    _exit(ns >= 0 && setns(ns, CLONE_NEWUSER) == 0 &&
+                  Put("/proc/sys/user/max_inotify_watches", std::to_string(limit))
+              ? 0
+              : 1);
+  }
+  int status = -1;
+  return child > 0 && waitpid(child, &status, 0) == child && status == 0;
+}
+
+TEST(DaemonTest, ServesWhatFitsUnderTheWatchLimitAndSaysWhenEventsWereLost) {
+  ZORV_REQUIRE_SANDBOX();
+  const pid_t probe = fork();
+  if (probe == 0) _exit(EnterUserNamespace() ? 0 : 1);
+  int status = -1;
+  if (waitpid(probe, &status, 0) != probe || status != 0) {
+    GTEST_SKIP() << "no user namespaces here: the watch limit cannot be set apart";
+  }
+  zorv_test::ResetStore();
+  ASSERT_EQ(std::system("rm -rf /tmp/big && mkdir -p /tmp/big/0/1/2 /tmp/big/3/4/5/6 "
+                        "/tmp/big/7/8/9 /tmp/big/10 /tmp/big/11 /tmp/big/12/13"),
+            0);
+  Register("big", "f", MONITOR_QUEUE_TYPE_ETC_DIR, "/tmp/big", kCreate);
+  // 10 watches: 3 for the configuration directories, 7 of the 15 of the tree.
+  Daemon daemon({"--json", "--retry", "0.05"}, [] {
+    return EnterUserNamespace() && Put("/proc/sys/user/max_inotify_watches", "10");
+  });
+  ASSERT_TRUE(
+      daemon.Logged("cannot watch 8 of 15 directories of tree \"/tmp/big\": inotify "
+                    "watch limit reached (raise fs.inotify.max_user_watches); trying "
+                    "again every 0.05 s"));
+  ASSERT_TRUE(daemon.Logged("ready: watching 7 directories for 1 queues"));
+  ASSERT_TRUE(Put("/tmp/big/f", "x"));
+  EXPECT_EQ(daemon.ReadUntil("big /tmp/big/f 256"), Lines({"big /tmp/big/f 256"}));
+
+  ASSERT_TRUE(SetWatchLimit(daemon.pid(), 100));
+  ASSERT_TRUE(daemon.Logged("all 15 directories of tree \"/tmp/big\" are watched now"));
+  ASSERT_EQ(std::system("cd /tmp/big && for d in 0/1/2 3/4/5/6 7/8/9 10 11 12/13; do "
+                        "touch $d/g; done"),
+            0);
+  EXPECT_EQ(
+      daemon.ReadUntil("big /tmp/big/12/13/g 256"),
+      Lines({"big /tmp/big/0/1/2/g 256", "big /tmp/big/3/4/5/6/g 256", "big /tmp/big/7/8/9/g 256",
+             "big /tmp/big/10/g 256", "big /tmp/big/11/g 256", "big /tmp/big/12/13/g 256"}));
+
+  // More events than the kernel queues while the daemon is stopped.
+  std::ifstream max_file("/proc/sys/fs/inotify/max_queued_events");
+  int max_queued = 0;
+  if (!(max_file >> max_queued) || max_queued > 200000) return;
+  ASSERT_EQ(kill(daemon.pid(), SIGSTOP), 0);
+  for (int i = 0; i <= max_queued; ++i) {
+    close(open(("/tmp/big/10/n" + std::to_string(i)).c_str(), O_CREAT | O_WRONLY, 0644));
+  }
+  ASSERT_EQ(kill(daemon.pid(), SIGCONT), 0);
+  const Lines flood = daemon.ReadUntil("big lost");
+  ASSERT_FALSE(flood.empty());
+  EXPECT_EQ(flood.back(), "big lost");
+  EXPECT_TRUE(daemon.Logged("inotify event queue overflowed, events were lost"));
+  ASSERT_TRUE(Put("/tmp/big/10/after", "x"));
+  EXPECT_EQ(daemon.ReadUntil("big /tmp/big/10/after 256").back(), "big /tmp/big/10/after 256");
+  EXPECT_EQ(daemon.Stop(), 0);
 }
 
 }  // namespace

@@ -30,22 +30,36 @@ Json::Value Parse(const std::string& text) {
   return value;
 }
 
+// Runs the tool with |args| and |input| on standard input; returns its exit
+// status (-1 when it did not exit) and sets |out| and |err|.
+int RunTool(const std::string& args, const std::string& input, std::string* out, std::string* err) {
+  std::ofstream("/tmp/in") << input;
+  const int status =
+      system(("'" ZORVNOTIFYCTL_PATH "' " + args + " </tmp/in >/tmp/out 2>/tmp/err").c_str());
+  std::ostringstream out_text, err_text;
+  out_text << std::ifstream("/tmp/out").rdbuf();
+  err_text << std::ifstream("/tmp/err").rdbuf();
+  *out = out_text.str();
+  *err = err_text.str();
+  return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+}
+
 // Runs the tool for each case in turn and checks what it gave.
 void Check(const std::vector<Case>& cases) {
   for (const Case& c : cases) {
-    std::ofstream("/tmp/in") << c.input;
-    const int status =
-        system(("'" ZORVNOTIFYCTL_PATH "' " + c.args + " </tmp/in >/tmp/out 2>/tmp/err").c_str());
-    std::ostringstream out, err;
-    out << std::ifstream("/tmp/out").rdbuf();
-    err << std::ifstream("/tmp/err").rdbuf();
-    EXPECT_EQ(WIFEXITED(status) ? WEXITSTATUS(status) : -1, c.status) << c.args << err.str();
+    std::string out, err;
+    EXPECT_EQ(RunTool(c.args, c.input, &out, &err), c.status) << c.args << err;
     if (c.status != 0) {
-      EXPECT_THAT(err.str(), ::testing::HasSubstr(c.expected)) << c.args;
+      EXPECT_THAT(err, ::testing::HasSubstr(c.expected)) << c.args;
     } else if (!c.expected.empty()) {
-      EXPECT_EQ(Parse(out.str()), Parse(c.expected)) << c.args;
+      EXPECT_EQ(Parse(out), Parse(c.expected)) << c.args;
     }
   }
+}
+
+// A queue "q" whose one configuration watches |path| (JSON string content).
+std::string WatchingPath(const std::string& path) {
+  return R"({"queue": "q", "config": [{"path": ")" + path + R"(", "mask": 1, "ignore": []}]})";
 }
 
 TEST(ZorvnotifyctlTest, RefusalsExitStatusesAndJsonOutput) {
@@ -70,8 +84,29 @@ TEST(ZorvnotifyctlTest, RefusalsExitStatusesAndJsonOutput) {
       {"get a ..", "", 2, R"(name ".." names a directory)"},
       {"delete a a/b", "", 2, R"("a/b" contains "/")"},
       {"list .q", "", 2, R"(".q" begins with ".")"},
+      // Paths the daemon could never match, each with the spelling to use.
+      {"upsert q", WatchingPath(""), 2, R"(config[0].path "" cannot be watched: it is empty)"},
+      {"upsert q", WatchingPath("rel/dir"), 2,
+       R"("rel/dir" cannot be watched: it is relative, )"
+       R"(and events carry absolute paths; write it as an absolute path such as "/rel/dir")"},
+      {"upsert q", WatchingPath("/"), 2, R"("/" cannot be watched: it is the root directory)"},
+      {"upsert q", WatchingPath("/a/"), 2,
+       R"("/a/" cannot be watched: it ends in "/", which no reported path can match; )"
+       R"(write it as "/a")"},
+      {"upsert q", WatchingPath("/a//b"), 2, R"("/a//b" cannot be watched: it holds "//", )"},
+      {"upsert q", WatchingPath("/a/./b"), 2,
+       R"("/a/./b" cannot be watched: it holds a "." or ".." component, which no reported )"
+       R"(path can match; write it as "/a/b")"},
+      {"upsert q", WatchingPath(R"(/a\n//b)"), 2,
+       R"("/a\x0A//b" cannot be watched: it holds "//", which no reported path can match; )"
+       R"(write it as "/a\x0A/b")"},
+      {"upsert q", WatchingPath(R"(/a\u0000b)"), 2,
+       R"("/a\x00b" cannot be watched: it holds a NUL)"},
   });
   ASSERT_NE(access("/usr/zorv", F_OK), 0) << "a refused command reached the library";
+  std::string out, err;
+  EXPECT_EQ(RunTool("--version upsert q", "", &out, &err), 0) << err;
+  EXPECT_EQ(out, "zorvnotifyctl 6.0.0\n");
 
   const std::string a =
       R"({"queue": "a", "config": [{"path": "/s/t", "mask": 4294967295, "ignore": ["p$"]}])";
@@ -95,7 +130,10 @@ TEST(ZorvnotifyctlTest, RefusalsExitStatusesAndJsonOutput) {
   std::ofstream("/usr/zorv/etc/zorvnotifyd/bad") << "not json";
   const std::string removed = R"({"file": "e", "path": "/usr/zorv/etc/zorvnotifyd/e",
                                   "queue": "b", "type": "etc", "removed": )";
+  const std::string dotted = WatchingPath("/a/.b/..c/d.");  // dotted names, not components
   Check({
+      {"upsert g", dotted, 0, ""},
+      {"--json get q g", "", 0, dotted},
       {"delete a bad", "", 1, "LoadFromFile failed, path=/usr/zorv/etc/zorvnotifyd/bad"},
       {"--json delete b e", "", 0, removed + "true}"},
       {"--json delete b e", "", 0, removed + "false}"},

@@ -18,6 +18,8 @@ std::string ParseCommandLine(int argc, const char* const* argv, CommandLine* lin
       line->json = true;
     } else if (arg == "--help" || arg == "-h") {
       line->help = true;
+    } else if (arg == "--version") {
+      line->version = true;
     } else if (arg == "--verbose" || arg == "-v") {
       line->verbose = true;
     } else if (arg == "--type" || arg == "-t") {

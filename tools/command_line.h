@@ -14,6 +14,7 @@ struct CommandLine {
   std::vector<std::string> args;  // the positional arguments after the command
   bool json = false;              // --json: machine-readable output
   bool help = false;              // --help or -h
+  bool version = false;           // --version
   bool verbose = false;           // --verbose or -v: the library's extra log lines
   bool type_given = false;        // --type appeared
   std::string type;               // the value of the last --type

@@ -8,6 +8,9 @@
 #include <memory>
 #include <sstream>
 
+#include "text.h"
+#include "watch_path.h"
+
 namespace zorvnotifyctl {
 namespace {
 
@@ -104,6 +107,16 @@ std::string ConfigProblem(const Json::Value& config, const std::string& where) {
   if (!config.isMember("path")) return where + ": missing key \"path\" (the watched directory)";
   if (!config["path"].isString()) {
     return where + ".path must be a string, not " + TypeName(config["path"]);
+  }
+  // The library stores any path, but the daemon matches the paths inotify
+  // reports, built from real directory names; a path that none of them can
+  // match would be a queue that silently never hears of anything.
+  const std::string path = config["path"].asString();
+  problem = zorvcommon::WatchPathProblem(path);
+  if (!problem.empty()) {
+    // The suggested spelling repeats the path, so it is escaped as well.
+    return where + ".path " + zorvcommon::Quoted(path) +
+           " cannot be watched: " + zorvcommon::Printable(problem);
   }
   if (!config.isMember("mask")) return where + ": missing key \"mask\" (the wanted event kinds)";
   problem = MaskProblem(config["mask"], where + ".mask");

@@ -50,8 +50,13 @@ constexpr CommandInfo kCommands[] = {
      "                                 \"ignore\": [\"\\\\.tmp$\"]}]}\n"
      "with \"queue\" a string, each \"path\" a string, each \"mask\" an integer from 0\n"
      "to 4294967295 and \"ignore\" (optional) an array of POSIX extended regular\n"
-     "expressions.  Unknown keys, wrong types, missing keys and patterns that do\n"
-     "not compile are refused with exit status 2, before anything is written.\n"},
+     "expressions.  Each \"path\" must be an absolute directory written the way the\n"
+     "daemon reports paths, from real directory names: \"/srv/share\", not\n"
+     "\"/srv/share/\", \"/srv//share\", \"/srv/./share\" or \"/srv/x/../share\".  Such a\n"
+     "path, a relative or empty one, or \"/\" alone could never match an event.\n"
+     "Unknown keys, wrong types, missing keys, such paths and patterns that do not\n"
+     "compile are refused with exit status 2, before anything is written; for a\n"
+     "path the message says how to write it.\n"},
     {"delete", 2, 2, true, RunDelete, "NAME FILE",
      "Removes the first queue named NAME from queue file FILE.  A name the file does\n"
      "not hold changes nothing and is not an error.  When no queue is left in the\n"
@@ -95,6 +100,7 @@ const char kOverview[] =
     "      --json        write JSON instead of tables\n"
     "  -v, --verbose     also show the library's detailed log lines\n"
     "  -h, --help        show help; after a command, that command's help\n"
+    "      --version     show the version and exit\n"
     "\n"
     "FILE is a plain name inside the configuration directory of the type, not\n"
     "beginning with \".\".  The store operations need root.\n"
@@ -151,6 +157,10 @@ int Dispatch(int argc, char** argv) {
   CommandLine line;
   const std::string error = ParseCommandLine(argc, argv, &line);
   if (!error.empty()) return UsageError(error);
+  if (line.version) {
+    std::cout << kProgram << ' ' << ZORVNOTIFYD_VERSION_STRING << '\n';
+    return kExitOk;
+  }
   if (line.help || line.command == "help") return RunHelp(line);
   if (line.command.empty()) {
     PrintOverview(std::cerr);
