@@ -131,10 +131,6 @@ void WatchTree::Tick(EventSink& sink) {
     context.found = &sink;
     std::string why;
     if (!WatchRootTree(root, context, &why)) continue;
-    if (missing_.erase(root) != 0) {
-      syslog(LOG_NOTICE, "watching tree %s again: %zu directories", Quoted(root).c_str(),
-             context.dirs);
-    }
     if (context.unwatched != 0) limited_[root] += context.unwatched;
   }
   if (!limited_.empty()) Sync(Roots());
@@ -218,7 +214,7 @@ void WatchTree::Handle(const RawEvent& event, EventSink& sink) {
   std::vector<std::string> targets;
   for (const std::string& path : paths) {
     targets.push_back(event.name.empty() ? path : path + "/" + event.name);
-    sink.Event(targets.back(), event.mask);
+    if (!ToldByParent(path, event)) sink.Event(targets.back(), event.mask);
   }
   const bool is_dir = (event.mask & IN_ISDIR) != 0;
   if (is_dir && (event.mask & IN_MOVED_FROM)) {
@@ -262,6 +258,18 @@ void WatchTree::Handle(const RawEvent& event, EventSink& sink) {
       if (by_path_.count(ParentOf(path)) == 0) Drop(path, "moved away");
     }
   }
+}
+
+bool WatchTree::ToldByParent(const std::string& path, const RawEvent& event) const {
+  // The kernel tells a watched parent of what happens to its entries, and
+  // a watched directory of what happens to itself: an event on a watched
+  // directory comes twice when its parent's watch asks for that kind too.
+  // The parent's copy is the one kept; the directory's own events on
+  // itself alone (deleted, moved) are not in the parent's.
+  const uint32_t kinds = event.mask & IN_ALL_EVENTS & ~(IN_DELETE_SELF | IN_MOVE_SELF);
+  if (!event.name.empty() || kinds == 0) return false;
+  const auto parent = by_path_.find(ParentOf(path));
+  return parent != by_path_.end() && (watches_.at(parent->second).mask & kinds) == kinds;
 }
 
 uint32_t WatchTree::MaskFor(std::string_view dir) const {
@@ -355,6 +363,9 @@ int WatchTree::Add(int dir, const struct stat& st, const std::string& path, Walk
   if (old != by_path_.end() && old->second != wd) Unmap(path, true, nullptr);  // replaced
   watch.paths.insert(path);
   by_path_[path] = wd;
+  if (!missing_.empty() && missing_.erase(path) != 0) {
+    syslog(LOG_NOTICE, "watching tree %s again", Quoted(path).c_str());
+  }
   return wd;
 }
 

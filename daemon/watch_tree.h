@@ -131,6 +131,9 @@ class WatchTree {
   bool Fill(bool* failed);
   // Handles the event at the front of pending_ (not an overflow).
   void Handle(const RawEvent& event, EventSink& sink);
+  // True when |event|, on the watched directory |path| itself, reaches the
+  // watch of its parent too, which reports it.
+  bool ToldByParent(const std::string& path, const RawEvent& event) const;
   // The union of the masks of the roots that |dir| is or lies below.
   uint32_t MaskFor(std::string_view dir) const;
   // The innermost root that |dir| is or lies below; empty when none.
