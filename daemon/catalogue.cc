@@ -18,6 +18,7 @@
 
 #include "text.h"
 #include "watch_path.h"
+#include "watch_tree.h"
 
 namespace zorvnotifyd {
 
@@ -124,8 +125,8 @@ Catalogue CatalogueLoader::Load() {
   return catalogue;
 }
 
-std::vector<WatchRoot> CatalogueLoader::Honour(Catalogue* catalogue) {
-  std::vector<WatchRoot> roots;
+std::vector<std::string> CatalogueLoader::Honour(Catalogue* catalogue) {
+  std::vector<std::string> roots;
   std::set<std::string> skipped;
   for (CatalogueQueue& entry : *catalogue) {
     std::vector<MonitorQueue::MonitorQueueConfig> honoured;
@@ -140,7 +141,7 @@ std::vector<WatchRoot> CatalogueLoader::Honour(Catalogue* catalogue) {
                                       "IN_ALL_EVENTS bits and IN_ISDIR)";
       }
       if (why.empty()) {
-        roots.push_back({config._path, config._mask});
+        roots.push_back(config._path);
         honoured.push_back(config);
         continue;
       }

@@ -13,7 +13,6 @@
 #include "monitor_queue.h"
 #include "queue_types.h"
 #include "unique_fd.h"
-#include "watch_tree.h"
 
 namespace zorvnotifyd {
 
@@ -43,10 +42,10 @@ class CatalogueLoader {
 
   // Keeps in |catalogue| only the configurations the watcher can honour
   // (an absolute, normalised path and a mask with an event kind it
-  // delivers) and returns their trees.  A configuration taken out gets no
+  // delivers) and returns their paths, the trees to watch.  A configuration taken out gets no
   // event; each is logged once, by queue and file, with the reason, while
   // it stays in the catalogue.
-  std::vector<WatchRoot> Honour(Catalogue* catalogue);
+  std::vector<std::string> Honour(Catalogue* catalogue);
 
  private:
   using FileKey = std::pair<QueueType, std::string>;

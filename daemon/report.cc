@@ -7,6 +7,8 @@
 
 #include <json/json.h>
 
+#include <algorithm>
+
 #include "event_names.h"
 #include "queue_types.h"
 #include "text.h"
@@ -53,20 +55,37 @@ void Reporter::Write(const CatalogueQueue& entry, const std::string& path, uint3
   }
 }
 
+void Reporter::Use(Catalogue catalogue) {
+  std::vector<ZORV::ZORVNOTIFYD::MonitorQueue> queues;
+  queues.reserve(catalogue.size());
+  for (const CatalogueQueue& entry : catalogue) queues.push_back(entry.queue);
+  index_ = ZORV::ZORVNOTIFYD::MonitorQueueIndex(queues);
+  catalogue_ = std::move(catalogue);
+  found_wanted_.assign(catalogue_.size(), 0);
+}
+
 void Reporter::Event(const std::string& path, uint32_t mask) {
-  for (CatalogueQueue& entry : catalogue_) {
-    if (entry.queue.IsMonitoring(path, mask)) Write(entry, path, mask);
-  }
+  index_.Match(path, mask, matches_);
+  for (size_t i : matches_) Write(catalogue_[i], path, mask);
 }
 
 void Reporter::Found(const std::string& path, bool is_dir) {
+  // Each kind on its own: a queue gets the kinds that some configuration
+  // of it wants at |path|.
   const uint32_t found = is_dir ? kFoundDirMask : kFoundFileMask;
-  for (CatalogueQueue& entry : catalogue_) {
-    uint32_t wanted = 0;
-    for (auto& config : entry.queue._configs) {
-      if (config.IsMonitoring(path, found)) wanted |= config._mask;
+  std::vector<size_t> wanting;
+  for (uint32_t bit = 1; bit != 0; bit <<= 1) {
+    if ((found & bit) == 0) continue;
+    index_.Match(path, bit, matches_);
+    for (size_t i : matches_) {
+      if (found_wanted_[i] == 0) wanting.push_back(i);
+      found_wanted_[i] |= bit;
     }
-    if (wanted != 0) Write(entry, path, (found & wanted) | (found & IN_ISDIR));
+  }
+  std::sort(wanting.begin(), wanting.end());
+  for (size_t i : wanting) {
+    Write(catalogue_[i], path, found_wanted_[i] | (found & IN_ISDIR));
+    found_wanted_[i] = 0;
   }
 }
 

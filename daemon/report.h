@@ -4,8 +4,10 @@
 
 #include <cstdint>
 #include <string>
+#include <vector>
 
 #include "catalogue.h"
+#include "monitor_queue_index.h"
 #include "watch_tree.h"
 
 namespace zorvnotifyd {
@@ -16,7 +18,8 @@ constexpr uint32_t kFoundFileMask = IN_CREATE | IN_MODIFY | IN_CLOSE_WRITE | IN_
 constexpr uint32_t kFoundDirMask = IN_CREATE | IN_MOVED_TO | IN_ISDIR;
 
 // Writes the watcher's findings to standard output for the queues of a
-// catalogue, in the order of the catalogue.  Lines are buffered: the caller
+// catalogue, in the order of the catalogue, asking a MonitorQueueIndex
+// which queues want each event.  Lines are buffered: the caller
 // flushes standard output after each round of events.
 //
 // Text lines:  queue NAME [TYPE/FILE]: IN_CREATE|IN_ISDIR PATH
@@ -26,8 +29,14 @@ constexpr uint32_t kFoundDirMask = IN_CREATE | IN_MOVED_TO | IN_ISDIR;
 // lost events, {"file":..,"lost":true,"queue":..,"type":..}.
 class Reporter : public EventSink {
  public:
-  // |catalogue| is read at each call, so it may be replaced in between.
-  Reporter(Catalogue& catalogue, bool json) : catalogue_(catalogue), json_(json) {}
+  explicit Reporter(bool json) : json_(json) {}
+
+  // Reports to the queues of |catalogue| from now on.
+  void Use(Catalogue catalogue);
+  // The index over the queues in use.
+  const ZORV::ZORVNOTIFYD::MonitorQueueIndex& index() const { return index_; }
+  // The number of queues in use.
+  size_t size() const { return catalogue_.size(); }
 
   // One line for each queue that wants the event (IsMonitoring).
   void Event(const std::string& path, uint32_t mask) override;
@@ -42,8 +51,11 @@ class Reporter : public EventSink {
  private:
   void Write(const CatalogueQueue& entry, const std::string& path, uint32_t mask);
 
-  Catalogue& catalogue_;
+  Catalogue catalogue_;
+  ZORV::ZORVNOTIFYD::MonitorQueueIndex index_{{}};
   bool json_;
+  std::vector<size_t> matches_;         // reused by every event
+  std::vector<uint32_t> found_wanted_;  // per queue, for Found
 };
 
 }  // namespace zorvnotifyd

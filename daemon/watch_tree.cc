@@ -57,22 +57,23 @@ WatchTree::WatchTree(UniqueFd inotify, double retry_seconds)
 
 WatchTree::~WatchTree() { Clear(); }
 
-std::vector<WatchRoot> WatchTree::Roots() const {
-  std::vector<WatchRoot> roots;
-  for (const auto& [path, mask] : roots_) roots.push_back({path, mask});
-  return roots;
+void WatchTree::Resync() {
+  const std::vector<std::string> roots(roots_.begin(), roots_.end());
+  const ZORV::ZORVNOTIFYD::MonitorQueueIndex index = index_;
+  Sync(roots, index);
 }
 
-void WatchTree::Sync(const std::vector<WatchRoot>& roots) {
-  roots_.clear();
-  for (const WatchRoot& root : roots) roots_[root.path] |= root.mask & IN_ALL_EVENTS;
+void WatchTree::Sync(const std::vector<std::string>& roots,
+                     const ZORV::ZORVNOTIFYD::MonitorQueueIndex& index) {
+  roots_ = std::set<std::string, std::less<>>(roots.begin(), roots.end());
+  index_ = index;
   std::set<int> synced;
   std::set<std::string> visited;
   std::map<std::string, std::string> was_missing = std::move(missing_);
   std::map<std::string, size_t> was_limited = std::move(limited_);
   missing_.clear();
   limited_.clear();
-  for (const auto& [root, mask] : roots_) {
+  for (const std::string& root : roots_) {
     // A root that was missing stays so until Tick finds it and reports
     // what it holds; one inside a tree walked already is watched.
     if (const auto known = was_missing.find(root); known != was_missing.end()) {
@@ -113,7 +114,7 @@ void WatchTree::Sync(const std::vector<WatchRoot>& roots) {
 }
 
 void WatchTree::Tick(EventSink& sink) {
-  for (const auto& [root, mask] : roots_) {
+  for (const std::string& root : roots_) {
     struct stat st;
     const bool exists = stat(root.c_str(), &st) == 0 && S_ISDIR(st.st_mode);
     const auto known = by_path_.find(root);
@@ -133,7 +134,7 @@ void WatchTree::Tick(EventSink& sink) {
     if (!WatchRootTree(root, context, &why)) continue;
     if (context.unwatched != 0) limited_[root] += context.unwatched;
   }
-  if (!limited_.empty()) Sync(Roots());
+  if (!limited_.empty()) Resync();
 }
 
 bool WatchTree::Fill(bool* failed) {
@@ -174,9 +175,8 @@ bool WatchTree::ReadEvents(EventSink& sink) {
       sink.Lost();
       // Deletions and moves may be among the lost events, so no watch is
       // trusted: all are dropped and the trees watched afresh.
-      const std::vector<WatchRoot> roots = Roots();
       Clear();
-      Sync(roots);
+      Resync();
     }
   }
   return !failed;
@@ -272,14 +272,8 @@ bool WatchTree::ToldByParent(const std::string& path, const RawEvent& event) con
   return parent != by_path_.end() && (watches_.at(parent->second).mask & kinds) == kinds;
 }
 
-uint32_t WatchTree::MaskFor(std::string_view dir) const {
-  uint32_t mask = 0;
-  for (size_t i = 1; i <= dir.size(); ++i) {
-    if (i < dir.size() && dir[i] != '/') continue;
-    const auto root = roots_.find(dir.substr(0, i));
-    if (root != roots_.end()) mask |= root->second;
-  }
-  return mask;
+uint32_t WatchTree::MaskFor(const std::string& dir) const {
+  return index_.GetWatchMask(dir) & IN_ALL_EVENTS;
 }
 
 std::string WatchTree::RootOf(const std::string& dir) const {

@@ -18,6 +18,7 @@
 #include <unordered_map>
 #include <vector>
 
+#include "monitor_queue_index.h"
 #include "unique_fd.h"
 
 namespace zorvnotifyd {
@@ -26,14 +27,6 @@ namespace zorvnotifyd {
 // logs why (naming the kernel limit when it is the instance limit) and
 // returns an empty descriptor.
 UniqueFd OpenInotify();
-
-// One configured tree: its top directory, an absolute normalised path (see
-// common/watch_path.h), and the event kinds (inotify IN_* bits) wanted at
-// and below it.
-struct WatchRoot {
-  std::string path;
-  uint32_t mask;
-};
 
 // Where the watcher's findings go.
 class EventSink {
@@ -70,14 +63,16 @@ class WatchTree {
   // The number of directories (inodes) watched.
   size_t size() const { return watches_.size(); }
 
-  // Makes the watches match |roots|: every directory at or below a root is
-  // watched with the union of the masks of the roots it lies in (masks
-  // limited to inotify's event kinds); other watches are removed.  A
+  // Makes the watches match |roots|, the configured trees (absolute,
+  // normalised paths; see common/watch_path.h): every directory at or below
+  // a root is watched with index.GetWatchMask(directory), limited to
+  // inotify's event kinds; other watches are removed.  A
   // watch whose mask does not change keeps its events.  Roots that do not
   // exist or are not directories are logged once and looked for by Tick.
   // Over the kernel's watch limit it watches what it can, logs per tree
   // how many directories it could not watch, and Tick tries again.
-  void Sync(const std::vector<WatchRoot>& roots);
+  void Sync(const std::vector<std::string>& roots,
+            const ZORV::ZORVNOTIFYD::MonitorQueueIndex& index);
 
   // The periodic check: watches again every root that is missing or whose
   // directory was replaced (deleted and made again, moved back, a file
@@ -134,8 +129,8 @@ class WatchTree {
   // True when |event|, on the watched directory |path| itself, reaches the
   // watch of its parent too, which reports it.
   bool ToldByParent(const std::string& path, const RawEvent& event) const;
-  // The union of the masks of the roots that |dir| is or lies below.
-  uint32_t MaskFor(std::string_view dir) const;
+  // The event kinds a watch on |dir| must carry for the queues.
+  uint32_t MaskFor(const std::string& dir) const;
   // The innermost root that |dir| is or lies below; empty when none.
   std::string RootOf(const std::string& dir) const;
   // Watches the open directory |dir| as |path| and walks below it,
@@ -164,17 +159,18 @@ class WatchTree {
   void Unmap(const std::string& path, bool release, const char* why);
   // Logs, once while it lasts, that root |path| is not watched and why.
   void NoteRootMissing(const std::string& path, const std::string& why);
-  // The roots as Sync takes them.
-  std::vector<WatchRoot> Roots() const;
+  // Sync again with the same roots and index.
+  void Resync();
 
   UniqueFd inotify_;
-  std::map<std::string, uint32_t, std::less<>> roots_;  // merged masks by root path
-  std::unordered_map<int, Watch> watches_;              // by watch descriptor
-  std::map<std::string, int> by_path_;                  // watch descriptor by path
-  std::map<std::pair<dev_t, ino_t>, int> by_inode_;     // watch descriptor by directory
-  std::map<std::string, std::string> missing_;          // unwatched roots and why
-  std::map<std::string, size_t> limited_;  // roots the watch limit kept partly unwatched
-  std::deque<RawEvent> pending_;           // events read but not yet handled
+  std::set<std::string, std::less<>> roots_;  // the configured trees
+  ZORV::ZORVNOTIFYD::MonitorQueueIndex index_{{}};
+  std::unordered_map<int, Watch> watches_;           // by watch descriptor
+  std::map<std::string, int> by_path_;               // watch descriptor by path
+  std::map<std::pair<dev_t, ino_t>, int> by_inode_;  // watch descriptor by directory
+  std::map<std::string, std::string> missing_;       // unwatched roots and why
+  std::map<std::string, size_t> limited_;            // roots the watch limit kept partly unwatched
+  std::deque<RawEvent> pending_;                     // events read but not yet handled
   std::set<uint32_t> moves_;  // cookies of directory moves within the trees, already done
   double retry_seconds_;
 };

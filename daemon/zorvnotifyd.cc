@@ -77,11 +77,17 @@ int Serve(bool json, double retry_seconds) {
   UniqueFd inotify = OpenInotify();
   if (signals.get() < 0 || inotify.get() < 0 || !catalogue_watch.Open()) return 1;
   CatalogueLoader loader;
-  Catalogue catalogue = loader.Load();
-  Reporter reporter(catalogue, json);
+  Reporter reporter(json);
   WatchTree tree(std::move(inotify), retry_seconds);
-  tree.Sync(loader.Honour(&catalogue));
-  syslog(LOG_INFO, "ready: watching %zu directories for %zu queues", tree.size(), catalogue.size());
+  // Reads the catalogue, and makes the report and the watches follow it.
+  auto load = [&] {
+    Catalogue catalogue = loader.Load();
+    const std::vector<std::string> roots = loader.Honour(&catalogue);
+    reporter.Use(std::move(catalogue));
+    tree.Sync(roots, reporter.index());
+  };
+  load();
+  syslog(LOG_INFO, "ready: watching %zu directories for %zu queues", tree.size(), reporter.size());
   const int64_t retry_ms = std::max<int64_t>(1, int64_t(retry_seconds * 1000));
   int64_t next_tick = NowMs() + retry_ms;
   struct pollfd fds[] = {
@@ -104,10 +110,9 @@ int Serve(bool json, double retry_seconds) {
     }
     if (ready > 0 && (fds[1].revents & POLLIN) && !tree.ReadEvents(reporter)) return 1;
     if (ready > 0 && (fds[2].revents & POLLIN) && catalogue_watch.ReadChanges()) {
-      catalogue = loader.Load();
-      tree.Sync(loader.Honour(&catalogue));
+      load();
       syslog(LOG_INFO, "catalogue reloaded: watching %zu directories for %zu queues", tree.size(),
-             catalogue.size());
+             reporter.size());
     }
     if (NowMs() >= next_tick) {
       tree.Tick(reporter);

@@ -15,6 +15,7 @@
 #include "json_output.h"
 #include "masks.h"
 #include "monitor_queue.h"
+#include "monitor_queue_index.h"
 #include "queue_file_name.h"
 #include "queue_object.h"
 #include "table.h"
@@ -23,6 +24,7 @@ namespace zorvnotifyctl {
 namespace {
 
 using ZORV::ZORVNOTIFYD::MonitorQueue;
+using ZORV::ZORVNOTIFYD::MonitorQueueIndex;
 
 // |text| in double quotes, control bytes escaped, for messages.
 std::string Quoted(const std::string& text) {
@@ -128,6 +130,14 @@ bool ReadSource(const std::string& source, std::string* text, std::string* error
   }
   *text = content.str();
   return true;
+}
+
+// The index over the queues of |queues|, in the same order.
+MonitorQueueIndex CatalogueIndex(const std::vector<TypedQueue>& queues) {
+  std::vector<MonitorQueue> plain;
+  plain.reserve(queues.size());
+  for (const TypedQueue& entry : queues) plain.push_back(entry.queue);
+  return MonitorQueueIndex(plain);
 }
 
 // Loads the catalogue with types, or reports the failure (exit status 1).
@@ -271,8 +281,10 @@ int RunMatch(const Invocation& invocation) {
   if (!LoadCatalogueOrFail(&queues, &status)) return status;
   Json::Value matches(Json::arrayValue);
   Table table({"TYPE", "QUEUE"});
-  for (TypedQueue& entry : queues) {
-    if (!entry.queue.IsMonitoring(path, mask)) continue;
+  std::vector<size_t> wanting;
+  CatalogueIndex(queues).Match(path, mask, wanting);
+  for (size_t i : wanting) {
+    const TypedQueue& entry = queues[i];
     Json::Value match(Json::objectValue);
     match["type"] = QueueTypeName(entry.type);
     match["queue"] = entry.queue._name;
@@ -296,13 +308,15 @@ int RunDirs(const Invocation& invocation) {
   std::vector<TypedQueue> queues;
   int status = kExitOk;
   if (!LoadCatalogueOrFail(&queues, &status)) return status;
-  unsigned int all = 0;
+  // The union over the catalogue is the index's; the rows name each queue.
+  const MonitorQueueIndex index = CatalogueIndex(queues);
+  const unsigned int all = index.GetUnionMask(dir);
   Json::Value watchers(Json::arrayValue);
   Table table({"TYPE", "QUEUE", "MASK"});
-  for (const TypedQueue& entry : queues) {
+  for (const TypedQueue& entry :
+       (index.IsDirMonitoring(dir) ? queues : std::vector<TypedQueue>())) {
     if (!entry.queue.IsDirMonitoring(dir)) continue;
     const unsigned int mask = entry.queue.GetUnionMask(dir);
-    all |= mask;
     Json::Value watcher(Json::objectValue);
     watcher["type"] = QueueTypeName(entry.type);
     watcher["queue"] = entry.queue._name;
