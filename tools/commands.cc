@@ -309,12 +309,10 @@ int RunDirs(const Invocation& invocation) {
   int status = kExitOk;
   if (!LoadCatalogueOrFail(&queues, &status)) return status;
   // The union over the catalogue is the index's; the rows name each queue.
-  const MonitorQueueIndex index = CatalogueIndex(queues);
-  const unsigned int all = index.GetUnionMask(dir);
+  const unsigned int all = CatalogueIndex(queues).GetUnionMask(dir);
   Json::Value watchers(Json::arrayValue);
   Table table({"TYPE", "QUEUE", "MASK"});
-  for (const TypedQueue& entry :
-       (index.IsDirMonitoring(dir) ? queues : std::vector<TypedQueue>())) {
+  for (const TypedQueue& entry : queues) {
     if (!entry.queue.IsDirMonitoring(dir)) continue;
     const unsigned int mask = entry.queue.GetUnionMask(dir);
     Json::Value watcher(Json::objectValue);
