@@ -1,15 +1,14 @@
-// The daemon's output: one line per queue and event.
+// Handing findings to the queues that want them.
 
 #include "report.h"
 
 #include <stdio.h>
 #include <sys/inotify.h>
 
-#include <json/json.h>
-
 #include <algorithm>
 
 #include "event_names.h"
+#include "json_writer.h"
 #include "queue_types.h"
 #include "text.h"
 
@@ -19,54 +18,62 @@ namespace {
 using zorvcommon::Printable;
 using zorvcommon::QueueTypeName;
 
-// |value| as one compact JSON line, bytes of paths written unchanged.
-void PrintJson(const Json::Value& value) {
-  Json::StreamWriterBuilder builder;
-  builder["indentation"] = "";
-  builder["emitUTF8"] = true;
-  const std::string line = Json::writeString(builder, value);
-  printf("%s\n", line.c_str());
-}
-
-Json::Value JsonHead(const CatalogueQueue& entry) {
-  Json::Value line(Json::objectValue);
-  line["queue"] = entry.queue._name;
-  line["type"] = QueueTypeName(entry.type);
-  line["file"] = entry.file;
-  return line;
-}
-
-std::string TextHead(const CatalogueQueue& entry) {
-  return "queue " + Printable(entry.queue._name) + " [" + QueueTypeName(entry.type) + "/" +
-         Printable(entry.file) + "]: ";
+// The start of a standard-output line about queue |entry|.
+void Head(const CatalogueQueue& entry, bool json, std::string* line) {
+  line->clear();
+  if (!json) {
+    *line += "queue " + Printable(entry.queue._name) + " [" + QueueTypeName(entry.type) + "/" +
+             Printable(entry.file) + "]: ";
+    return;
+  }
+  *line += '{';
+  AppendJsonField(line, "queue", entry.queue._name);
+  *line += ',';
+  AppendJsonField(line, "type", QueueTypeName(entry.type));
+  *line += ',';
+  AppendJsonField(line, "file", entry.file);
+  *line += ',';
 }
 
 }  // namespace
 
-void Reporter::Write(const CatalogueQueue& entry, const std::string& path, uint32_t mask) {
-  if (json_) {
-    Json::Value line = JsonHead(entry);
-    line["path"] = path;
-    line["mask"] = Json::UInt(mask);
-    PrintJson(line);
-  } else {
-    printf("%s%s %s\n", TextHead(entry).c_str(), zorvcommon::MaskNames(mask).c_str(),
-           Printable(path).c_str());
-  }
-}
-
-void Reporter::Use(Catalogue catalogue) {
+void Reporter::Use(Catalogue catalogue, std::vector<QueueLog*>* created) {
   std::vector<ZORV::ZORVNOTIFYD::MonitorQueue> queues;
   queues.reserve(catalogue.size());
   for (const CatalogueQueue& entry : catalogue) queues.push_back(entry.queue);
   index_ = ZORV::ZORVNOTIFYD::MonitorQueueIndex(queues);
+  logs_.Follow(catalogue, &logs_by_position_, created);
   catalogue_ = std::move(catalogue);
   found_wanted_.assign(catalogue_.size(), 0);
 }
 
+void Reporter::Record(size_t i, const std::string& path, uint32_t mask, uint64_t order) {
+  // Two queues of one name in one file share a log: one record each event.
+  QueueLog* log = logs_by_position_[i];
+  if (log->last_order != order) {
+    log->last_order = order;
+    log->AddEvent(path, mask, order);
+    if (recorded_) recorded_(log);
+  }
+  if (stdout_ == Stdout::kNone) return;
+  Head(catalogue_[i], stdout_ == Stdout::kJson, &line_);
+  if (stdout_ == Stdout::kJson) {
+    AppendJsonField(&line_, "path", path);
+    line_ += ',';
+    AppendJsonNumber(&line_, "mask", mask);
+    line_ += "}\n";
+  } else {
+    line_ += zorvcommon::MaskNames(mask) + " " + Printable(path) + "\n";
+  }
+  fwrite(line_.data(), 1, line_.size(), stdout);
+}
+
 void Reporter::Event(const std::string& path, uint32_t mask) {
+  ++events_;
   index_.Match(path, mask, matches_);
-  for (size_t i : matches_) Write(catalogue_[i], path, mask);
+  if (matches_.empty()) return;
+  const uint64_t order = logs_.NextOrder();
+  for (size_t i : matches_) Record(i, path, mask, order);
 }
 
 void Reporter::Found(const std::string& path, bool is_dir) {
@@ -82,23 +89,31 @@ void Reporter::Found(const std::string& path, bool is_dir) {
       found_wanted_[i] |= bit;
     }
   }
+  if (wanting.empty()) return;
+  ++events_;
   std::sort(wanting.begin(), wanting.end());
+  const uint64_t order = logs_.NextOrder();
   for (size_t i : wanting) {
-    Write(catalogue_[i], path, found_wanted_[i] | (found & IN_ISDIR));
+    Record(i, path, found_wanted_[i] | (found & IN_ISDIR), order);
     found_wanted_[i] = 0;
   }
 }
 
 void Reporter::Lost() {
-  for (const CatalogueQueue& entry : catalogue_) {
-    if (json_) {
-      Json::Value line = JsonHead(entry);
-      line["lost"] = true;
-      PrintJson(line);
-    } else {
-      printf("%sLOST events may have been lost (inotify queue overflow)\n",
-             TextHead(entry).c_str());
+  ++overflows_;
+  const uint64_t order = logs_.NextOrder();
+  for (size_t i = 0; i < catalogue_.size(); ++i) {
+    QueueLog* log = logs_by_position_[i];
+    if (log->last_order != order) {
+      log->last_order = order;
+      log->AddNotice("lost", order);
+      if (recorded_) recorded_(log);
     }
+    if (stdout_ == Stdout::kNone) continue;
+    Head(catalogue_[i], stdout_ == Stdout::kJson, &line_);
+    line_ += stdout_ == Stdout::kJson ? "\"lost\":true}\n"
+                                      : "LOST events may have been lost (inotify queue overflow)\n";
+    fwrite(line_.data(), 1, line_.size(), stdout);
   }
 }
 

@@ -1,13 +1,17 @@
-// The daemon's output: one line per queue and event, on standard output.
+// Where the watcher's findings go: each queue that wants an event gets a
+// record in its log (which the daemon's clients read), and, for debugging,
+// a line on standard output.
 #ifndef ZORVNOTIFYD_DAEMON_REPORT_H_
 #define ZORVNOTIFYD_DAEMON_REPORT_H_
 
 #include <cstdint>
+#include <functional>
 #include <string>
 #include <vector>
 
 #include "catalogue.h"
 #include "monitor_queue_index.h"
+#include "queue_log.h"
 #include "watch_tree.h"
 
 namespace zorvnotifyd {
@@ -17,45 +21,59 @@ namespace zorvnotifyd {
 constexpr uint32_t kFoundFileMask = IN_CREATE | IN_MODIFY | IN_CLOSE_WRITE | IN_MOVED_TO;
 constexpr uint32_t kFoundDirMask = IN_CREATE | IN_MOVED_TO | IN_ISDIR;
 
-// Writes the watcher's findings to standard output for the queues of a
-// catalogue, in the order of the catalogue, asking a MonitorQueueIndex
-// which queues want each event.  Lines are buffered: the caller
-// flushes standard output after each round of events.
-//
-// Text lines:  queue NAME [TYPE/FILE]: IN_CREATE|IN_ISDIR PATH
-//              queue NAME [TYPE/FILE]: LOST events may have been lost ...
-// with control bytes in NAME, FILE and PATH written as \xNN.  JSON lines
-// (|json|): {"file":..,"mask":..,"path":..,"queue":..,"type":..} and, for
-// lost events, {"file":..,"lost":true,"queue":..,"type":..}.
+// How the daemon writes on standard output.
+enum class Stdout { kNone, kText, kJson };
+
+// Hands each finding to the queues that want it, in catalogue order,
+// asking a MonitorQueueIndex which they are.  With standard output on,
+// also writes one line per queue (buffered: the caller flushes):
+//   text:  queue NAME [TYPE/FILE]: IN_CREATE|IN_ISDIR PATH
+//          queue NAME [TYPE/FILE]: LOST events may have been lost ...
+//   JSON:  {"queue":..,"type":..,"file":..,"path":..,"mask":..}
+//          {"queue":..,"type":..,"file":..,"lost":true}
+// with control bytes escaped (\xNN in text; as JSON does).
 class Reporter : public EventSink {
  public:
-  explicit Reporter(bool json) : json_(json) {}
+  Reporter(QueueLogs& logs, Stdout out) : logs_(logs), stdout_(out) {}
 
-  // Reports to the queues of |catalogue| from now on.
-  void Use(Catalogue catalogue);
+  // Reports to the queues of |catalogue| from now on; |created| gets the
+  // logs of queues new to the daemon.
+  void Use(Catalogue catalogue, std::vector<QueueLog*>* created);
   // The index over the queues in use.
   const ZORV::ZORVNOTIFYD::MonitorQueueIndex& index() const { return index_; }
+  // Calls |recorded| after each record added to a log.
+  void OnRecord(std::function<void(QueueLog*)> recorded) { recorded_ = std::move(recorded); }
   // The number of queues in use.
   size_t size() const { return catalogue_.size(); }
+  // Events handed on so far, and queue overflows.
+  uint64_t events() const { return events_; }
+  uint64_t overflows() const { return overflows_; }
 
-  // One line for each queue that wants the event (IsMonitoring).
+  // A record for each queue that wants the event (IsMonitoring).
   void Event(const std::string& path, uint32_t mask) override;
-  // One line for each queue that wants an event of kFoundFileMask (or
+  // A record for each queue that wants an event of kFoundFileMask (or
   // kFoundDirMask for a directory) on |path|; its mask holds the bits of
   // that mask that the queue's matching configurations ask for (and
   // IN_ISDIR for a directory).
   void Found(const std::string& path, bool is_dir) override;
-  // One "lost" line for every queue of the catalogue.
+  // A "lost" record for every queue of the catalogue.
   void Lost() override;
 
  private:
-  void Write(const CatalogueQueue& entry, const std::string& path, uint32_t mask);
+  // Records the event for queue |i| (once per log and event).
+  void Record(size_t i, const std::string& path, uint32_t mask, uint64_t order);
 
+  QueueLogs& logs_;
+  Stdout stdout_;
+  std::function<void(QueueLog*)> recorded_;
   Catalogue catalogue_;
+  std::vector<QueueLog*> logs_by_position_;
   ZORV::ZORVNOTIFYD::MonitorQueueIndex index_{{}};
-  bool json_;
   std::vector<size_t> matches_;         // reused by every event
   std::vector<uint32_t> found_wanted_;  // per queue, for Found
+  std::string line_;                    // reused for standard output
+  uint64_t events_ = 0;
+  uint64_t overflows_ = 0;
 };
 
 }  // namespace zorvnotifyd

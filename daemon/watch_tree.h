@@ -62,6 +62,14 @@ class WatchTree {
   int fd() const { return inotify_.get(); }
   // The number of directories (inodes) watched.
   size_t size() const { return watches_.size(); }
+  // The configured trees not watched now (missing, gone, not directories).
+  size_t missing() const { return missing_.size(); }
+  // The directories the watch limit left unwatched.
+  size_t over_limit() const {
+    size_t count = 0;
+    for (const auto& [root, unwatched] : limited_) count += unwatched;
+    return count;
+  }
 
   // Makes the watches match |roots|, the configured trees (absolute,
   // normalised paths; see common/watch_path.h): every directory at or below

@@ -1,15 +1,19 @@
-// zorvnotifyd: reports file changes to the monitor queues of the catalogue
-// that want them.  Runs in the foreground until SIGTERM or SIGINT.
+// zorvnotifyd: delivers file changes to the programs that subscribed to
+// the monitor queues that want them.  Runs in the foreground until SIGTERM
+// or SIGINT.
 //
 // Exit status: 0 stopped by a signal, 1 could not start or could not go on,
 // 2 bad command line.
 
 #include <errno.h>
+#include <grp.h>
 #include <poll.h>
 #include <signal.h>
 #include <string.h>
+#include <sys/random.h>
 #include <sys/signalfd.h>
 #include <syslog.h>
+#include <systemd/sd-daemon.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -20,7 +24,11 @@
 #include <string>
 
 #include "catalogue.h"
+#include "json_writer.h"
+#include "queue_log.h"
 #include "report.h"
+#include "server.h"
+#include "text.h"
 #include "unique_fd.h"
 #include "watch_tree.h"
 
@@ -28,22 +36,27 @@ namespace zorvnotifyd {
 namespace {
 
 const char kUsage[] =
-    "Usage: zorvnotifyd [--json] [--retry SECONDS] [--version] [--help]\n"
+    "Usage: zorvnotifyd [OPTION]...\n"
     "\n"
     "Watches, with inotify, every directory tree that a monitor queue of the catalogue\n"
-    "names and writes one line on standard output for every queue that wants an event.\n"
-    "With --json the line is a JSON object with the keys \"queue\", \"type\" (share, etc or\n"
-    "local-etc), \"file\", \"path\" and \"mask\" (the inotify IN_* bits of the event).\n"
+    "names, and delivers each queue's events to the programs that subscribe to it on\n"
+    "the daemon's Unix socket, as JSON lines (see zorvnotifyd(8) for the protocol).\n"
     "\n"
-    "  --json           JSON lines instead of readable ones\n"
-    "  --retry SECONDS  how often trees that are missing, replaced or over the watch\n"
-    "                   limit are looked at again (default 5; fractions allowed)\n"
-    "  --version        print the version and exit\n"
+    "  --socket PATH         the socket (default /run/zorvnotifyd/zorvnotifyd.sock)\n"
+    "  --group GROUP         members of GROUP may connect too (default: root only)\n"
+    "  --keep N              events kept per queue for clients that reconnect\n"
+    "                        (default 100)\n"
+    "  --client-buffer BYTES output a client may have waiting (default 262144)\n"
+    "  --stdout              also write one line per queue and event on standard output\n"
+    "  --json                ... as JSON objects (implies --stdout)\n"
+    "  --retry SECONDS       how often trees that are missing, replaced or over the\n"
+    "                        watch limit are looked at again (default 5; fractions allowed)\n"
+    "  --version             print the version and exit\n"
     "\n"
     "The daemon runs in the foreground and never forks: start it from a service\n"
-    "manager (zorvnotifyd.service for systemd).  It needs root.  It reloads the\n"
-    "catalogue when a queue file changes and stops on SIGTERM or SIGINT (status 0).\n"
-    "Log lines go to syslog and to standard error.  See zorvnotifyd(8).\n";
+    "manager (zorvnotifyd.service for systemd, which it tells when it is ready).  It\n"
+    "needs root.  It reloads the catalogue when a queue file changes and stops on\n"
+    "SIGTERM or SIGINT (status 0).  Log lines go to syslog and to standard error.\n";
 
 constexpr double kDefaultRetrySeconds = 5;
 
@@ -70,32 +83,81 @@ UniqueFd OpenSignals() {
   return fd;
 }
 
+// A random id of this run of the daemon, 32 hexadecimal digits: clients
+// tell by it that sequence numbers from an earlier run no longer apply.
+std::string RunId() {
+  unsigned char bytes[16] = {};
+  if (getrandom(bytes, sizeof(bytes), 0) != ssize_t(sizeof(bytes))) {
+    const uint64_t seed = uint64_t(NowMs()) ^ (uint64_t(getpid()) << 32);
+    memcpy(bytes, &seed, sizeof(seed));
+  }
+  std::string id;
+  char digits[3];
+  for (unsigned char byte : bytes) {
+    snprintf(digits, sizeof(digits), "%02x", byte);
+    id += digits;
+  }
+  return id;
+}
+
+struct Options {
+  ServerOptions server;
+  Stdout out = Stdout::kNone;
+  double retry_seconds = kDefaultRetrySeconds;
+  size_t keep = 100;
+};
+
 // Serves events until a stop signal (returns 0) or a fatal error (1).
-int Serve(bool json, double retry_seconds) {
+int Serve(const Options& options) {
   UniqueFd signals = OpenSignals();
   CatalogueWatch catalogue_watch;
   UniqueFd inotify = OpenInotify();
   if (signals.get() < 0 || inotify.get() < 0 || !catalogue_watch.Open()) return 1;
   CatalogueLoader loader;
-  Reporter reporter(json);
-  WatchTree tree(std::move(inotify), retry_seconds);
-  // Reads the catalogue, and makes the report and the watches follow it.
+  QueueLogs logs(options.keep);
+  Reporter reporter(logs, options.out);
+  WatchTree tree(std::move(inotify), options.retry_seconds);
+  Server server(options.server, logs, RunId(), [&] {
+    std::string status;
+    AppendJsonNumber(&status, "directories", tree.size());
+    status += ',';
+    AppendJsonNumber(&status, "queues", reporter.size());
+    status += ',';
+    AppendJsonNumber(&status, "events", reporter.events());
+    status += ',';
+    AppendJsonNumber(&status, "overflows", reporter.overflows());
+    status += ',';
+    AppendJsonNumber(&status, "trees_missing", tree.missing());
+    status += ',';
+    AppendJsonNumber(&status, "directories_over_watch_limit", tree.over_limit());
+    return status;
+  });
+  if (!server.Listen()) return 1;
+  reporter.OnRecord([&server](QueueLog* log) { server.Recorded(log); });
+  // Reads the catalogue, and makes the records, the watches and the
+  // clients' subscriptions follow it.
   auto load = [&] {
     Catalogue catalogue = loader.Load();
     const std::vector<std::string> roots = loader.Honour(&catalogue);
-    reporter.Use(std::move(catalogue));
+    std::vector<QueueLog*> created;
+    reporter.Use(std::move(catalogue), &created);
     tree.Sync(roots, reporter.index());
+    server.FollowNew(created);
   };
   load();
   syslog(LOG_INFO, "ready: watching %zu directories for %zu queues", tree.size(), reporter.size());
-  const int64_t retry_ms = std::max<int64_t>(1, int64_t(retry_seconds * 1000));
+  sd_notifyf(0, "READY=1\nSTATUS=watching %zu directories for %zu queues", tree.size(),
+             reporter.size());
+  const int64_t retry_ms = std::max<int64_t>(1, int64_t(options.retry_seconds * 1000));
   int64_t next_tick = NowMs() + retry_ms;
-  struct pollfd fds[] = {
-      {signals.get(), POLLIN, 0}, {tree.fd(), POLLIN, 0}, {catalogue_watch.fd(), POLLIN, 0}};
+  std::vector<struct pollfd> fds;
   for (;;) {
+    fds.assign(
+        {{signals.get(), POLLIN, 0}, {tree.fd(), POLLIN, 0}, {catalogue_watch.fd(), POLLIN, 0}});
+    server.AddPollFds(&fds);
     // Trees that went away, were replaced or did not fit under the watch
     // limit are looked at again on a fixed period, whatever the load.
-    const int ready = poll(fds, 3, int(std::max<int64_t>(0, next_tick - NowMs())));
+    const int ready = poll(fds.data(), fds.size(), int(std::max<int64_t>(0, next_tick - NowMs())));
     if (ready < 0 && errno != EINTR) {
       syslog(LOG_ERR, "poll failed: %s", strerror(errno));
       return 1;
@@ -103,6 +165,7 @@ int Serve(bool json, double retry_seconds) {
     struct signalfd_siginfo info;
     if (ready > 0 && (fds[0].revents & POLLIN) &&
         read(signals.get(), &info, sizeof(info)) == sizeof(info)) {
+      sd_notify(0, "STOPPING=1");
       syslog(LOG_INFO, "stopping on %s: releasing %zu watches", strsignal(int(info.ssi_signo)),
              tree.size());
       tree.Clear();
@@ -110,15 +173,20 @@ int Serve(bool json, double retry_seconds) {
     }
     if (ready > 0 && (fds[1].revents & POLLIN) && !tree.ReadEvents(reporter)) return 1;
     if (ready > 0 && (fds[2].revents & POLLIN) && catalogue_watch.ReadChanges()) {
+      sd_notify(0, "RELOADING=1");
       load();
       syslog(LOG_INFO, "catalogue reloaded: watching %zu directories for %zu queues", tree.size(),
              reporter.size());
+      sd_notifyf(0, "READY=1\nSTATUS=watching %zu directories for %zu queues", tree.size(),
+                 reporter.size());
     }
+    if (ready > 0) server.HandlePoll(fds, 3);
     if (NowMs() >= next_tick) {
       tree.Tick(reporter);
       next_tick = NowMs() + retry_ms;
     }
-    if (fflush(stdout) != 0 || ferror(stdout)) {
+    server.Deliver();
+    if (options.out != Stdout::kNone && (fflush(stdout) != 0 || ferror(stdout))) {
       syslog(LOG_ERR, "cannot write the report to standard output: stopping");
       tree.Clear();
       return 1;
@@ -126,45 +194,85 @@ int Serve(bool json, double retry_seconds) {
   }
 }
 
+// Parses |text| as a whole number from |min| to |max| into |value|.
+bool ParseCount(const char* text, unsigned long long min, unsigned long long max,
+                unsigned long long* value) {
+  char* end = nullptr;
+  errno = 0;
+  *value = strtoull(text, &end, 10);
+  return errno == 0 && end != text && *end == '\0' && text[0] != '-' && *value >= min &&
+         *value <= max;
+}
+
+// Parses the command line into |options|; 0 to go on, otherwise the exit
+// status (after --help or --version, or on an error, which it reports).
+int ParseOptions(int argc, char** argv, Options* options) {
+  for (int i = 1; i < argc; ++i) {
+    const std::string arg = argv[i];
+    const char* value = i + 1 < argc ? argv[i + 1] : nullptr;
+    unsigned long long number = 0;
+    if (arg == "--help" || arg == "-h") {
+      fputs(kUsage, stdout);
+      return -1;
+    } else if (arg == "--version") {
+      printf("zorvnotifyd %s\n", ZORVNOTIFYD_VERSION_STRING);
+      return -1;
+    } else if (arg == "--json") {
+      options->out = Stdout::kJson;
+    } else if (arg == "--stdout") {
+      if (options->out == Stdout::kNone) options->out = Stdout::kText;
+    } else if (arg == "--socket" && value != nullptr) {
+      options->server.socket_path = argv[++i];
+    } else if (arg == "--group" && value != nullptr) {
+      ++i;
+      const struct group* group = getgrnam(value);
+      if (group == nullptr && !ParseCount(value, 0, 0xfffffffe, &number)) {
+        fprintf(stderr, "zorvnotifyd: no group \"%s\"\n", zorvcommon::Printable(value).c_str());
+        return 2;
+      }
+      options->server.group_allowed = true;
+      options->server.group = group != nullptr ? group->gr_gid : gid_t(number);
+    } else if (arg == "--keep" && value != nullptr && ParseCount(value, 1, 1000000, &number)) {
+      options->keep = size_t(number);
+      ++i;
+    } else if (arg == "--client-buffer" && value != nullptr &&
+               ParseCount(value, 1024, 1ull << 30, &number)) {
+      options->server.client_buffer = size_t(number);
+      ++i;
+    } else if (arg == "--retry" && value != nullptr) {
+      char* end = nullptr;
+      options->retry_seconds = strtod(argv[++i], &end);
+      if (*end != '\0' || !(options->retry_seconds >= 0.001 && options->retry_seconds <= 86400)) {
+        fprintf(stderr, "zorvnotifyd: --retry takes a number of seconds from 0.001 to 86400\n");
+        return 2;
+      }
+    } else {
+      fprintf(stderr, "zorvnotifyd: bad argument \"%s\" (see --help)\n",
+              zorvcommon::Printable(arg).c_str());
+      return 2;
+    }
+  }
+  return 0;
+}
+
 }  // namespace
 }  // namespace zorvnotifyd
 
 int main(int argc, char** argv) {
-  bool json = false;
-  double retry_seconds = zorvnotifyd::kDefaultRetrySeconds;
-  for (int i = 1; i < argc; ++i) {
-    const std::string arg = argv[i];
-    if (arg == "--help" || arg == "-h") {
-      fputs(zorvnotifyd::kUsage, stdout);
-      return 0;
-    }
-    if (arg == "--version") {
-      printf("zorvnotifyd %s\n", ZORVNOTIFYD_VERSION_STRING);
-      return 0;
-    }
-    if (arg == "--json") {
-      json = true;
-      continue;
-    }
-    if (arg == "--retry" && i + 1 < argc) {
-      char* end = nullptr;
-      retry_seconds = strtod(argv[++i], &end);
-      if (*end == '\0' && retry_seconds >= 0.001 && retry_seconds <= 86400) continue;
-      fprintf(stderr, "zorvnotifyd: --retry takes a number of seconds from 0.001 to 86400\n");
-      return 2;
-    }
-    fprintf(stderr, "zorvnotifyd: unknown argument \"%s\" (see --help)\n", argv[i]);
-    return 2;
+  zorvnotifyd::Options options;
+  if (const int status = zorvnotifyd::ParseOptions(argc, argv, &options); status != 0) {
+    return status < 0 ? 0 : status;
   }
-  // A reader of the report that goes away (zorvnotifyd | head) ends the
-  // daemon through a write error, not by a signal that skips the clean-up.
+  // A reader of the report that goes away (zorvnotifyd --stdout | head)
+  // ends the daemon through a write error, not by a signal that skips the
+  // clean-up; a client that goes away is a write error on its socket.
   signal(SIGPIPE, SIG_IGN);
   openlog("zorvnotifyd", LOG_PID | LOG_PERROR, LOG_DAEMON);
   if (geteuid() != 0) {
     syslog(LOG_ERR, "must run as root: the catalogue and the watched trees are root's");
     return 1;
   }
-  const int status = zorvnotifyd::Serve(json, retry_seconds);
+  const int status = zorvnotifyd::Serve(options);
   closelog();
   return status;
 }

@@ -9,11 +9,14 @@
 #include <signal.h>
 #include <sys/inotify.h>
 #include <sys/mount.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <cstdlib>
+#include <cstring>
 #include <fstream>
 #include <functional>
 #include <map>
@@ -26,6 +29,7 @@
 #include <json/json.h>
 
 #include "monitor_queue.h"
+#include "support/run_as.h"
 #include "support/sandbox.h"
 
 namespace {
@@ -40,7 +44,9 @@ bool Put(const std::string& path, const std::string& text) {
   return static_cast<bool>(out.flush());
 }
 
-// The daemon as a child process.  |in_child| runs in the child before the
+constexpr const char* kSocket = "/tmp/zorvnotifyd.sock";
+
+// The daemon as a child process, listening on kSocket.  |in_child| runs in the child before the
 // daemon is executed; it exits with 126 when it fails.
 class Daemon {
  public:
@@ -49,7 +55,7 @@ class Daemon {
     if ((pid_ = fork()) == 0) {
       if (dup2(out_[1], 1) < 0 || dup2(err_[1], 2) < 0) _exit(125);
       if (in_child && !in_child()) _exit(126);
-      args.insert(args.begin(), ZORVNOTIFYD_PATH);
+      args.insert(args.begin(), {ZORVNOTIFYD_PATH, "--socket", kSocket});
       std::vector<char*> argv;
       for (std::string& arg : args) argv.push_back(&arg[0]);
       argv.push_back(nullptr);
@@ -250,7 +256,7 @@ TEST(DaemonTest, ServesEveryPathOfADirectoryAndNothingItCannotHonour) {
   Register("root", "f", MONITOR_QUEUE_TYPE_ETC_DIR, "/", mask);
   Register("empty", "f", MONITOR_QUEUE_TYPE_ETC_DIR, "", mask);
   Register("unmount", "f", MONITOR_QUEUE_TYPE_ETC_DIR, "/tmp/w", IN_UNMOUNT);
-  Daemon daemon(Lines{});
+  Daemon daemon({"--stdout"});
   for (const char* line :
        {"skipping configuration \"/tmp/w/\" of queue \"slash\" (etc/f): it ends in \"/\", which no "
         "reported path can match; write it as \"/tmp/w\"",
@@ -457,6 +463,146 @@ TEST(DaemonTest, ServesWhatFitsUnderTheWatchLimitAndSaysWhenEventsWereLost) {
   EXPECT_TRUE(daemon.Logged("inotify event queue overflowed, events were lost"));
   ASSERT_TRUE(Put("/tmp/big/10/after", "x"));
   EXPECT_EQ(daemon.ReadUntil("big /tmp/big/10/after 256").back(), "big /tmp/big/10/after 256");
+  EXPECT_EQ(daemon.Stop(), 0);
+}
+
+// A client of the daemon's socket.
+class Client {
+ public:
+  Client() {
+    fd_ = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    struct sockaddr_un address = {};
+    address.sun_family = AF_UNIX;
+    strcpy(address.sun_path, kSocket);
+    connected_ = connect(fd_, reinterpret_cast<struct sockaddr*>(&address), sizeof(address)) == 0;
+  }
+  ~Client() { close(fd_); }
+  bool connected() const { return connected_; }
+  bool Send(const std::string& line) {
+    const std::string text = line + "\n";
+    return write(fd_, text.data(), text.size()) == ssize_t(text.size());
+  }
+  // The next line as JSON (null after 10 s or at the end).
+  Json::Value Next() {
+    while (buffer_.find('\n') == std::string::npos) {
+      struct pollfd p = {fd_, POLLIN, 0};
+      char chunk[65536];
+      ssize_t n = 0;
+      if (poll(&p, 1, 10000) <= 0 || (n = read(fd_, chunk, sizeof(chunk))) <= 0) return {};
+      buffer_.append(chunk, size_t(n));
+    }
+    const size_t end = buffer_.find('\n');
+    std::istringstream in(buffer_.substr(0, end));
+    buffer_.erase(0, end + 1);
+    Json::Value v;
+    EXPECT_TRUE(Json::parseFromStream(Json::CharReaderBuilder(), in, &v, nullptr));
+    return v;
+  }
+  // The next line as "queue seq path" ("queue seq KEY" for a notice,
+  // "queue missed N"), "" when none came.
+  std::string Line() {
+    const Json::Value v = Next();
+    if (!v.isObject()) return "";
+    std::string line = v["queue"].asString();
+    if (v.isMember("missed")) return line + " missed " + std::to_string(v["missed"].asUInt64());
+    line += " " + std::to_string(v["seq"].asUInt64());
+    for (const char* notice : {"lost", "removed", "registered"}) {
+      if (v.isMember(notice)) return line + " " + notice;
+    }
+    return line + " " + v["path"].asString();
+  }
+
+ private:
+  int fd_;
+  bool connected_;
+  std::string buffer_;
+};
+
+// Subscribes |client| to |queue| (with "since" when |since| >= 0) and
+// returns the reply.
+Json::Value Subscribe(Client& client, const std::string& queue, long since = -1) {
+  std::string request = "{\"request\":\"subscribe\",\"queue\":\"" + queue + "\"";
+  if (since >= 0) request += ",\"since\":" + std::to_string(since);
+  EXPECT_TRUE(client.Send(request + "}"));
+  return client.Next();
+}
+
+// Clients on two queues, one that never reads, one that comes back, one
+// that may not connect, and a queue that goes and comes back.
+TEST(DaemonTest, DeliversEachQueueItsEventsToItsSubscribers) {
+  ZORV_REQUIRE_SANDBOX();
+  zorv_test::ResetStore();
+  ASSERT_EQ(std::system("rm -rf /tmp/s && mkdir -p /tmp/s/a /tmp/s/b"), 0);
+  Register("a", "f", MONITOR_QUEUE_TYPE_ETC_DIR, "/tmp/s/a", kCreate);
+  Register("b", "f", MONITOR_QUEUE_TYPE_ETC_DIR, "/tmp/s/b", kCreate);
+  Daemon daemon({"--keep", "5", "--client-buffer", "1024"});
+  ASSERT_TRUE(daemon.Logged("ready: watching 2 directories for 2 queues"));
+  Client b, sleeper;
+  Client* a = new Client;
+  ASSERT_TRUE(a->connected() && b.connected() && sleeper.connected());
+  const Json::Value reply = Subscribe(*a, "a");
+  EXPECT_EQ(reply["reply"], "subscribe");
+  EXPECT_EQ(reply["run"].asString().size(), 32u);
+  EXPECT_EQ(reply["queues"].size(), 1u);
+  EXPECT_EQ(Subscribe(b, "b")["run"], reply["run"]);
+  Subscribe(sleeper, "a");
+
+  // Each client exactly its queue's events, in order.
+  for (int i = 1; i <= 20; ++i) ASSERT_TRUE(Put("/tmp/s/a/" + std::to_string(i), "x"));
+  for (int i = 1; i <= 20; ++i)
+    EXPECT_EQ(a->Line(), "a " + std::to_string(i) + " /tmp/s/a/" + std::to_string(i));
+  delete a;
+
+  // A client that never reads delays nobody: more than its socket and
+  // buffer hold, then the other queue's event reaches its client.
+  constexpr int kFiles = 3000;
+  const std::string name = "/tmp/s/a/" + std::string(200, 'n');
+  for (int i = 21; i <= kFiles; ++i) ASSERT_TRUE(Put(name + std::to_string(i), "x"));
+  ASSERT_TRUE(Put("/tmp/s/b/x", "x"));
+  EXPECT_EQ(b.Line(), "b 1 /tmp/s/b/x");
+  // What the sleeper's buffer could not hold is counted.
+  std::string line = sleeper.Line();
+  for (int i = 0; i < kFiles && line.find("missed") == std::string::npos; ++i) {
+    line = sleeper.Line();
+  }
+  EXPECT_EQ(line.find("a missed "), 0u) << line;
+
+  // Back with "since": what was kept, after a count of what was not.
+  Client again;
+  Subscribe(again, "a", kFiles - 10);
+  EXPECT_EQ(again.Line(), "a missed 5");
+  for (int seq = kFiles - 4; seq <= kFiles; ++seq) {
+    EXPECT_EQ(again.Line(), "a " + std::to_string(seq) + " " + name + std::to_string(seq));
+  }
+
+  // A queue removed and registered again, on the same connection.
+  ASSERT_TRUE(MonitorQueue::Delete("b", "f", MONITOR_QUEUE_TYPE_ETC_DIR));
+  EXPECT_EQ(b.Line(), "b 2 removed");
+  Register("b", "f", MONITOR_QUEUE_TYPE_ETC_DIR, "/tmp/s/b", kCreate);
+  EXPECT_EQ(b.Line(), "b 3 registered");
+  ASSERT_TRUE(Put("/tmp/s/b/y", "x"));
+  EXPECT_EQ(b.Line(), "b 4 /tmp/s/b/y");
+
+  // Root only: by the socket's mode, and by the peer's credentials should
+  // the mode be opened up.
+  struct stat st;
+  ASSERT_EQ(stat(kSocket, &st), 0);
+  EXPECT_EQ(st.st_mode & 0777, 0600u);
+  ASSERT_EQ(chmod(kSocket, 0666), 0);
+  const zorv_test::ChildResult refused =
+      zorv_test::RunAs({65534, 65534, 65534, 65534, 65534, 65534}, [] {
+        Client stranger;
+        const Json::Value v = stranger.Next();
+        return stranger.connected() && v["error"].asString().find("permission denied") == 0;
+      });
+  EXPECT_TRUE(refused.exited && refused.result == 1) << refused.error;
+
+  Client status;
+  ASSERT_TRUE(status.Send("{\"request\":\"status\"}"));
+  const Json::Value v = status.Next();
+  EXPECT_EQ(v["queues"], 2);
+  EXPECT_EQ(v["clients"], 4);
+  EXPECT_EQ(v["directories"], 2);
   EXPECT_EQ(daemon.Stop(), 0);
 }
 

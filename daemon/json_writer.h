@@ -1,0 +1,25 @@
+// Writing JSON lines directly into a reused buffer, without building a
+// Json::Value and a writer per line: the daemon writes one line per queue
+// and event.
+#ifndef ZORVNOTIFYD_DAEMON_JSON_WRITER_H_
+#define ZORVNOTIFYD_DAEMON_JSON_WRITER_H_
+
+#include <cstdint>
+#include <string>
+#include <string_view>
+
+namespace zorvnotifyd {
+
+// Appends |text| to |out| as a JSON string, quotes included: '"', '\' and
+// control bytes escaped (\n, \t, ... or \u00XX), every other byte as it is.
+void AppendJsonString(std::string* out, std::string_view text);
+
+// Appends "KEY": and |text| as a JSON string (KEY is written as it is).
+void AppendJsonField(std::string* out, const char* key, std::string_view text);
+
+// Appends "KEY": and the decimal |value|.
+void AppendJsonNumber(std::string* out, const char* key, uint64_t value);
+
+}  // namespace zorvnotifyd
+
+#endif  // ZORVNOTIFYD_DAEMON_JSON_WRITER_H_

@@ -1,0 +1,417 @@
+// The Unix socket of the daemon and the clients on it.
+
+#include "server.h"
+
+#include <errno.h>
+#include <grp.h>
+#include <pwd.h>
+#include <string.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <syslog.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <memory>
+#include <sstream>
+
+#include <json/json.h>
+
+#include "json_writer.h"
+#include "text.h"
+
+namespace zorvnotifyd {
+namespace {
+
+using zorvcommon::Quoted;
+
+// A request line longer than this is refused and the client let go.
+constexpr size_t kMaxRequest = 64 * 1024;
+
+// {"error":MESSAGE}
+std::string ErrorLine(const std::string& message) {
+  std::string line = "{";
+  AppendJsonField(&line, "error", message);
+  return line + "}\n";
+}
+
+}  // namespace
+
+struct Server::Client {
+  UniqueFd fd;
+  std::string who;
+  std::string in;
+  std::string out;
+  size_t sent = 0;
+  std::map<QueueLog*, uint64_t> next;  // the next record to deliver of each followed queue
+  std::vector<Subscription> subscriptions;
+  bool closing = false;  // let go once the output is written
+  bool behind = false;   // records wait in the logs: Fill delivers them in order
+};
+
+Server::Server(ServerOptions options, QueueLogs& logs, std::string run_id,
+               std::function<std::string()> status)
+    : options_(std::move(options)),
+      logs_(logs),
+      run_id_(std::move(run_id)),
+      status_(std::move(status)) {}
+
+Server::~Server() {
+  while (!clients_.empty()) Drop(clients_.begin());
+  struct stat st;
+  if (listener_.get() >= 0 && lstat(options_.socket_path.c_str(), &st) == 0 &&
+      S_ISSOCK(st.st_mode)) {
+    unlink(options_.socket_path.c_str());
+  }
+}
+
+bool Server::Listen() {
+  const std::string& path = options_.socket_path;
+  struct sockaddr_un address = {};
+  address.sun_family = AF_UNIX;
+  if (path.empty() || path.size() >= sizeof(address.sun_path)) {
+    syslog(LOG_ERR, "cannot listen on %s: the path is empty or too long", Quoted(path).c_str());
+    return false;
+  }
+  path.copy(address.sun_path, path.size());
+  // A socket left by an earlier run is replaced; nothing else ever is.
+  struct stat st;
+  if (lstat(path.c_str(), &st) == 0) {
+    if (!S_ISSOCK(st.st_mode)) {
+      syslog(LOG_ERR, "cannot listen on %s: another kind of file is there", Quoted(path).c_str());
+      return false;
+    }
+    unlink(path.c_str());
+  }
+  UniqueFd fd(socket(AF_UNIX, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0));
+  // The socket is made with its final mode: no moment when others could
+  // connect.
+  const mode_t old_mask = umask(options_.group_allowed ? 0117 : 0177);
+  const bool bound = fd.get() >= 0 && bind(fd.get(), reinterpret_cast<struct sockaddr*>(&address),
+                                           sizeof(address)) == 0;
+  const int error = errno;
+  umask(old_mask);
+  if (!bound || listen(fd.get(), 64) != 0 ||
+      (options_.group_allowed && lchown(path.c_str(), -1, options_.group) != 0)) {
+    syslog(LOG_ERR, "cannot listen on %s: %s", Quoted(path).c_str(),
+           strerror(bound ? errno : error));
+    return false;
+  }
+  listener_ = std::move(fd);
+  return true;
+}
+
+void Server::AddPollFds(std::vector<struct pollfd>* fds) const {
+  fds->push_back({listener_.get(), POLLIN, 0});
+  for (const Client& client : clients_) {
+    // Output waits, or records do: either goes as the socket takes it.
+    const short events =
+        client.sent < client.out.size() || client.behind ? POLLIN | POLLOUT : POLLIN;
+    fds->push_back({client.fd.get(), events, 0});
+  }
+}
+
+void Server::HandlePoll(const std::vector<struct pollfd>& fds, size_t first) {
+  auto it = clients_.begin();
+  for (size_t i = first + 1; i < fds.size() && it != clients_.end(); ++i) {
+    const auto client = it++;
+    const short events = fds[i].revents;
+    if (events & POLLIN) Read(*client);
+    if ((events & (POLLERR | POLLNVAL)) || (events & POLLHUP && !(events & POLLIN)) ||
+        client->fd.get() < 0 || ((events & POLLOUT) && !Flush(*client))) {
+      Drop(client);
+    }
+  }
+  if (fds[first].revents & POLLIN) Accept();
+}
+
+void Server::Accept() {
+  for (;;) {
+    UniqueFd fd(accept4(listener_.get(), nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC));
+    if (fd.get() < 0) return;  // EAGAIN: none left (other errors: try at the next poll)
+    std::string who;
+    if (!Allowed(fd.get(), &who)) {
+      const std::string refusal = ErrorLine(
+          "permission denied: " + who + " may not connect (" +
+          (options_.group_allowed ? "root and the daemon's group only" : "root only") + ")");
+      (void)!send(fd.get(), refusal.data(), refusal.size(), MSG_NOSIGNAL | MSG_DONTWAIT);
+      syslog(LOG_WARNING, "refused a client: %s", who.c_str());
+      continue;
+    }
+    clients_.emplace_back();
+    clients_.back().fd = std::move(fd);
+    clients_.back().who = who;
+  }
+}
+
+bool Server::Allowed(int fd, std::string* who) const {
+  struct ucred peer = {};
+  socklen_t size = sizeof(peer);
+  if (getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &peer, &size) != 0) {
+    *who = "a peer of unknown credentials";
+    return false;
+  }
+  *who = "uid " + std::to_string(peer.uid) + " (pid " + std::to_string(peer.pid) + ")";
+  if (peer.uid == 0) return true;
+  if (!options_.group_allowed) return false;
+  if (peer.gid == options_.group) return true;
+  // The supplementary groups of the peer's user.
+  struct passwd entry, *found = nullptr;
+  std::vector<char> buffer(16384);
+  if (getpwuid_r(peer.uid, &entry, buffer.data(), buffer.size(), &found) != 0 || !found) {
+    return false;
+  }
+  std::vector<gid_t> groups(64);
+  int count = static_cast<int>(groups.size());
+  if (getgrouplist(found->pw_name, peer.gid, groups.data(), &count) < 0) {
+    groups.resize(static_cast<size_t>(count));
+    if (getgrouplist(found->pw_name, peer.gid, groups.data(), &count) < 0) return false;
+  }
+  for (int i = 0; i < count; ++i) {
+    if (groups[static_cast<size_t>(i)] == options_.group) return true;
+  }
+  return false;
+}
+
+void Server::Read(Client& client) {
+  char buffer[16384];
+  const ssize_t n = recv(client.fd.get(), buffer, sizeof(buffer), MSG_DONTWAIT);
+  if (n == 0 || (n < 0 && errno != EAGAIN && errno != EINTR)) {
+    client.fd.Reset();  // gone: dropped by the caller
+    return;
+  }
+  if (n < 0 || client.closing) return;
+  client.in.append(buffer, static_cast<size_t>(n));
+  size_t start = 0;
+  for (size_t end; (end = client.in.find('\n', start)) != std::string::npos; start = end + 1) {
+    Request(client, client.in.substr(start, end - start));
+    if (client.closing) break;
+  }
+  client.in.erase(0, start);
+  if (client.in.size() > kMaxRequest) {
+    client.out += ErrorLine("request line longer than " + std::to_string(kMaxRequest) + " bytes");
+    client.closing = true;
+  }
+  Fill(client);
+}
+
+void Server::Request(Client& client, const std::string& line) {
+  Json::CharReaderBuilder builder;
+  Json::CharReaderBuilder::strictMode(&builder.settings_);
+  builder["failIfExtra"] = true;
+  const std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
+  Json::Value request;
+  std::string errors;
+  if (!reader->parse(line.data(), line.data() + line.size(), &request, &errors) ||
+      !request.isObject()) {
+    client.out += ErrorLine("a request is one JSON object on one line");
+    return;
+  }
+  const Json::Value kind = request.get("request", Json::Value());
+  if (kind == "status") {
+    client.out += "{\"reply\":\"status\",";
+    AppendJsonField(&client.out, "run", run_id_);
+    client.out += ',';
+    AppendJsonNumber(&client.out, "clients", clients_.size());
+    client.out += "," + status_() + "}\n";
+    return;
+  }
+  if (kind != "subscribe") {
+    client.out += ErrorLine("unknown request: say \"subscribe\" or \"status\"");
+    return;
+  }
+  Subscription subscription;
+  const Json::Value& name = request["queue"];
+  const Json::Value& type = request["type"];
+  const Json::Value& file = request["file"];
+  const Json::Value& since = request["since"];
+  std::string error;
+  if (!name.isString()) {
+    error = "\"queue\" must be the queue's name, a string";
+  } else if (!type.isNull() && (!type.isString() ||
+                                !zorvcommon::ParseQueueType(type.asString(), &subscription.type))) {
+    error = "\"type\" must be \"share\", \"etc\" or \"local-etc\"";
+  } else if (!file.isNull() && !file.isString()) {
+    error = "\"file\" must be a string";
+  } else if (!since.isNull() && !since.isUInt64()) {
+    error = "\"since\" must be a sequence number";
+  }
+  if (!error.empty()) {
+    client.out += ErrorLine(error);
+    return;
+  }
+  subscription.name = name.asString();
+  subscription.has_type = !type.isNull();
+  subscription.has_file = !file.isNull();
+  if (subscription.has_file) subscription.file = file.asString();
+  std::string reply;
+  Subscribe(client, subscription, !since.isNull(), since.isNull() ? 0 : since.asUInt64(), &reply);
+  client.out += reply;
+}
+
+void Server::Subscribe(Client& client, const Subscription& subscription, bool has_since,
+                       uint64_t since, std::string* reply) {
+  client.subscriptions.push_back(subscription);
+  *reply = "{\"reply\":\"subscribe\",";
+  AppendJsonField(reply, "run", run_id_);
+  *reply += ',';
+  AppendJsonField(reply, "queue", subscription.name);
+  *reply += ",\"queues\":[";
+  bool first = true;
+  for (QueueLog* log :
+       logs_.Find(subscription.name, subscription.has_type ? &subscription.type : nullptr,
+                  subscription.has_file ? &subscription.file : nullptr)) {
+    if (!first) *reply += ',';
+    first = false;
+    *reply += '{';
+    AppendJsonField(reply, "type", zorvcommon::QueueTypeName(log->type()));
+    *reply += ',';
+    AppendJsonField(reply, "file", log->file());
+    *reply += ',';
+    AppendJsonNumber(reply, "seq", log->last_seq());
+    *reply += '}';
+    // From after |since| (a number beyond the last record comes from
+    // another run of the daemon: everything kept), or from now on.
+    const uint64_t after = !has_since ? log->last_seq() : since > log->last_seq() ? 0 : since;
+    const auto known = client.next.find(log);
+    if (known == client.next.end()) {
+      Follow(client, log, after + 1);
+    } else if (has_since) {
+      known->second = after + 1;
+    }
+    client.behind = true;
+  }
+  *reply += "]}\n";
+}
+
+void Server::FollowNew(const std::vector<QueueLog*>& created) {
+  for (Client& client : clients_) {
+    for (QueueLog* log : created) {
+      for (const Subscription& subscription : client.subscriptions) {
+        if (log->name() != subscription.name ||
+            (subscription.has_type && log->type() != subscription.type) ||
+            (subscription.has_file && log->file() != subscription.file) ||
+            client.next.count(log) != 0) {
+          continue;
+        }
+        Follow(client, log, 1);
+        client.behind = true;
+      }
+    }
+  }
+}
+
+void Server::Fill(Client& client) {
+  while (client.out.size() - client.sent < options_.client_buffer) {
+    // The oldest undelivered record among the followed queues.
+    QueueLog* best = nullptr;
+    uint64_t best_order = 0;
+    for (auto& [log, next] : client.next) {
+      if (next > log->last_seq()) continue;
+      if (next < log->first_seq()) {
+        // Records the client did not take in time are gone: say how many.
+        client.out += log->head();
+        AppendJsonNumber(&client.out, "missed", log->first_seq() - next);
+        client.out += "}\n";
+        next = log->first_seq();
+      }
+      const uint64_t order = log->at(next).order;
+      if (best == nullptr || order < best_order) {
+        best = log;
+        best_order = order;
+      }
+    }
+    if (best == nullptr) {
+      client.behind = false;
+      return;
+    }
+    client.out += best->at(client.next[best]++).line;
+  }
+  client.behind = true;
+}
+
+void Server::Recorded(QueueLog* log) {
+  // Beyond this much waiting output, a client's socket is written at once.
+  constexpr size_t kWriteAt = 16 * 1024;
+  const auto range = followers_.equal_range(log);
+  for (auto it = range.first; it != range.second; ++it) {
+    Client& client = *it->second;
+    if (client.behind || client.closing) continue;
+    uint64_t& next = client.next[log];
+    // A full buffer goes to the socket first, if it takes it.
+    if (client.out.size() - client.sent >= options_.client_buffer && !Write(client)) {
+      client.closing = true;
+      continue;
+    }
+    if (next != log->last_seq() || client.out.size() - client.sent >= options_.client_buffer) {
+      client.behind = true;
+      continue;
+    }
+    client.out += log->at(next++).line;
+    if (client.out.size() - client.sent >= std::min(kWriteAt, options_.client_buffer) &&
+        !Write(client)) {
+      client.closing = true;
+    }
+  }
+}
+
+void Server::Follow(Client& client, QueueLog* log, uint64_t next) {
+  client.next[log] = next;
+  ++log->followers;
+  followers_.emplace(log, &client);
+}
+
+bool Server::Write(Client& client) {
+  while (client.sent < client.out.size()) {
+    const ssize_t n = send(client.fd.get(), client.out.data() + client.sent,
+                           client.out.size() - client.sent, MSG_NOSIGNAL | MSG_DONTWAIT);
+    if (n < 0 && errno == EINTR) continue;
+    if (n < 0 && errno == EAGAIN) break;
+    if (n <= 0) return false;
+    client.sent += static_cast<size_t>(n);
+  }
+  if (client.sent == client.out.size()) {
+    client.out.clear();
+    client.sent = 0;
+    return !client.closing;
+  }
+  if (client.sent > client.out.size() / 2) {
+    client.out.erase(0, client.sent);
+    client.sent = 0;
+  }
+  return true;
+}
+
+bool Server::Flush(Client& client) {
+  for (;;) {
+    Fill(client);
+    if (!Write(client)) return false;
+    // Done when the socket takes no more (poll says when it does) or the
+    // client has every record.
+    if (client.sent < client.out.size() || !client.behind) return true;
+  }
+}
+
+void Server::Deliver() {
+  for (auto it = clients_.begin(); it != clients_.end();) {
+    const auto client = it++;
+    if (!Flush(*client)) Drop(client);
+  }
+}
+
+void Server::Drop(std::list<Client>::iterator client) {
+  for (auto& [log, next] : client->next) {
+    const auto range = followers_.equal_range(log);
+    for (auto it = range.first; it != range.second; ++it) {
+      if (it->second == &*client) {
+        followers_.erase(it);
+        break;
+      }
+    }
+    logs_.Unfollow(log);
+  }
+  clients_.erase(client);
+}
+
+}  // namespace zorvnotifyd

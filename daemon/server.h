@@ -1,0 +1,105 @@
+// The daemon's clients: programs that connect to its Unix socket, subscribe
+// to queues and read each queue's events as JSON lines.  Every socket is
+// non-blocking and every client has a bounded output buffer, so no client
+// can delay the event loop, another client or a stop signal.
+#ifndef ZORVNOTIFYD_DAEMON_SERVER_H_
+#define ZORVNOTIFYD_DAEMON_SERVER_H_
+
+#include <poll.h>
+#include <sys/types.h>
+
+#include <cstdint>
+#include <functional>
+#include <list>
+#include <map>
+#include <string>
+#include <vector>
+
+#include "queue_log.h"
+#include "unique_fd.h"
+
+namespace zorvnotifyd {
+
+struct ServerOptions {
+  std::string socket_path = "/run/zorvnotifyd/zorvnotifyd.sock";
+  bool group_allowed = false;  // members of |group| may connect too
+  gid_t group = 0;
+  size_t client_buffer = 256 * 1024;  // bytes of output a client may have waiting
+};
+
+class Server {
+ public:
+  // |logs| holds the records; |status| makes the reply to a status request
+  // (a JSON object's members, without braces).
+  Server(ServerOptions options, QueueLogs& logs, std::string run_id,
+         std::function<std::string()> status);
+  ~Server();
+  Server(const Server&) = delete;
+  Server& operator=(const Server&) = delete;
+
+  // Listens on the socket path, replacing a socket left there (never
+  // another kind of file); mode 0600, or 0660 with the group.  False when
+  // that failed (logged).
+  bool Listen();
+
+  // Appends the descriptors to poll to |fds|: the socket, then each client
+  // (for input, and for output while it has some waiting).
+  void AddPollFds(std::vector<struct pollfd>* fds) const;
+  // Handles what poll found on the descriptors AddPollFds appended from
+  // position |first| of |fds|: new connections, requests, hang-ups.
+  void HandlePoll(const std::vector<struct pollfd>& fds, size_t first);
+
+  // After a catalogue load: clients whose subscriptions name a queue that
+  // is new (|created|) follow it from its first record.
+  void FollowNew(const std::vector<QueueLog*>& created);
+  // |log| has a new record: clients that follow it and have taken every
+  // earlier record get it at once (written out as their buffers fill), so
+  // that a client that keeps reading keeps up with a burst of events.
+  void Recorded(QueueLog* log);
+  // Moves new records into the clients' buffers (as far as each has room)
+  // and writes what the sockets take now.
+  void Deliver();
+
+  size_t clients() const { return clients_.size(); }
+
+ private:
+  struct Client;
+  // The subscription request of one client line.
+  struct Subscription {
+    std::string name;
+    bool has_type = false;
+    QueueType type = ZORV::ZORVNOTIFYD::MONITOR_QUEUE_TYPE_ETC_DIR;
+    bool has_file = false;
+    std::string file;
+  };
+
+  void Accept();
+  // True when the peer of |fd| may connect; |who| describes it.
+  bool Allowed(int fd, std::string* who) const;
+  void Read(Client& client);
+  void Request(Client& client, const std::string& line);
+  void Subscribe(Client& client, const Subscription& subscription, bool has_since, uint64_t since,
+                 std::string* reply);
+  // Copies records into |client|'s buffer while it has room.
+  void Fill(Client& client);
+  // Writes what the socket takes; false when the client is gone.
+  bool Write(Client& client);
+  // Fills and writes until the socket takes no more or the client has
+  // every record; false when the client is gone.
+  bool Flush(Client& client);
+  // |client| follows |log| from record |next| on.
+  void Follow(Client& client, QueueLog* log, uint64_t next);
+  void Drop(std::list<Client>::iterator client);
+
+  ServerOptions options_;
+  QueueLogs& logs_;
+  std::string run_id_;
+  std::function<std::string()> status_;
+  UniqueFd listener_;
+  std::list<Client> clients_;
+  std::multimap<QueueLog*, Client*> followers_;
+};
+
+}  // namespace zorvnotifyd
+
+#endif  // ZORVNOTIFYD_DAEMON_SERVER_H_
