@@ -18,8 +18,13 @@ std::string Key(QueueType type, const std::string& file, const std::string& name
 
 }  // namespace
 
-QueueLog::QueueLog(QueueType type, std::string file, std::string name, size_t keep)
-    : type_(type), file_(std::move(file)), name_(std::move(name)), keep_(keep) {
+QueueLog::QueueLog(QueueType type, std::string file, std::string name, size_t keep,
+                   uint64_t last_seq)
+    : type_(type),
+      file_(std::move(file)),
+      name_(std::move(name)),
+      keep_(keep),
+      next_seq_(last_seq + 1) {
   head_ = "{";
   AppendJsonField(&head_, "queue", name_);
   head_ += ',';
@@ -69,9 +74,12 @@ void QueueLogs::Follow(const Catalogue& catalogue, std::vector<QueueLog*>* by_po
   }
   by_position->clear();
   for (const CatalogueQueue& entry : catalogue) {
-    std::unique_ptr<QueueLog>& log = logs_[Key(entry.type, entry.file, entry.queue._name)];
+    const std::string key = Key(entry.type, entry.file, entry.queue._name);
+    std::unique_ptr<QueueLog>& log = logs_[key];
     if (!log) {
-      log = std::make_unique<QueueLog>(entry.type, entry.file, entry.queue._name, keep_);
+      const auto before = forgotten_.find(key);
+      log = std::make_unique<QueueLog>(entry.type, entry.file, entry.queue._name, keep_,
+                                       before == forgotten_.end() ? 0 : before->second);
       created->push_back(log.get());
     }
     log->present = true;
@@ -84,6 +92,7 @@ void QueueLogs::Follow(const Catalogue& catalogue, std::vector<QueueLog*>* by_po
       log.AddNotice(log.present ? "registered" : "removed", NextOrder());
     }
     if (!log.present && log.followers == 0) {
+      forgotten_[it->first] = log.last_seq();
       it = logs_.erase(it);
     } else {
       ++it;
@@ -107,6 +116,7 @@ void QueueLogs::Unfollow(QueueLog* log) {
   if (--log->followers > 0 || log->present) return;
   for (auto it = logs_.begin(); it != logs_.end(); ++it) {
     if (it->second.get() == log) {
+      forgotten_[it->first] = log->last_seq();
       logs_.erase(it);
       return;
     }

@@ -27,7 +27,8 @@ struct LogRecord {
 // own; only the last |keep| are kept.
 class QueueLog {
  public:
-  QueueLog(QueueType type, std::string file, std::string name, size_t keep);
+  // A log whose first record will be numbered |last_seq| + 1.
+  QueueLog(QueueType type, std::string file, std::string name, size_t keep, uint64_t last_seq);
   QueueLog(const QueueLog&) = delete;
   QueueLog& operator=(const QueueLog&) = delete;
 
@@ -96,6 +97,10 @@ class QueueLogs {
   size_t keep_;
   uint64_t order_ = 0;
   std::map<std::string, std::unique_ptr<QueueLog>> logs_;  // by type, file and name
+  // The last sequence number of each queue forgotten, so that a queue that
+  // comes back goes on numbering where it stopped: a client's "since" holds
+  // for the whole run of the daemon.
+  std::map<std::string, uint64_t> forgotten_;
 };
 
 }  // namespace zorvnotifyd

@@ -82,6 +82,12 @@ bool Server::Listen() {
       syslog(LOG_ERR, "cannot listen on %s: another kind of file is there", Quoted(path).c_str());
       return false;
     }
+    UniqueFd probe(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    if (probe.get() >= 0 &&
+        connect(probe.get(), reinterpret_cast<struct sockaddr*>(&address), sizeof(address)) == 0) {
+      syslog(LOG_ERR, "cannot listen on %s: another daemon listens there", Quoted(path).c_str());
+      return false;
+    }
     unlink(path.c_str());
   }
   UniqueFd fd(socket(AF_UNIX, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0));
@@ -106,9 +112,9 @@ void Server::AddPollFds(std::vector<struct pollfd>* fds) const {
   fds->push_back({listener_.get(), POLLIN, 0});
   for (const Client& client : clients_) {
     // Output waits, or records do: either goes as the socket takes it.
-    const short events =
-        client.sent < client.out.size() || client.behind ? POLLIN | POLLOUT : POLLIN;
-    fds->push_back({client.fd.get(), events, 0});
+    const short output = client.sent < client.out.size() || client.behind ? POLLOUT : 0;
+    fds->push_back({client.fd.get(), short(output | (Room(client) ? POLLIN : 0)), 0});
+    continue;
   }
 }
 
@@ -175,25 +181,36 @@ bool Server::Allowed(int fd, std::string* who) const {
 }
 
 void Server::Read(Client& client) {
+  if (client.closing || !Room(client)) return;  // read on when the client has taken its replies
   char buffer[16384];
   const ssize_t n = recv(client.fd.get(), buffer, sizeof(buffer), MSG_DONTWAIT);
   if (n == 0 || (n < 0 && errno != EAGAIN && errno != EINTR)) {
     client.fd.Reset();  // gone: dropped by the caller
     return;
   }
-  if (n < 0 || client.closing) return;
-  client.in.append(buffer, static_cast<size_t>(n));
+  if (n > 0) client.in.append(buffer, static_cast<size_t>(n));
+  Answer(client);
+}
+
+void Server::Answer(Client& client) {
+  // Requests are answered while the client has room for the replies, so a
+  // client that sends without reading cannot make the daemon's memory grow.
   size_t start = 0;
-  for (size_t end; (end = client.in.find('\n', start)) != std::string::npos; start = end + 1) {
+  for (size_t end;
+       !client.closing && Room(client) && (end = client.in.find('\n', start)) != std::string::npos;
+       start = end + 1) {
     Request(client, client.in.substr(start, end - start));
-    if (client.closing) break;
   }
   client.in.erase(0, start);
-  if (client.in.size() > kMaxRequest) {
+  if (client.in.size() > kMaxRequest && client.in.find('\n') == std::string::npos) {
     client.out += ErrorLine("request line longer than " + std::to_string(kMaxRequest) + " bytes");
     client.closing = true;
   }
   Fill(client);
+}
+
+bool Server::Room(const Client& client) const {
+  return client.out.size() - client.sent < options_.client_buffer;
 }
 
 void Server::Request(Client& client, const std::string& line) {
@@ -385,6 +402,7 @@ bool Server::Write(Client& client) {
 
 bool Server::Flush(Client& client) {
   for (;;) {
+    if (client.in.find('\n') != std::string::npos) Answer(client);  // requests that waited for room
     Fill(client);
     if (!Write(client)) return false;
     // Done when the socket takes no more (poll says when it does) or the

@@ -77,6 +77,10 @@ class Server {
   // True when the peer of |fd| may connect; |who| describes it.
   bool Allowed(int fd, std::string* who) const;
   void Read(Client& client);
+  // Answers the complete request lines read so far, as far as there is room.
+  void Answer(Client& client);
+  // True while |client| has room in its output buffer.
+  bool Room(const Client& client) const;
   void Request(Client& client, const std::string& line);
   void Subscribe(Client& client, const Subscription& subscription, bool has_since, uint64_t since,
                  std::string* reply);
