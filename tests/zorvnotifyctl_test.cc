@@ -1,17 +1,25 @@
 // Tests of the zorvnotifyctl tool, run as a child process inside this
 // program's sandbox: what it refuses (exit status 2, nothing touched), what
-// the library refuses (exit status 1, with the library's line on stderr) and
-// its --json output, parsed back.
+// the library refuses (exit status 1, with the library's line on stderr),
+// its --json output, parsed back, and its commands on a real daemon.
 
+#include <fcntl.h>
+#include <poll.h>
+#include <signal.h>
 #include <stdlib.h>
+#include <sys/inotify.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <fstream>
 #include <sstream>
 
 #include <gmock/gmock.h>
 #include <json/json.h>
 
+#include "monitor_queue.h"
 #include "support/sandbox.h"
 
 namespace {
@@ -138,6 +146,104 @@ TEST(ZorvnotifyctlTest, RefusalsExitStatusesAndJsonOutput) {
       {"--json delete b e", "", 0, removed + "true}"},
       {"--json delete b e", "", 0, removed + "false}"},
   });
+}
+
+// A program run in the background, its standard output and error on one
+// pipe; killed at the end when it still runs.
+class Background {
+ public:
+  explicit Background(std::vector<std::string> args) {
+    int fds[2];
+    EXPECT_EQ(pipe2(fds, O_CLOEXEC), 0);
+    if ((pid_ = fork()) == 0) {
+      if (dup2(fds[1], 1) < 0 || dup2(fds[1], 2) < 0) _exit(125);
+      std::vector<char*> argv;
+      for (std::string& arg : args) argv.push_back(&arg[0]);
+      argv.push_back(nullptr);
+      execv(argv[0], argv.data());
+      _exit(127);
+    }
+    close(fds[1]);
+    out_ = fds[0];
+  }
+  ~Background() {
+    if (pid_ > 0 && kill(pid_, SIGKILL) == 0) waitpid(pid_, nullptr, 0);
+    close(out_);
+  }
+  // The next line of output holding |text|, waiting up to 10 s; "" when
+  // none came.
+  std::string Line(const std::string& text = "") {
+    for (;;) {
+      for (size_t end; (end = buffered_.find('\n')) != std::string::npos;) {
+        const std::string line = buffered_.substr(0, end);
+        buffered_.erase(0, end + 1);
+        if (line.find(text) != std::string::npos) return line;
+      }
+      struct pollfd p = {out_, POLLIN, 0};
+      char chunk[4096];
+      ssize_t n = 0;
+      if (poll(&p, 1, 10000) <= 0 || (n = read(out_, chunk, sizeof(chunk))) <= 0) return "";
+      buffered_.append(chunk, size_t(n));
+    }
+  }
+  // Sends |signal| (0: none) and returns the exit status; -1 when the
+  // program did not exit within 10 s or was killed.
+  int Stop(int signal) {
+    int status = 0;
+    if (kill(pid_, signal) != 0) return -1;
+    for (int i = 0; i < 1000; ++i, usleep(10000)) {
+      if (waitpid(pid_, &status, WNOHANG) != pid_) continue;
+      pid_ = -1;
+      return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+    }
+    return -1;
+  }
+
+ private:
+  pid_t pid_ = -1;
+  int out_ = -1;
+  std::string buffered_;
+};
+
+TEST(ZorvnotifyctlTest, WatchAndStatusAskTheDaemon) {
+  ZORV_REQUIRE_SANDBOX();
+  zorv_test::ResetStore();
+  const std::string socket = "/tmp/ctl.sock";
+  std::string out, err;
+  EXPECT_EQ(RunTool("--socket " + socket + " watch backup", "", &out, &err), 1);
+  EXPECT_THAT(err, ::testing::HasSubstr("zorvnotifyd is not running (no socket at /tmp/ctl.sock)"));
+
+  ASSERT_TRUE(mkdir("/tmp/wd", 0755) == 0 || errno == EEXIST);
+  Json::Value queue;
+  queue["queue"] = "backup";
+  queue["config"][0]["path"] = "/tmp/wd";
+  queue["config"][0]["mask"] = IN_CREATE;
+  ASSERT_TRUE(
+      ZORV::ZORVNOTIFYD::MonitorQueue::Upsert(ZORV::ZORVNOTIFYD::MonitorQueue(queue), "nas",
+                                              ZORV::ZORVNOTIFYD::MONITOR_QUEUE_TYPE_ETC_DIR));
+  Background daemon({ZORVNOTIFYD_PATH, "--socket", socket});
+  ASSERT_THAT(daemon.Line("ready:"), ::testing::HasSubstr("for 1 queues"));
+  EXPECT_EQ(RunTool("--socket " + socket + " status", "", &out, &err), 0) << err;
+  EXPECT_THAT(out, ::testing::ContainsRegex("\nqueues +1\n"));
+
+  // Its first line comes once the subscription is in place.
+  Background watch({ZORVNOTIFYCTL_PATH, "--socket", socket, "watch", "backup"});
+  EXPECT_EQ(watch.Line(), "watching backup: etc/nas (last #0)");
+  std::ofstream("/tmp/wd/new").flush();
+  EXPECT_EQ(watch.Line(), "backup [etc/nas] #1 IN_CREATE /tmp/wd/new");
+  EXPECT_EQ(watch.Stop(SIGINT), 0);
+
+  // Kept records come first with --since; the daemon's going away ends
+  // the watch with status 1.
+  Background json(
+      {ZORVNOTIFYCTL_PATH, "--json", "--since", "0", "--socket", socket, "watch", "backup", "nas"});
+  EXPECT_EQ(Parse(json.Line())["reply"], "subscribe");
+  const Json::Value event = Parse(json.Line());
+  EXPECT_EQ(event["seq"], 1);
+  EXPECT_EQ(event["path"], "/tmp/wd/new");
+  EXPECT_EQ(daemon.Stop(SIGTERM), 0);
+  EXPECT_THAT(json.Line(), ::testing::HasSubstr("zorvnotifyd closed the connection"));
+  EXPECT_EQ(json.Stop(0), 1);
 }
 
 }  // namespace

@@ -3,6 +3,23 @@
 #include "command_line.h"
 
 namespace zorvnotifyctl {
+namespace {
+
+// Where the value of the option NAME ("--type", "--since" or "--socket")
+// goes, marking it as given; null for any other NAME.
+std::string* ValueOf(const std::string& name, CommandLine* line) {
+  if (name == "--type") {
+    line->type_given = true;
+    return &line->type;
+  }
+  if (name == "--since") {
+    line->since_given = true;
+    return &line->since;
+  }
+  return name == "--socket" ? &line->socket : nullptr;
+}
+
+}  // namespace
 
 std::string ParseCommandLine(int argc, const char* const* argv, CommandLine* line) {
   *line = CommandLine();
@@ -22,13 +39,21 @@ std::string ParseCommandLine(int argc, const char* const* argv, CommandLine* lin
       line->version = true;
     } else if (arg == "--verbose" || arg == "-v") {
       line->verbose = true;
-    } else if (arg == "--type" || arg == "-t") {
-      if (i + 1 >= argc) return "option " + arg + " needs a value (share, etc or local-etc)";
-      line->type_given = true;
-      line->type = argv[++i];
-    } else if (arg.compare(0, 7, "--type=") == 0) {
-      line->type_given = true;
-      line->type = arg.substr(7);
+    } else if (std::string* value =
+                   ValueOf(arg == "-t" ? "--type" : arg.substr(0, arg.find('=')), line)) {
+      // "--NAME VALUE" or "--NAME=VALUE"; "-t VALUE" only.
+      const size_t equals = arg.find('=');
+      if (equals != std::string::npos) {
+        *value = arg.substr(equals + 1);
+      } else if (i + 1 < argc) {
+        *value = argv[++i];
+      } else {
+        return "option " + arg + " needs a value (" +
+               (value == &line->type    ? "share, etc or local-etc"
+                : value == &line->since ? "N"
+                                        : "PATH") +
+               ")";
+      }
     } else {
       return "unknown option " + arg;
     }

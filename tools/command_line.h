@@ -18,12 +18,17 @@ struct CommandLine {
   bool verbose = false;           // --verbose or -v: the library's extra log lines
   bool type_given = false;        // --type appeared
   std::string type;               // the value of the last --type
+  bool since_given = false;       // --since appeared
+  std::string since;              // the value of the last --since
+  // --socket: the daemon's socket (the default unless given)
+  std::string socket = "/run/zorvnotifyd/zorvnotifyd.sock";
 };
 
 // Parses argv[1] to argv[argc - 1] into |line|.  Options may stand before or
-// after the command; "--type" takes its value as the next argument or after
-// "=".  "--" ends the options, and "-" alone is a positional argument (the
-// standard input).  Returns "" on success, otherwise the usage error.
+// after the command; "--type", "--since" and "--socket" take their value as
+// the next argument or after "=".  "--" ends the options, and "-" alone is
+// a positional argument (the standard input).  Returns "" on success,
+// otherwise the usage error.
 std::string ParseCommandLine(int argc, const char* const* argv, CommandLine* line);
 
 }  // namespace zorvnotifyctl

@@ -2,16 +2,22 @@
 
 #include "commands.h"
 
+#include <signal.h>
+#include <sys/signalfd.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include <cerrno>
 #include <cstring>
 #include <fstream>
 #include <iostream>
+#include <memory>
 #include <set>
 #include <sstream>
 
 #include "catalogue_view.h"
+#include "daemon_client.h"
+#include "event_names.h"
 #include "json_output.h"
 #include "masks.h"
 #include "monitor_queue.h"
@@ -145,6 +151,144 @@ bool LoadCatalogueOrFail(std::vector<TypedQueue>* queues, int* status) {
   if (LoadCatalogue(queues)) return true;
   *status = Fail(kExitRefused, "cannot read the catalogue (see the library's message above)");
   return false;
+}
+
+// Blocks SIGINT and SIGTERM for the rest of the process's life (unblocking
+// them would deliver a pending one with its default action) and reads them
+// from fd (-1, with the signals left alone, when no signalfd could be made),
+// so that a watch stops between two lines, never in the middle of one.
+struct StopSignals {
+  StopSignals() {
+    sigset_t set;
+    sigemptyset(&set);
+    sigaddset(&set, SIGINT);
+    sigaddset(&set, SIGTERM);
+    sigset_t old;
+    if (sigprocmask(SIG_BLOCK, &set, &old) != 0) return;
+    fd = signalfd(-1, &set, SFD_CLOEXEC);
+    if (fd < 0) sigprocmask(SIG_SETMASK, &old, nullptr);
+  }
+  ~StopSignals() {
+    if (fd >= 0) close(fd);
+  }
+  int fd = -1;
+};
+
+// |value| as one line of JSON, with UTF-8 as it is.
+std::string JsonLine(const Json::Value& value) {
+  Json::StreamWriterBuilder builder;
+  builder["indentation"] = "";
+  builder["emitUTF8"] = true;
+  return Json::writeString(builder, value);
+}
+
+// Parses one line from the daemon; false when it is not a JSON object.
+bool ParseLine(const std::string& line, Json::Value* value) {
+  static const std::unique_ptr<Json::CharReader> reader(Json::CharReaderBuilder().newCharReader());
+  return reader->parse(line.data(), line.data() + line.size(), value, nullptr) && value->isObject();
+}
+
+// Connects to the daemon, sends |request| and reads the first line of the
+// answer, parsed into |reply|: an object whose "reply" is |kind|.  A refusal
+// ({"error": ...}) or anything else is reported (exit status 1).
+// When |stop_fd| (see DaemonClient::ReadLine) ends the wait, returns false
+// with |status| 0.
+bool Ask(DaemonClient* client, const Invocation& invocation, const Json::Value& request,
+         const char* kind, int timeout_ms, int stop_fd, Json::Value* reply, std::string* line,
+         int* status) {
+  std::string error;
+  if (!client->Connect(invocation.socket, &error)) {
+    *status = Fail(kExitRefused, error);
+    return false;
+  }
+  // A refused peer gets its error line and is let go before the request is
+  // read: the line is looked for even when sending failed.
+  const bool sent = client->Send(JsonLine(request), &error);
+  switch (client->ReadLine(line, timeout_ms, stop_fd, &error)) {
+    case DaemonClient::Read::kLine:
+      break;
+    case DaemonClient::Read::kStopped:
+      *status = kExitOk;
+      return false;
+    case DaemonClient::Read::kClosed:
+      if (sent) error = "zorvnotifyd closed the connection without answering";
+      [[fallthrough]];
+    default:
+      *status = Fail(kExitRefused, error);
+      return false;
+  }
+  if (!ParseLine(*line, reply)) {
+    *status = Fail(kExitRefused, "zorvnotifyd answered with something other than a JSON object: " +
+                                     Printable(*line));
+    return false;
+  }
+  const Json::Value& answer = *reply;  // read only: no member is added
+  const Json::Value& refusal = answer["error"];
+  if (refusal.isString()) {
+    *status = Fail(kExitRefused, "zorvnotifyd refused: " + Printable(refusal.asString()));
+    return false;
+  }
+  if (answer["reply"] != kind) {
+    *status = Fail(kExitRefused, "unexpected answer from zorvnotifyd: " + Printable(*line));
+    return false;
+  }
+  return true;
+}
+
+// "QUEUE [TYPE/FILE]" for a line about one queue; false when the line does
+// not name one.
+bool QueueLabel(const Json::Value& value, std::string* label) {
+  const Json::Value& queue = value["queue"];
+  const Json::Value& type = value["type"];
+  const Json::Value& file = value["file"];
+  if (!queue.isString() || !type.isString() || !file.isString()) return false;
+  *label = Printable(queue.asString()) + " [" + Printable(type.asString()) + "/" +
+           Printable(file.asString()) + "]";
+  return true;
+}
+
+// The readable form of a line of a subscription; the line itself, escaped,
+// when it is not one the tool knows.
+std::string ReadableRecord(const std::string& line) {
+  Json::Value parsed;
+  const Json::Value& value = parsed;  // read only: no member is added
+  std::string label;
+  if (!ParseLine(line, &parsed) || !QueueLabel(value, &label)) return Printable(line);
+  const Json::Value& missed = value["missed"];
+  if (missed.isUInt64()) {
+    return label + " MISSED " + std::to_string(missed.asUInt64()) + " events (no longer kept)";
+  }
+  const Json::Value& seq = value["seq"];
+  if (!seq.isUInt64()) return Printable(line);
+  label += " #" + std::to_string(seq.asUInt64()) + " ";
+  const Json::Value& path = value["path"];
+  const Json::Value& mask = value["mask"];
+  if (path.isString() && mask.isUInt()) {
+    return label + zorvcommon::MaskNames(mask.asUInt()) + " " + Printable(path.asString());
+  }
+  if (value["lost"] == true) {
+    return label + "LOST events may have been lost (inotify queue overflow)";
+  }
+  if (value["removed"] == true) return label + "removed from the catalogue";
+  if (value["registered"] == true) return label + "registered again";
+  return Printable(line);
+}
+
+// "watching QUEUE: TYPE/FILE (last #N), ...", from the subscribe reply.
+std::string ReadableSubscription(const Json::Value& reply, const std::string& name) {
+  std::string queues;
+  for (const Json::Value& queue : reply["queues"]) {
+    const Json::Value& type = queue["type"];
+    const Json::Value& file = queue["file"];
+    const Json::Value& seq = queue["seq"];
+    if (!type.isString() || !file.isString() || !seq.isUInt64()) continue;
+    if (!queues.empty()) queues += ", ";
+    queues += Printable(type.asString()) + "/" + Printable(file.asString()) + " (last #" +
+              std::to_string(seq.asUInt64()) + ")";
+  }
+  return "watching " + Printable(name) + ": " +
+         (queues.empty() ? "not in the catalogue now; its events follow once it is registered"
+                         : queues);
 }
 
 }  // namespace
@@ -350,6 +494,84 @@ int RunShares(const Invocation& invocation) {
   Table table({"SHARE"});
   for (const std::string& share : shares) table.AddRow({Printable(share)});
   PrintTableOrNone(table, "(no shares)");
+  return kExitOk;
+}
+
+int RunWatch(const Invocation& invocation) {
+  const std::string& name = invocation.args[0];
+  const bool has_file = invocation.args.size() > 1;
+  int status = kExitOk;
+  if (has_file && !CheckFileName(invocation.args[1], &status)) return status;
+  Json::Value request(Json::objectValue);
+  request["request"] = "subscribe";
+  request["queue"] = name;
+  if (invocation.type_given) request["type"] = QueueTypeName(invocation.type);
+  if (has_file) request["file"] = invocation.args[1];
+  if (invocation.since_given) request["since"] = Json::UInt64(invocation.since);
+  const StopSignals stop;
+  DaemonClient client;
+  Json::Value reply;
+  std::string line;
+  if (!Ask(&client, invocation, request, "subscribe", -1, stop.fd, &reply, &line, &status)) {
+    return status;
+  }
+  std::string shown = invocation.json ? line : ReadableSubscription(reply, name);
+  for (;;) {
+    // One line at a time, flushed, so that a reader sees each event as it
+    // comes; a failed write is reported by main().
+    if (!(std::cout << shown << '\n' << std::flush)) return kExitRefused;
+    std::string error;
+    switch (client.ReadLine(&line, -1, stop.fd, &error)) {
+      case DaemonClient::Read::kLine:
+        break;
+      case DaemonClient::Read::kStopped:
+        return kExitOk;
+      case DaemonClient::Read::kClosed:
+        return Fail(kExitRefused, "zorvnotifyd closed the connection");
+      default:
+        return Fail(kExitRefused, error);
+    }
+    shown = invocation.json ? line : ReadableRecord(line);
+  }
+}
+
+int RunStatus(const Invocation& invocation) {
+  // The daemon answers between two rounds of its event loop; a daemon that
+  // does not answer in this long is reported rather than waited for.
+  constexpr int kTimeoutMs = 30000;
+  Json::Value request(Json::objectValue);
+  request["request"] = "status";
+  DaemonClient client;
+  Json::Value reply;
+  std::string line;
+  int status = kExitOk;
+  if (!Ask(&client, invocation, request, "status", kTimeoutMs, -1, &reply, &line, &status)) {
+    return status;
+  }
+  if (invocation.json) {
+    WriteJson(std::cout, reply);
+    return kExitOk;
+  }
+  const std::pair<const char*, const char*> rows[] = {
+      {"directories", "directories watched"},
+      {"queues", "queues"},
+      {"clients", "clients"},
+      {"events", "events handled"},
+      {"overflows", "overflows (events lost)"},
+      {"trees_missing", "trees missing"},
+      {"directories_over_watch_limit", "directories over the watch limit"},
+      {"run", "run id"},
+  };
+  constexpr size_t kValueColumn = 34;  // the longest label and two blanks
+  const Json::Value& answer = reply;   // read only: no member is added
+  for (const auto& [key, label] : rows) {
+    const Json::Value& value = answer[key];
+    std::cout << label << std::string(kValueColumn - strlen(label), ' ')
+              << (value.isUInt64()   ? std::to_string(value.asUInt64())
+                  : value.isString() ? Printable(value.asString())
+                                     : "-")
+              << '\n';
+  }
   return kExitOk;
 }
 

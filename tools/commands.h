@@ -4,6 +4,7 @@
 #ifndef ZORVNOTIFYD_TOOLS_COMMANDS_H_
 #define ZORVNOTIFYD_TOOLS_COMMANDS_H_
 
+#include <cstdint>
 #include <string>
 #include <vector>
 
@@ -19,7 +20,7 @@ using zorvcommon::QueueTypeName;
 // Exit statuses of the tool.
 enum ExitStatus : int {
   kExitOk = 0,       // done
-  kExitRefused = 1,  // the library refused or failed (its log lines say why)
+  kExitRefused = 1,  // the library or zorvnotifyd refused or failed, or is not running
   kExitUsage = 2,    // bad command line or invalid input; nothing was changed
 };
 
@@ -27,8 +28,12 @@ enum ExitStatus : int {
 // arguments; the commands check their content.
 struct Invocation {
   std::vector<std::string> args;  // the positional arguments after the command
-  QueueType type;                 // the queue type of --type (default etc)
-  bool json;                      // --json
+  QueueType type = ZORV::ZORVNOTIFYD::MONITOR_QUEUE_TYPE_ETC_DIR;  // --type (default etc)
+  bool json = false;                                               // --json
+  bool type_given = false;   // --type appeared (watch filters by type only then)
+  bool since_given = false;  // --since appeared
+  uint64_t since = 0;        // its sequence number
+  std::string socket;        // the daemon's socket
 };
 
 // Writes "zorvnotifyctl: " and |message| as one line to standard error and
@@ -52,6 +57,12 @@ int RunMatch(const Invocation& invocation);
 int RunDirs(const Invocation& invocation);
 // shares: the share set of the catalogue.
 int RunShares(const Invocation& invocation);
+// watch QUEUE [FILE]: subscribes to the queue at the daemon and prints its
+// events and notices, one line each as they come, until SIGINT or SIGTERM
+// (exit status 0) or until the daemon ends the connection (1).
+int RunWatch(const Invocation& invocation);
+// status: the daemon's counters.
+int RunStatus(const Invocation& invocation);
 
 }  // namespace zorvnotifyctl
 

@@ -1,12 +1,16 @@
 // zorvnotifyctl: inspects and edits the catalogue of monitor queues of the
-// zorvnotifyd daemon through the public API of libzorvnotifyd.
+// zorvnotifyd daemon through the public API of libzorvnotifyd, and asks the
+// running daemon for events and counters over its Unix socket.
 //
-// Exit status: 0 done, 1 the library refused or failed, 2 bad command line
-// or invalid input (nothing was changed).  The library's own log lines go
-// to standard error as well as to syslog.
+// Exit status: 0 done (for watch: stopped by SIGINT or SIGTERM), 1 the
+// library or the daemon refused or failed, or the daemon is not running, 2
+// bad command line or invalid input (nothing was changed).  The library's
+// own log lines go to standard error as well as to syslog.
 
 #include <syslog.h>
 
+#include <cerrno>
+#include <cstdlib>
 #include <cstring>
 #include <exception>
 #include <iostream>
@@ -20,28 +24,38 @@
 namespace zorvnotifyctl {
 namespace {
 
-// One command: its arguments, whether it reads a single queue file (and so
-// takes --type), what runs it, and its help.
+// What a command takes beyond --json (and --socket, which every command
+// accepts and watch and status use).
+enum Takes : unsigned {
+  kNoOption = 0,
+  kFileType = 1,    // --type: the type of its one queue file (default etc)
+  kTypeFilter = 2,  // --type: only queues of that type
+  kSince = 4,       // --since
+  kDaemon = 8,      // asks the daemon (the usage line shows --socket)
+};
+
+// One command: its arguments, the options it takes, what runs it, and its
+// help.
 struct CommandInfo {
   const char* name;
   size_t min_args;
   size_t max_args;
-  bool takes_type;
+  unsigned takes;
   int (*run)(const Invocation&);
   const char* synopsis;     // the arguments, e.g. "NAME FILE"
   const char* description;  // the paragraph of its --help
 };
 
 constexpr CommandInfo kCommands[] = {
-    {"list", 1, 1, true, RunList, "FILE",
+    {"list", 1, 1, kFileType, RunList, "FILE",
      "Shows the queues of queue file FILE of the chosen type, in file order.  A file\n"
      "that does not exist holds no queues.  With --json: the queues as a JSON array\n"
      "in the file's own form.\n"},
-    {"get", 2, 2, true, RunGet, "NAME FILE",
+    {"get", 2, 2, kFileType, RunGet, "NAME FILE",
      "Shows the first queue named NAME (exactly, case included) of queue file FILE.\n"
      "Exit status 1 when the file holds no such queue.  With --json: the queue\n"
      "object, which upsert accepts back.\n"},
-    {"upsert", 1, 2, true, RunUpsert, "FILE [SOURCE]",
+    {"upsert", 1, 2, kFileType, RunUpsert, "FILE [SOURCE]",
      "Stores one queue object, read from SOURCE (a file; standard input when SOURCE\n"
      "is absent or \"-\"), in queue file FILE: it replaces the first queue of the\n"
      "same name or is appended.  The library then asks for the service zorvnotifyd\n"
@@ -57,25 +71,46 @@ constexpr CommandInfo kCommands[] = {
      "Unknown keys, wrong types, missing keys, such paths and patterns that do not\n"
      "compile are refused with exit status 2, before anything is written; for a\n"
      "path the message says how to write it.\n"},
-    {"delete", 2, 2, true, RunDelete, "NAME FILE",
+    {"delete", 2, 2, kFileType, RunDelete, "NAME FILE",
      "Removes the first queue named NAME from queue file FILE.  A name the file does\n"
      "not hold changes nothing and is not an error.  When no queue is left in the\n"
      "whole catalogue, the library asks for the service zorvnotifyd to be stopped.\n"},
-    {"catalogue", 0, 0, false, RunCatalogue, "",
+    {"catalogue", 0, 0, kNoOption, RunCatalogue, "",
      "Shows every queue of every type (share, etc, local-etc), with its type.\n"
      "With --json: an array of queue objects, each with an added \"type\".\n"},
-    {"match", 2, 2, false, RunMatch, "PATH MASK",
+    {"match", 2, 2, kNoOption, RunMatch, "PATH MASK",
      "Shows the queues of the catalogue that want an event of the kinds MASK on\n"
      "PATH: some configuration shares a bit with MASK, PATH is its directory or\n"
      "below it, and none of its ignore patterns matches PATH.  MASK is decimal or\n"
      "hexadecimal after 0x.\n"},
-    {"dirs", 1, 1, false, RunDirs, "DIR",
+    {"dirs", 1, 1, kNoOption, RunDirs, "DIR",
      "Shows the queues of the catalogue that watch DIR itself or a directory below\n"
      "it, each with the union of the masks of those configurations, and the union\n"
      "of all of them: the event kinds a watch on DIR must report.\n"},
-    {"shares", 0, 0, false, RunShares, "",
+    {"shares", 0, 0, kNoOption, RunShares, "",
      "Shows the share set of the catalogue: the distinct first two components\n"
      "(such as /vol/share) of the absolute paths the queues watch.\n"},
+    {"watch", 1, 2, kTypeFilter | kSince | kDaemon, RunWatch, "QUEUE [FILE]",
+     "Subscribes to the queues named QUEUE at the running daemon zorvnotifyd (only\n"
+     "those of queue file FILE when given, only those of type TYPE when --type is\n"
+     "given) and shows their events as they happen, one line each, e.g.\n"
+     "  backup [etc/nas] #12 IN_CREATE|IN_ISDIR /vol/share/docs\n"
+     "with the queue's sequence number of each event, and its notices:\n"
+     "  backup [etc/nas] #13 LOST events may have been lost (inotify queue overflow)\n"
+     "  backup [etc/nas] #14 removed from the catalogue\n"
+     "  backup [etc/nas] #15 registered again\n"
+     "  backup [etc/nas] MISSED 40 events (no longer kept)\n"
+     "The first line names the queues subscribed to and the number of their last\n"
+     "event.  Without --since, events from now on; with --since N, first every\n"
+     "event after number N the daemon still keeps.  Runs until SIGINT or SIGTERM\n"
+     "(exit status 0) or until the daemon closes the connection (exit status 1).\n"
+     "With --json: the subscription's reply, then the daemon's lines as they are,\n"
+     "one JSON object per line.\n"},
+    {"status", 0, 0, kDaemon, RunStatus, "",
+     "Shows the counters of the running daemon zorvnotifyd: directories watched,\n"
+     "queues, clients, events handled, overflows (events lost), trees missing,\n"
+     "directories over the watch limit and the id of its run.  With --json: the\n"
+     "daemon's reply object.\n"},
 };
 
 const char kProgram[] = "zorvnotifyctl";
@@ -93,18 +128,27 @@ const char kOverview[] =
     "  match PATH MASK        show the queues that want an event MASK on PATH\n"
     "  dirs DIR               show the queues that watch DIR or below, and their masks\n"
     "  shares                 show the share set of the catalogue\n"
+    "Commands on the running daemon:\n"
+    "  watch QUEUE [FILE]     show the events of queue QUEUE as they happen\n"
+    "  status                 show the daemon's counters\n"
+    "\n"
     "  help [COMMAND]         show this text, or the help of COMMAND\n"
     "\n"
     "Options (anywhere on the line):\n"
-    "  -t, --type TYPE   queue type of FILE: share, etc (default) or local-etc\n"
+    "  -t, --type TYPE   queue type of FILE: share, etc (default) or local-etc;\n"
+    "                    for watch, only queues of that type\n"
     "      --json        write JSON instead of tables\n"
+    "      --since N     watch: first the kept events after number N\n"
+    "      --socket PATH the daemon's socket, for watch and status\n"
+    "                    (default /run/zorvnotifyd/zorvnotifyd.sock)\n"
     "  -v, --verbose     also show the library's detailed log lines\n"
     "  -h, --help        show help; after a command, that command's help\n"
     "      --version     show the version and exit\n"
     "\n"
     "FILE is a plain name inside the configuration directory of the type, not\n"
-    "beginning with \".\".  The store operations need root.\n"
-    "Exit status: 0 done, 1 the library refused or failed, 2 bad usage or input.\n"
+    "beginning with \".\".  The store operations and the daemon's socket need root.\n"
+    "Exit status: 0 done, 1 the library or the daemon refused or failed, or the\n"
+    "daemon is not running, 2 bad usage or input.\n"
     "See zorvnotifyctl(1).\n";
 
 const CommandInfo* FindCommand(const std::string& name) {
@@ -116,7 +160,10 @@ const CommandInfo* FindCommand(const std::string& name) {
 
 std::string UsageLine(const CommandInfo& info) {
   std::string line = std::string("Usage: ") + kProgram;
-  line += info.takes_type ? " [--type TYPE] [--json] " : " [--json] ";
+  if (info.takes & kDaemon) line += " [--socket PATH]";
+  if (info.takes & (kFileType | kTypeFilter)) line += " [--type TYPE]";
+  if (info.takes & kSince) line += " [--since N]";
+  line += " [--json] ";
   line += info.name;
   if (*info.synopsis != '\0') line += std::string(" ") + info.synopsis;
   return line;
@@ -128,7 +175,18 @@ void PrintOverview(std::ostream& out) {
 
 void PrintCommandHelp(const CommandInfo& info, std::ostream& out) {
   out << UsageLine(info) << "\n\n" << info.description;
-  if (info.takes_type) out << "\nTYPE is share, etc (default) or local-etc.\n";
+  if (info.takes & kFileType) out << "\nTYPE is share, etc (default) or local-etc.\n";
+  if (info.takes & kTypeFilter) out << "\nTYPE is share, etc or local-etc.\n";
+}
+
+// Parses a decimal sequence number of up to 64 bits, digits only.
+bool ParseSince(const std::string& text, uint64_t* since) {
+  if (text.empty() || text.find_first_not_of("0123456789") != std::string::npos) return false;
+  errno = 0;
+  const unsigned long long value = strtoull(text.c_str(), nullptr, 10);
+  if (errno == ERANGE) return false;
+  *since = value;
+  return true;
 }
 
 int UsageError(const std::string& message) {
@@ -173,15 +231,28 @@ int Dispatch(int argc, char** argv) {
     std::cerr << UsageLine(*info) << '\n';
     return kExitUsage;
   }
-  Invocation invocation{line.args, ZORV::ZORVNOTIFYD::MONITOR_QUEUE_TYPE_ETC_DIR, line.json};
+  Invocation invocation;
+  invocation.args = line.args;
+  invocation.json = line.json;
+  invocation.socket = line.socket;
+  invocation.type_given = line.type_given;
   if (line.type_given) {
-    if (!info->takes_type) {
+    if (!(info->takes & (kFileType | kTypeFilter))) {
       return UsageError(std::string("--type does not apply to ") + info->name +
-                        ", which covers every type");
+                        (info->takes & kDaemon ? "" : ", which covers every type"));
     }
     if (!ParseQueueType(line.type, &invocation.type)) {
       return UsageError("unknown queue type \"" + line.type + "\" (use share, etc or local-etc)");
     }
+  }
+  if (line.since_given) {
+    if (!(info->takes & kSince))
+      return UsageError(std::string("--since does not apply to ") + info->name);
+    if (!ParseSince(line.since, &invocation.since)) {
+      return UsageError("--since \"" + line.since +
+                        "\" is not a sequence number (0 to 18446744073709551615)");
+    }
+    invocation.since_given = true;
   }
   if (line.verbose) ZORV::ZORVNOTIFYD::LOG_LEVEL = 7;
   return info->run(invocation);
