@@ -46,8 +46,9 @@ struct Server::Client {
   size_t sent = 0;
   std::map<QueueLog*, uint64_t> next;  // the next record to deliver of each followed queue
   std::vector<Subscription> subscriptions;
-  bool closing = false;  // let go once the output is written
-  bool behind = false;   // records wait in the logs: Fill delivers them in order
+  bool closing = false;   // let go once the output is written
+  bool behind = false;    // records wait in the logs: Fill delivers them in order
+  bool sent_all = false;  // the client shut its sending side
 };
 
 Server::Server(ServerOptions options, QueueLogs& logs, std::string run_id,
@@ -113,7 +114,8 @@ void Server::AddPollFds(std::vector<struct pollfd>* fds) const {
   for (const Client& client : clients_) {
     // Output waits, or records do: either goes as the socket takes it.
     const short output = client.sent < client.out.size() || client.behind ? POLLOUT : 0;
-    fds->push_back({client.fd.get(), short(output | (Room(client) ? POLLIN : 0)), 0});
+    const short input = Room(client) && !client.sent_all ? POLLIN : 0;
+    fds->push_back({client.fd.get(), short(output | input), 0});
     continue;
   }
 }
@@ -124,8 +126,10 @@ void Server::HandlePoll(const std::vector<struct pollfd>& fds, size_t first) {
     const auto client = it++;
     const short events = fds[i].revents;
     if (events & POLLIN) Read(*client);
-    if ((events & (POLLERR | POLLNVAL)) || (events & POLLHUP && !(events & POLLIN)) ||
-        client->fd.get() < 0 || ((events & POLLOUT) && !Flush(*client))) {
+    // Gone for good (closed, both ways shut): forgotten at once.  A client
+    // that only shut its sending side still gets its replies and records.
+    if ((events & (POLLERR | POLLNVAL | POLLHUP)) || client->fd.get() < 0 ||
+        ((events & POLLOUT) && !Flush(*client))) {
       Drop(client);
     }
   }
@@ -181,13 +185,15 @@ bool Server::Allowed(int fd, std::string* who) const {
 }
 
 void Server::Read(Client& client) {
-  if (client.closing || !Room(client)) return;  // read on when the client has taken its replies
+  // Read on when the client has taken its replies.
+  if (client.closing || client.sent_all || !Room(client)) return;
   char buffer[16384];
   const ssize_t n = recv(client.fd.get(), buffer, sizeof(buffer), MSG_DONTWAIT);
-  if (n == 0 || (n < 0 && errno != EAGAIN && errno != EINTR)) {
+  if (n < 0 && errno != EAGAIN && errno != EINTR) {
     client.fd.Reset();  // gone: dropped by the caller
     return;
   }
+  if (n == 0) client.sent_all = true;  // its requests are all in
   if (n > 0) client.in.append(buffer, static_cast<size_t>(n));
   Answer(client);
 }

@@ -478,6 +478,8 @@ class Client {
   }
   ~Client() { close(fd_); }
   bool connected() const { return connected_; }
+  // Shuts the sending side: the daemon must still send.
+  void Shut() { shutdown(fd_, SHUT_WR); }
   bool Send(const std::string& line) {
     const std::string text = line + "\n";
     return write(fd_, text.data(), text.size()) == ssize_t(text.size());
@@ -545,6 +547,7 @@ TEST(DaemonTest, DeliversEachQueueItsEventsToItsSubscribers) {
   EXPECT_EQ(reply["run"].asString().size(), 32u);
   EXPECT_EQ(reply["queues"].size(), 1u);
   EXPECT_EQ(Subscribe(b, "b")["run"], reply["run"]);
+  b.Shut();  // b only listens from now on
   Subscribe(sleeper, "a");
 
   // Each client exactly its queue's events, in order.
