@@ -1,179 +1,679 @@
-// Events the daemon zorvnotifyd handles, beside a bare inotify read loop
-// over the same events.  The catalogue holds 100 queues of 8 configurations
-// each, every configuration on a directory of its own with an ignore
-// pattern; the events happen in the directory of the last configuration of
-// the last queue, so every event is asked of all 100 queues before the one
-// that wants it answers.  A batch is timed from the first file written until
-// the daemon has printed its line for the last event (or, for the bare loop,
-// until the last event has been read).  Runs in the test sandbox (root).
+// The daemon zorvnotifyd beside a bare inotify reader process
+// (bare_inotify_reader) that watches the same directories with the same
+// masks and only reads the events.
+//
+// The catalogue: N queues (10, 100, 1,000) of 8 configurations each, with
+// 2-3 ignore patterns.  Queue i watches /tmp/bench/share/q<i>/d<j>, except
+// that 8 queues spread over the catalogue have their last configuration on
+// the hot directory /tmp/bench/share/hot, with masks of which some take the
+// burst's event kinds and some do not, and patterns of which some ignore
+// the burst's files.  The trees hold 10 directories per queue (10,000 at
+// 1,000 queues): the configured ones, two below each queue's first, seven
+// below the hot one.  Every queue has a client subscribed on the daemon's
+// socket, read by a thread of this program.
+//
+// Burst: one process creates, writes and removes 20,000 files in the hot
+// directory as fast as it can (80,000 inotify events).  The row is the CPU
+// time (user + system) of the daemon's process, or of the bare reader's,
+// from just before the burst until the last event has reached the clients
+// (or has been read), per inotify event.  The events lost are the event
+// lines the clients did not get (of those the catalogue wants, worked out
+// with MonitorQueueIndex), or the events the bare reader did not read.
+//
+// Start-up: wall time from exec to the daemon's "ready" log line at 1,000
+// queues, beside the bare reader's time to walk the same 10,000 directories
+// and add their watches.
+//
+// With two CPUs or more, the writer has one to itself and the reading side
+// (the daemon and its clients' thread, or the bare reader) another, so that
+// where the scheduler puts them does not change the batches the readers
+// find (each wake-up costs the same whatever it brings).
+//
+// Runs in the test sandbox (root): the catalogue is in /usr/zorv, the trees
+// in /tmp.
 
+#include <errno.h>
 #include <fcntl.h>
+#include <sched.h>
 #include <signal.h>
+#include <spawn.h>
+#include <sys/epoll.h>
+#include <sys/eventfd.h>
 #include <sys/inotify.h>
+#include <sys/resource.h>
+#include <sys/socket.h>
+#include <sys/un.h>
 #include <sys/wait.h>
+#include <time.h>
 #include <unistd.h>
 
 #include <benchmark/benchmark.h>
 
+#include <algorithm>
+#include <atomic>
 #include <chrono>
+#include <condition_variable>
 #include <cstdio>
+#include <cstdlib>
+#include <cstring>
 #include <filesystem>
+#include <fstream>
+#include <iterator>
+#include <memory>
+#include <mutex>
+#include <set>
+#include <sstream>
 #include <string>
+#include <string_view>
 #include <thread>
 #include <vector>
 
 #include <json/json.h>
 
 #include "monitor_queue.h"
+#include "monitor_queue_index.h"
 #include "support/sandbox.h"
+
+extern char** environ;
 
 namespace {
 
 using ZORV::ZORVNOTIFYD::MonitorQueue;
-
-constexpr int kQueues = 100;
-constexpr int kConfigs = 8;
-constexpr int kBatch = 1000;
-constexpr unsigned int kMask = IN_CLOSE_WRITE;
-const std::string kRoot = "/tmp/bench";
-const std::string kHotDir = kRoot + "/q99/c7";
-const std::string kBareDir = kRoot + "/bare";  // not in the catalogue: the daemon ignores it
-
+using ZORV::ZORVNOTIFYD::MonitorQueueIndex;
 using Clock = std::chrono::steady_clock;
 
-// Writes the catalogue and creates the directories it names.
-bool MakeCatalogue() {
-  std::vector<MonitorQueue> queues;
-  for (int q = 0; q < kQueues; ++q) {
-    Json::Value value(Json::objectValue);
-    value["queue"] = "q" + std::to_string(q);
-    for (int c = 0; c < kConfigs; ++c) {
-      const std::string dir = kRoot + "/q" + std::to_string(q) + "/c" + std::to_string(c);
-      std::error_code error;
-      std::filesystem::create_directories(dir, error);
-      if (error) return false;
-      Json::Value config(Json::objectValue);
-      config["path"] = dir;
-      config["mask"] = kMask;
-      config["ignore"].append("\\.tmp$");
-      value["config"].append(config);
-    }
-    queues.emplace_back(value);
+constexpr int kConfigs = 8;
+constexpr int kHotQueues = 8;
+constexpr int kMaxQueues = 1000;
+constexpr int kFiles = 20000;
+// Created, modified, closed after writing, deleted.
+constexpr uint32_t kBurstKinds[] = {IN_CREATE, IN_MODIFY, IN_CLOSE_WRITE, IN_DELETE};
+constexpr uint64_t kKernelEvents = uint64_t(kFiles) * std::size(kBurstKinds);
+// The kinds the daemon watches on every directory to keep its tree.
+constexpr uint32_t kTreeKeeping =
+    IN_CREATE | IN_MOVED_TO | IN_MOVED_FROM | IN_DELETE | IN_MOVE_SELF | IN_DELETE_SELF;
+
+const std::string kRoot = "/tmp/bench";
+const std::string kShare = kRoot + "/share";
+const std::string kHotDir = kShare + "/hot";
+const std::string kSocket = kRoot + "/zorvnotifyd.sock";
+const std::string kRootsFile = kRoot + "/roots";
+
+// The configurations on the hot directory, one per hot queue.
+struct HotConfig {
+  uint32_t mask;
+  std::vector<const char*> ignore;
+};
+const std::vector<const char*> kIgnore = {"\\.tmp$", "/\\.#[^/]*$", "~$"};
+const HotConfig kHot[kHotQueues] = {
+    {IN_CLOSE_WRITE, kIgnore},                           // every file, closed
+    {IN_CREATE | IN_DELETE, kIgnore},                    // every file, twice
+    {IN_MOVED_FROM | IN_MOVED_TO, kIgnore},              // no kind of the burst
+    {IN_ATTRIB, kIgnore},                                // no kind of the burst
+    {IN_MODIFY | IN_CLOSE_WRITE, {"\\.dat$", "~$"}},     // ignores every file
+    {IN_MODIFY, kIgnore},                                // every file, written
+    {IN_DELETE_SELF | IN_MOVE_SELF, kIgnore},            // no kind of the burst
+    {IN_CREATE, {"/f[0-9]*[13579]\\.dat$", "\\.tmp$"}},  // half the files
+};
+// The masks of the other configurations, by position.
+constexpr uint32_t kMasks[4] = {IN_CLOSE_WRITE | IN_MOVED_TO,
+                                IN_CREATE | IN_DELETE | IN_MOVED_FROM | IN_MOVED_TO,
+                                IN_MODIFY | IN_ATTRIB, IN_CLOSE_WRITE | IN_DELETE};
+
+// The writer's CPU and the reading side's; |pinned| false with one CPU.
+struct Placement {
+  bool pinned = false;
+  cpu_set_t writer, reader;
+};
+Placement g_cpus;
+
+// Puts the calling thread on |cpus| when the program pins.
+void RunOn(const cpu_set_t& cpus) {
+  if (g_cpus.pinned) sched_setaffinity(0, sizeof(cpus), &cpus);
+}
+
+// Picks the first two CPUs the program may use and moves the calling
+// thread (the writer) to the first.
+void PlaceThreads() {
+  cpu_set_t allowed;
+  if (sched_getaffinity(0, sizeof(allowed), &allowed) != 0 || CPU_COUNT(&allowed) < 2) return;
+  CPU_ZERO(&g_cpus.writer);
+  CPU_ZERO(&g_cpus.reader);
+  int found = 0;
+  for (int cpu = 0; cpu < CPU_SETSIZE && found < 2; ++cpu) {
+    if (!CPU_ISSET(cpu, &allowed)) continue;
+    CPU_SET(cpu, found++ == 0 ? &g_cpus.writer : &g_cpus.reader);
   }
+  g_cpus.pinned = true;
+  RunOn(g_cpus.writer);
+}
+
+std::string Thousands(long n) {
+  std::string digits = std::to_string(n);
+  for (int i = static_cast<int>(digits.size()) - 3; i > 0; i -= 3) digits.insert(i, ",");
+  return digits;
+}
+
+std::string QueueDir(int i) { return kShare + "/q" + std::to_string(i); }
+
+// The position of hot queue |k| in a catalogue of |queues|.
+int HotQueue(int queues, int k) { return k * queues / kHotQueues; }
+
+// Creates every directory of the largest catalogue: q<i>/d0..d7, two
+// subdirectories of each d0, and seven of the hot directory.
+bool MakeTrees() {
   std::error_code error;
-  std::filesystem::create_directories(kBareDir, error);
-  if (error) return false;
-  const std::string dir = MonitorQueue::GetConfDir(ZORV::ZORVNOTIFYD::MONITOR_QUEUE_TYPE_ETC_DIR);
-  return MonitorQueue::SaveToFile(queues, dir + "/bench");
-}
-
-// Creates (or truncates) and closes |kBatch| files of |dir|, each one event
-// of kind kMask.
-void MakeEvents(const std::string& dir) {
-  for (int i = 0; i < kBatch; ++i) {
-    const int fd = open((dir + "/f" + std::to_string(i)).c_str(),
-                        O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600);
-    if (fd >= 0) close(fd);
-  }
-}
-
-// The daemon, started with --json, its report lines read from a pipe.
-class Daemon {
- public:
-  Daemon() {
-    int out[2];
-    int err[2];
-    if (pipe2(out, O_CLOEXEC) != 0 || pipe2(err, O_CLOEXEC) != 0) return;
-    pid_ = fork();
-    if (pid_ == 0) {
-      dup2(out[1], 1);
-      dup2(err[1], 2);
-      execl(ZORVNOTIFYD_PATH, "zorvnotifyd", "--json", static_cast<char*>(nullptr));
-      _exit(127);
+  for (int i = 0; i < kMaxQueues && !error; ++i) {
+    for (int j = 0; j < kConfigs; ++j) {
+      std::filesystem::create_directories(QueueDir(i) + "/d" + std::to_string(j), error);
     }
-    close(out[1]);
-    close(err[1]);
-    out_ = out[0];
-    err_ = err[0];
+    for (const char* sub : {"/d0/s0", "/d0/s1"}) {
+      std::filesystem::create_directories(QueueDir(i) + sub, error);
+    }
   }
-  Daemon(const Daemon&) = delete;
-  Daemon& operator=(const Daemon&) = delete;
-  ~Daemon() {
+  for (int h = 0; h < 7; ++h) {
+    std::filesystem::create_directories(kHotDir + "/h" + std::to_string(h), error);
+  }
+  return !error;
+}
+
+// The burst's files.
+const std::vector<std::string>& BurstPaths() {
+  static const std::vector<std::string> paths = [] {
+    std::vector<std::string> list;
+    for (int n = 0; n < kFiles; ++n) list.push_back(kHotDir + "/f" + std::to_string(n) + ".dat");
+    return list;
+  }();
+  return paths;
+}
+
+// Creates, writes, closes and removes every file of the burst.
+void Burst() {
+  static const char kData[] = "burst\n";
+  for (const std::string& path : BurstPaths()) {
+    const int fd = open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600);
+    if (fd < 0) continue;
+    if (write(fd, kData, sizeof(kData) - 1) < 0) perror("daemon_bench: write");
+    close(fd);
+    unlink(path.c_str());
+  }
+}
+
+// The catalogue in use: its queue file, the bare reader's roots file, and
+// what the clients should get from a burst.
+struct Catalogue {
+  int queues = 0;
+  size_t directories = 0;       // watched, as the daemon should say when ready
+  uint64_t expected_lines = 0;  // event lines for the clients, over all queues
+};
+
+const Catalogue* UseCatalogue(int queues) {
+  static Catalogue current;
+  if (current.queues == queues) return &current;
+  current = Catalogue();
+  std::vector<MonitorQueue> catalogue;
+  std::vector<std::string> roots;
+  std::set<std::string> seen;
+  for (int i = 0; i < queues; ++i) {
+    int hot = -1;
+    for (int k = 0; k < kHotQueues; ++k) {
+      if (HotQueue(queues, k) == i) hot = k;
+    }
+    Json::Value value(Json::objectValue);
+    value["queue"] = "q" + std::to_string(i);
+    for (int j = 0; j < kConfigs; ++j) {
+      Json::Value config(Json::objectValue);
+      const bool on_hot = hot >= 0 && j == kConfigs - 1;
+      config["path"] = on_hot ? kHotDir : QueueDir(i) + "/d" + std::to_string(j);
+      config["mask"] = on_hot ? kHot[hot].mask : kMasks[j % 4];
+      for (const char* pattern : on_hot ? kHot[hot].ignore : kIgnore) {
+        config["ignore"].append(pattern);
+      }
+      value["config"].append(config);
+      if (seen.insert(config["path"].asString()).second) roots.push_back(config["path"].asString());
+    }
+    catalogue.emplace_back(value);
+  }
+  const std::string dir = MonitorQueue::GetConfDir(ZORV::ZORVNOTIFYD::MONITOR_QUEUE_TYPE_ETC_DIR);
+  if (!MonitorQueue::SaveToFile(catalogue, dir + "/bench")) return nullptr;
+  // The bare reader watches each tree with the mask the daemon gives it.
+  const MonitorQueueIndex index(catalogue);
+  std::ofstream file(kRootsFile, std::ios::trunc);
+  for (const std::string& root : roots) {
+    file << "0x" << std::hex << ((index.GetWatchMask(root) & IN_ALL_EVENTS) | kTreeKeeping)
+         << std::dec << ' ' << root << '\n';
+  }
+  if (!file.flush()) return nullptr;
+  std::vector<size_t> matches;
+  for (const std::string& path : BurstPaths()) {
+    for (uint32_t kind : kBurstKinds) {
+      index.Match(path, kind, matches);
+      current.expected_lines += matches.size();
+    }
+  }
+  current.directories = roots.size() + 2 * static_cast<size_t>(queues) + 7;
+  current.queues = queues;
+  return &current;
+}
+
+// A child process, its standard output and error read by a thread.
+class Child {
+ public:
+  explicit Child(const std::vector<std::string>& args) {
+    int out[2];
+    int in[2];
+    if (pipe2(out, O_CLOEXEC) != 0) return;
+    if (pipe2(in, O_CLOEXEC) != 0) {
+      close(out[0]);
+      close(out[1]);
+      return;
+    }
+    posix_spawn_file_actions_t actions;
+    posix_spawn_file_actions_init(&actions);
+    posix_spawn_file_actions_adddup2(&actions, in[0], 0);
+    posix_spawn_file_actions_adddup2(&actions, out[1], 1);
+    posix_spawn_file_actions_adddup2(&actions, out[1], 2);
+    std::vector<char*> argv;
+    for (const std::string& arg : args) argv.push_back(const_cast<char*>(arg.c_str()));
+    argv.push_back(nullptr);
+    // The child starts on the reading side's CPU.
+    RunOn(g_cpus.reader);
+    if (posix_spawn(&pid_, argv[0], &actions, nullptr, argv.data(), environ) != 0) pid_ = -1;
+    RunOn(g_cpus.writer);
+    posix_spawn_file_actions_destroy(&actions);
+    close(out[1]);
+    close(in[0]);
+    input_ = in[1];
+    reader_ = std::thread([this, fd = out[0]] {
+      char buffer[4096];
+      for (ssize_t n; (n = read(fd, buffer, sizeof(buffer))) > 0;) {
+        std::lock_guard<std::mutex> lock(mutex_);
+        output_.append(buffer, static_cast<size_t>(n));
+        changed_.notify_all();
+      }
+      close(fd);
+    });
+  }
+  Child(const Child&) = delete;
+  Child& operator=(const Child&) = delete;
+  ~Child() {
+    close(input_);
     if (pid_ > 0) {
       kill(pid_, SIGTERM);
       waitpid(pid_, nullptr, 0);
     }
-    if (out_ >= 0) close(out_);
-    if (err_ >= 0) close(err_);
+    if (reader_.joinable()) reader_.join();
   }
 
-  // Waits until the daemon logs that it watches the catalogue.
-  bool WaitReady() {
-    std::string log;
-    char buffer[4096];
-    while (log.find("ready:") == std::string::npos) {
-      const ssize_t n = read(err_, buffer, sizeof buffer);
-      if (n <= 0) return false;
-      log.append(buffer, static_cast<size_t>(n));
-    }
-    return true;
+  pid_t pid() const { return pid_; }
+
+  // Waits up to |timeout| for a line of output holding |marker| (after
+  // those found by earlier calls) and returns it; empty when none came.
+  std::string WaitFor(const std::string& marker, Clock::duration timeout) {
+    std::unique_lock<std::mutex> lock(mutex_);
+    size_t at = std::string::npos;
+    size_t end = std::string::npos;
+    changed_.wait_for(lock, timeout, [&] {
+      at = output_.find(marker, seen_);
+      end = at == std::string::npos ? at : output_.find('\n', at);
+      return end != std::string::npos;
+    });
+    if (end == std::string::npos) return "";
+    const size_t start =
+        output_.rfind('\n', at) == std::string::npos ? 0 : output_.rfind('\n', at) + 1;
+    seen_ = end + 1;
+    return output_.substr(start, seen_ - start);
   }
 
-  // Reads report lines until |lines| more have arrived.
-  void ReadLines(int lines) {
-    char buffer[65536];
-    while (lines > 0) {
-      const ssize_t n = read(out_, buffer, sizeof buffer);
-      if (n <= 0) return;
-      for (ssize_t i = 0; i < n; ++i) lines -= buffer[i] == '\n';
+  // Everything it wrote so far.
+  std::string Output() {
+    std::lock_guard<std::mutex> lock(mutex_);
+    return output_;
+  }
+
+  // CPU time (user + system) of the process so far, in nanoseconds.
+  int64_t CpuNs() const {
+    clockid_t clock;
+    struct timespec now;
+    if (clock_getcpuclockid(pid_, &clock) != 0 || clock_gettime(clock, &now) != 0) return -1;
+    return int64_t(now.tv_sec) * 1000000000 + now.tv_nsec;
+  }
+  // The same in clock ticks, from /proc, split into user and system time.
+  void Ticks(long* user, long* system) const {
+    *user = *system = 0;
+    std::ifstream stat("/proc/" + std::to_string(pid_) + "/stat");
+    std::string text((std::istreambuf_iterator<char>(stat)), std::istreambuf_iterator<char>());
+    const size_t end = text.rfind(')');
+    if (end == std::string::npos) return;
+    // Fields 14 and 15, counted from the state (field 3) after the name.
+    std::istringstream fields(text.substr(end + 2));
+    std::string field;
+    for (int i = 3; i < 14 && fields >> field; ++i) {
     }
+    fields >> *user >> *system;
   }
 
  private:
   pid_t pid_ = -1;
-  int out_ = -1;
-  int err_ = -1;
+  int input_ = -1;
+  std::thread reader_;
+  std::mutex mutex_;
+  std::condition_variable changed_;
+  std::string output_;
+  size_t seen_ = 0;
 };
 
-Daemon* g_daemon = nullptr;
+// One client per queue, each subscribed to its queue, read by one thread
+// that counts what arrives.
+class Subscribers {
+ public:
+  std::atomic<uint64_t> replies{0}, events{0}, missed{0}, lost{0}, other{0};
 
-void DaemonHandles(benchmark::State& state) {
-  for (auto _ : state) {
-    const auto start = Clock::now();
-    MakeEvents(kHotDir);
-    g_daemon->ReadLines(kBatch);
-    state.SetIterationTime(std::chrono::duration<double>(Clock::now() - start).count());
+  Subscribers() {
+    epoll_ = epoll_create1(EPOLL_CLOEXEC);
+    stop_ = eventfd(0, EFD_CLOEXEC);
+    struct epoll_event event = {};
+    event.events = EPOLLIN;
+    event.data.u64 = ~uint64_t(0);
+    epoll_ctl(epoll_, EPOLL_CTL_ADD, stop_, &event);
   }
-  state.SetLabel("100 queues of 8 configurations");
-}
+  Subscribers(const Subscribers&) = delete;
+  Subscribers& operator=(const Subscribers&) = delete;
+  ~Subscribers() {
+    if (thread_.joinable()) {
+      const uint64_t one = 1;
+      if (write(stop_, &one, sizeof(one)) < 0) perror("daemon_bench: eventfd");
+      thread_.join();
+    }
+    for (const Client& client : clients_) close(client.fd);
+    close(stop_);
+    close(epoll_);
+  }
 
-// The bare loop: one inotify watch, with the kinds the daemon watches, on a
-// directory of its own (so that the daemon does not see these events), read
-// by a second thread as the daemon reads in a process of its own.
-void BareInotify(benchmark::State& state) {
-  const int fd = inotify_init1(IN_CLOEXEC);
-  inotify_add_watch(fd, kBareDir.c_str(),
-                    kMask | IN_CREATE | IN_DELETE | IN_MOVED_FROM | IN_MOVED_TO);
-  for (auto _ : state) {
-    const auto start = Clock::now();
-    std::thread reader([fd] {
-      alignas(struct inotify_event) char buffer[65536];
-      for (int seen = 0; seen < kBatch;) {
-        const ssize_t n = read(fd, buffer, sizeof buffer);
-        if (n <= 0) return;
-        for (ssize_t i = 0; i < n;) {
-          const auto* event = reinterpret_cast<const struct inotify_event*>(buffer + i);
-          seen += (event->mask & kMask) != 0;
-          i += static_cast<ssize_t>(sizeof(struct inotify_event) + event->len);
+  // Connects |queues| clients, client i subscribing to queue "q<i>".
+  bool Connect(int queues) {
+    clients_.resize(static_cast<size_t>(queues));
+    thread_ = std::thread([this] {
+      RunOn(g_cpus.reader);
+      Run();
+    });
+    for (int i = 0; i < queues; ++i) {
+      const int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+      struct sockaddr_un address = {};
+      address.sun_family = AF_UNIX;
+      kSocket.copy(address.sun_path, sizeof(address.sun_path) - 1);
+      const std::string request =
+          "{\"request\":\"subscribe\",\"queue\":\"q" + std::to_string(i) + "\"}\n";
+      if (fd < 0 || connect(fd, reinterpret_cast<struct sockaddr*>(&address), sizeof(address)) ||
+          send(fd, request.data(), request.size(), MSG_NOSIGNAL) !=
+              static_cast<ssize_t>(request.size()) ||
+          fcntl(fd, F_SETFL, O_NONBLOCK) != 0) {
+        if (fd >= 0) close(fd);
+        return false;
+      }
+      clients_[static_cast<size_t>(i)].fd = fd;
+      struct epoll_event event = {};
+      event.events = EPOLLIN;
+      event.data.u64 = static_cast<uint64_t>(i);
+      if (epoll_ctl(epoll_, EPOLL_CTL_ADD, fd, &event) != 0) return false;
+    }
+    return true;
+  }
+
+ private:
+  struct Client {
+    int fd = -1;
+    std::string partial;  // the start of a line not complete yet
+  };
+
+  void Run() {
+    struct epoll_event ready[64];
+    std::vector<char> buffer(256 * 1024);
+    for (;;) {
+      const int n = epoll_wait(epoll_, ready, 64, -1);
+      for (int e = 0; e < n; ++e) {
+        if (ready[e].data.u64 == ~uint64_t(0)) return;
+        Client& client = clients_[ready[e].data.u64];
+        for (;;) {
+          const ssize_t got = read(client.fd, buffer.data(), buffer.size());
+          if (got <= 0) {
+            if (got == 0) epoll_ctl(epoll_, EPOLL_CTL_DEL, client.fd, nullptr);
+            break;
+          }
+          Take(client, buffer.data(), static_cast<size_t>(got));
         }
       }
-    });
-    MakeEvents(kBareDir);
-    reader.join();
-    state.SetIterationTime(std::chrono::duration<double>(Clock::now() - start).count());
+    }
   }
-  close(fd);
-  state.SetLabel("inotify read loop, one watch, no catalogue");
+
+  // Counts the complete lines of |data| (after what |client| kept).
+  void Take(Client& client, const char* data, size_t size) {
+    const char* end = data + size;
+    const char* start = data;
+    for (const char* nl; (nl = static_cast<const char*>(memchr(start, '\n', end - start)));
+         start = nl + 1) {
+      if (client.partial.empty()) {
+        Count(start, nl);
+      } else {
+        client.partial.append(start, nl);
+        Count(client.partial.data(), client.partial.data() + client.partial.size());
+        client.partial.clear();
+      }
+    }
+    client.partial.append(start, end);
+  }
+
+  void Count(const char* begin, const char* end) {
+    const std::string_view line(begin, static_cast<size_t>(end - begin));
+    if (line.rfind("{\"reply\":", 0) == 0) {
+      ++replies;
+    } else if (const size_t at = line.find("\"missed\":"); at != std::string_view::npos) {
+      missed += std::strtoull(begin + at + 9, nullptr, 10);
+    } else if (line.find("\"lost\":true") != std::string_view::npos) {
+      ++lost;
+    } else if (line.find("\"path\":") != std::string_view::npos) {
+      ++events;
+    } else {
+      ++other;
+    }
+  }
+
+  int epoll_ = -1;
+  int stop_ = -1;
+  std::vector<Client> clients_;
+  std::thread thread_;
+};
+
+// The daemon's answer to a status request, or a null value.
+Json::Value Status() {
+  Json::Value status;
+  const int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  struct sockaddr_un address = {};
+  address.sun_family = AF_UNIX;
+  kSocket.copy(address.sun_path, sizeof(address.sun_path) - 1);
+  const char request[] = "{\"request\":\"status\"}\n";
+  std::string line;
+  if (fd >= 0 && connect(fd, reinterpret_cast<struct sockaddr*>(&address), sizeof(address)) == 0 &&
+      send(fd, request, sizeof(request) - 1, MSG_NOSIGNAL) == sizeof(request) - 1) {
+    char c;
+    while (read(fd, &c, 1) == 1 && c != '\n') line += c;
+  }
+  if (fd >= 0) close(fd);
+  Json::CharReaderBuilder builder;
+  const std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
+  std::string errors;
+  if (!reader->parse(line.data(), line.data() + line.size(), &status, &errors))
+    return Json::Value();
+  return status;
+}
+
+// Waits until |count| reaches |expected| or has not moved for a second.
+void WaitCount(const std::atomic<uint64_t>& count, uint64_t expected) {
+  uint64_t last = count;
+  auto moved = Clock::now();
+  while (count < expected && Clock::now() - moved < std::chrono::seconds(1)) {
+    std::this_thread::sleep_for(std::chrono::milliseconds(1));
+    if (count != last) {
+      last = count;
+      moved = Clock::now();
+    }
+  }
+}
+
+std::string BurstLabel(int queues) {
+  return Thousands(queues) + " queues of 8 configurations, 8 of them on the burst's directory; " +
+         Thousands(static_cast<long>(queues) * 10) +
+         " directories; a client per queue; 20,000 files created, written, removed (80,000 "
+         "events)";
+}
+
+void SetCpuCounters(benchmark::State& state, int64_t cpu_ns, long user, long system) {
+  state.counters["cpu_ns_per_event"] = double(cpu_ns) / double(kKernelEvents);
+  state.counters["cpu_ms"] = double(cpu_ns) / 1e6;
+  state.counters["user_share"] = user + system > 0 ? double(user) / double(user + system) : 0;
+}
+
+// The daemon's CPU time over a burst, its clients subscribed.
+void DaemonBurst(benchmark::State& state, int queues) {
+  const Catalogue* catalogue = UseCatalogue(queues);
+  if (catalogue == nullptr) {
+    state.SkipWithError("cannot write the catalogue");
+    return;
+  }
+  // The periodic look at the trees every 10 minutes, not in the burst.
+  Child daemon({ZORVNOTIFYD_PATH, "--socket", kSocket, "--retry", "600"});
+  const std::string ready = daemon.WaitFor("ready:", std::chrono::seconds(60));
+  if (ready.find("watching " + std::to_string(catalogue->directories) + " directories") ==
+      std::string::npos) {
+    state.SkipWithError(("the daemon did not start as expected: " + daemon.Output()).c_str());
+    return;
+  }
+  Subscribers clients;
+  const bool connected = clients.Connect(queues);
+  WaitCount(clients.replies, static_cast<uint64_t>(queues));
+  if (!connected || clients.replies != static_cast<uint64_t>(queues)) {
+    state.SkipWithError("the clients could not subscribe");
+    return;
+  }
+  const Json::Value before = Status();
+  int64_t cpu_ns = 0;
+  long user0 = 0, system0 = 0, user1 = 0, system1 = 0;
+  double wall = 0;
+  for (auto _ : state) {
+    daemon.Ticks(&user0, &system0);
+    const int64_t cpu0 = daemon.CpuNs();
+    const auto start = Clock::now();
+    Burst();
+    WaitCount(clients.events, catalogue->expected_lines);
+    cpu_ns = daemon.CpuNs() - cpu0;
+    wall = std::chrono::duration<double>(Clock::now() - start).count();
+    daemon.Ticks(&user1, &system1);
+  }
+  const Json::Value after = Status();
+  SetCpuCounters(state, cpu_ns, user1 - user0, system1 - system0);
+  state.counters["events_lost"] =
+      double(catalogue->expected_lines) -
+      double(std::min<uint64_t>(clients.events, catalogue->expected_lines));
+  state.counters["lines"] = double(clients.events);
+  state.counters["expected_lines"] = double(catalogue->expected_lines);
+  state.counters["missed"] = double(clients.missed);
+  state.counters["lost_notices"] = double(clients.lost);
+  state.counters["kernel_events"] = after["events"].asDouble() - before["events"].asDouble();
+  state.counters["overflows"] = after["overflows"].asDouble() - before["overflows"].asDouble();
+  state.counters["wall_ms"] = wall * 1e3;
+  state.SetLabel(BurstLabel(queues));
+}
+
+// The bare reader's CPU time over the same burst.
+void BareBurst(benchmark::State& state, int queues) {
+  const Catalogue* catalogue = UseCatalogue(queues);
+  if (catalogue == nullptr) {
+    state.SkipWithError("cannot write the roots file");
+    return;
+  }
+  Child bare({BARE_READER_PATH, kRootsFile, std::to_string(kKernelEvents)});
+  if (bare.WaitFor("ready " + std::to_string(catalogue->directories) + "\n",
+                   std::chrono::seconds(60))
+          .empty()) {
+    state.SkipWithError(("the bare reader did not start as expected: " + bare.Output()).c_str());
+    return;
+  }
+  int64_t cpu_ns = 0;
+  long user0 = 0, system0 = 0, user1 = 0, system1 = 0;
+  std::string done;
+  double wall = 0;
+  for (auto _ : state) {
+    bare.Ticks(&user0, &system0);
+    const int64_t cpu0 = bare.CpuNs();
+    const auto start = Clock::now();
+    Burst();
+    done = bare.WaitFor("done ", std::chrono::seconds(1));
+    // Not every event came: stop it (SIGUSR1 ends its read).
+    for (int tries = 0; done.empty() && tries < 50; ++tries) {
+      kill(bare.pid(), SIGUSR1);
+      done = bare.WaitFor("done ", std::chrono::milliseconds(100));
+    }
+    cpu_ns = bare.CpuNs() - cpu0;
+    wall = std::chrono::duration<double>(Clock::now() - start).count();
+    bare.Ticks(&user1, &system1);
+  }
+  unsigned long count = 0, overflows = 0;
+  if (std::sscanf(done.c_str(), "done %lu %lu", &count, &overflows) != 2) {
+    state.SkipWithError("the bare reader did not say what it read");
+    return;
+  }
+  SetCpuCounters(state, cpu_ns, user1 - user0, system1 - system0);
+  state.counters["events_lost"] = double(kKernelEvents - std::min<uint64_t>(count, kKernelEvents));
+  state.counters["kernel_events"] = double(count);
+  state.counters["overflows"] = double(overflows);
+  state.counters["wall_ms"] = wall * 1e3;
+  state.SetLabel("bare inotify reader process, the same watches and masks: read and count");
+}
+
+// From exec to the daemon's "ready" line.
+void DaemonStartup(benchmark::State& state) {
+  const Catalogue* catalogue = UseCatalogue(kMaxQueues);
+  if (catalogue == nullptr) {
+    state.SkipWithError("cannot write the catalogue");
+    return;
+  }
+  for (auto _ : state) {
+    const auto start = Clock::now();
+    Child daemon({ZORVNOTIFYD_PATH, "--socket", kSocket});
+    const std::string ready = daemon.WaitFor("ready:", std::chrono::seconds(60));
+    state.SetIterationTime(std::chrono::duration<double>(Clock::now() - start).count());
+    if (ready.find("watching " + std::to_string(catalogue->directories) + " directories") ==
+        std::string::npos) {
+      state.SkipWithError(("the daemon did not start as expected: " + daemon.Output()).c_str());
+      return;
+    }
+  }
+  state.SetLabel(Thousands(kMaxQueues) + " queues of 8 configurations, " +
+                 Thousands(static_cast<long>(catalogue->directories)) + " directories");
+}
+
+// From exec to the bare reader's "ready" line: every watch added.
+void BareStartup(benchmark::State& state) {
+  const Catalogue* catalogue = UseCatalogue(kMaxQueues);
+  if (catalogue == nullptr) {
+    state.SkipWithError("cannot write the roots file");
+    return;
+  }
+  for (auto _ : state) {
+    const auto start = Clock::now();
+    Child bare({BARE_READER_PATH, kRootsFile});
+    const std::string ready = bare.WaitFor("ready ", std::chrono::seconds(60));
+    state.SetIterationTime(std::chrono::duration<double>(Clock::now() - start).count());
+    if (ready != "ready " + std::to_string(catalogue->directories) + "\n") {
+      state.SkipWithError(("the bare reader did not start as expected: " + bare.Output()).c_str());
+      return;
+    }
+  }
+  state.SetLabel("bare inotify reader process: walk and inotify_add_watch, the same directories");
+}
+
+double Max(const std::vector<double>& values) {
+  return values.empty() ? 0 : *std::max_element(values.begin(), values.end());
 }
 
 }  // namespace
@@ -185,23 +685,34 @@ int main(int argc, char** argv) {
   }
   benchmark::Initialize(&argc, argv);
   if (benchmark::ReportUnrecognizedArguments(argc, argv)) return 1;
-  if (!MakeCatalogue()) {
-    std::fprintf(stderr, "daemon_bench: cannot write the catalogue\n");
+  PlaceThreads();
+  // A descriptor per client, here and in the daemon.
+  struct rlimit files;
+  if (getrlimit(RLIMIT_NOFILE, &files) == 0 && files.rlim_cur < files.rlim_max) {
+    files.rlim_cur = files.rlim_max;
+    setrlimit(RLIMIT_NOFILE, &files);
+  }
+  if (!MakeTrees()) {
+    std::fprintf(stderr, "daemon_bench: cannot make the trees\n");
     return 1;
   }
-  Daemon daemon;
-  if (!daemon.WaitReady()) {
-    std::fprintf(stderr, "daemon_bench: the daemon did not start\n");
-    return 1;
+  for (int queues : {10, 100, 1000}) {
+    const std::string name = "zorvnotifyd/burst, " + Thousands(queues) + " queues";
+    for (const char* side : {"lib/", "base/"}) {
+      benchmark::RegisterBenchmark((side + name).c_str(), side[0] == 'l' ? DaemonBurst : BareBurst,
+                                   queues)
+          ->Iterations(1)
+          ->ComputeStatistics("max", Max);
+    }
   }
-  g_daemon = &daemon;
-  const std::string name = "zorvnotifyd/" + std::to_string(kBatch) + " events";
-  benchmark::RegisterBenchmark(("lib/" + name).c_str(), DaemonHandles)
+  benchmark::RegisterBenchmark("lib/zorvnotifyd/start-up, exec to ready", DaemonStartup)
+      ->Iterations(1)
       ->UseManualTime()
-      ->Unit(benchmark::kMicrosecond);
-  benchmark::RegisterBenchmark(("base/" + name).c_str(), BareInotify)
+      ->Unit(benchmark::kMillisecond);
+  benchmark::RegisterBenchmark("base/zorvnotifyd/start-up, exec to ready", BareStartup)
+      ->Iterations(1)
       ->UseManualTime()
-      ->Unit(benchmark::kMicrosecond);
+      ->Unit(benchmark::kMillisecond);
   benchmark::RunSpecifiedBenchmarks();
   benchmark::Shutdown();
   return 0;
