@@ -37,9 +37,9 @@ UniqueFd OpenBelow(const std::string& root, const std::string& path) {
 
 std::vector<DirEntry> ListDir(int dir) {
   std::vector<DirEntry> entries;
-  // A descriptor of its own: fdopendir takes it over, and reading moves
-  // the position of the open file description.
-  const int own = openat(dir, ".", kDirFlags);
+  // A descriptor of its own, which fdopendir takes over; it shares the
+  // read position with |dir|, which is only ever used for openat.
+  const int own = fcntl(dir, F_DUPFD_CLOEXEC, 0);
   if (own < 0) return entries;
   std::unique_ptr<DIR, int (*)(DIR*)> handle(fdopendir(own), closedir);
   if (!handle) {

@@ -31,8 +31,9 @@ struct DirEntry {
 };
 
 // The entries of the open directory |dir| but "." and "..", in the order
-// the file system gives them.  Reads through a descriptor of its own, so
-// |dir| is left as it was.  Empty when it cannot be read.
+// the file system gives them.  Reads from |dir|'s position (a directory
+// just opened: all of it) through a duplicate of it, leaving it open.
+// Empty when it cannot be read.
 std::vector<DirEntry> ListDir(int dir);
 
 }  // namespace zorvnotifyd

@@ -2,6 +2,7 @@
 
 #include "json_writer.h"
 
+#include <charconv>
 #include <cstdio>
 
 namespace zorvnotifyd {
@@ -56,11 +57,11 @@ void AppendJsonField(std::string* out, const char* key, std::string_view text) {
 
 void AppendJsonNumber(std::string* out, const char* key, uint64_t value) {
   char digits[24];
-  snprintf(digits, sizeof(digits), "%llu", static_cast<unsigned long long>(value));
+  const char* const end = std::to_chars(digits, digits + sizeof(digits), value).ptr;
   out->push_back('"');
   out->append(key);
   out->append("\":");
-  out->append(digits);
+  out->append(digits, static_cast<size_t>(end - digits));
 }
 
 }  // namespace zorvnotifyd

@@ -6,6 +6,7 @@
 #include <grp.h>
 #include <pwd.h>
 #include <string.h>
+#include <sys/epoll.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
@@ -49,6 +50,9 @@ struct Server::Client {
   bool closing = false;   // let go once the output is written
   bool behind = false;    // records wait in the logs: Fill delivers them in order
   bool sent_all = false;  // the client shut its sending side
+  uint32_t interest = 0;  // what epoll waits for on it
+  bool dirty = false;     // in dirty_: Deliver looks at it
+  std::list<Client>::iterator self;
 };
 
 Server::Server(ServerOptions options, QueueLogs& logs, std::string run_id,
@@ -59,7 +63,7 @@ Server::Server(ServerOptions options, QueueLogs& logs, std::string run_id,
       status_(std::move(status)) {}
 
 Server::~Server() {
-  while (!clients_.empty()) Drop(clients_.begin());
+  while (!clients_.empty()) Drop(clients_.front());
   struct stat st;
   if (listener_.get() >= 0 && lstat(options_.socket_path.c_str(), &st) == 0 &&
       S_ISSOCK(st.st_mode)) {
@@ -105,35 +109,58 @@ bool Server::Listen() {
            strerror(bound ? errno : error));
     return false;
   }
+  UniqueFd epoll(epoll_create1(EPOLL_CLOEXEC));
+  struct epoll_event event = {};
+  event.events = EPOLLIN;
+  event.data.ptr = nullptr;  // the listener
+  if (epoll.get() < 0 || epoll_ctl(epoll.get(), EPOLL_CTL_ADD, fd.get(), &event) != 0) {
+    syslog(LOG_ERR, "cannot wait for clients: %s", strerror(errno));
+    return false;
+  }
   listener_ = std::move(fd);
+  epoll_ = std::move(epoll);
   return true;
 }
 
-void Server::AddPollFds(std::vector<struct pollfd>* fds) const {
-  fds->push_back({listener_.get(), POLLIN, 0});
-  for (const Client& client : clients_) {
-    // Output waits, or records do: either goes as the socket takes it.
-    const short output = client.sent < client.out.size() || client.behind ? POLLOUT : 0;
-    const short input = Room(client) && !client.sent_all ? POLLIN : 0;
-    fds->push_back({client.fd.get(), short(output | input), 0});
-    continue;
-  }
+void Server::Watch(Client& client) {
+  // Input while the client has room for replies and may still send; output
+  // while some waits, or records do (either goes as the socket takes it).
+  uint32_t interest = 0;
+  if (Room(client) && !client.sent_all) interest |= EPOLLIN;
+  if (client.sent < client.out.size() || client.behind) interest |= EPOLLOUT;
+  if (interest == client.interest) return;
+  struct epoll_event event = {};
+  event.events = interest;
+  event.data.ptr = &client;
+  epoll_ctl(epoll_.get(), EPOLL_CTL_MOD, client.fd.get(), &event);
+  client.interest = interest;
 }
 
-void Server::HandlePoll(const std::vector<struct pollfd>& fds, size_t first) {
-  auto it = clients_.begin();
-  for (size_t i = first + 1; i < fds.size() && it != clients_.end(); ++i) {
-    const auto client = it++;
-    const short events = fds[i].revents;
-    if (events & POLLIN) Read(*client);
+void Server::Touch(Client& client) {
+  if (client.dirty) return;
+  client.dirty = true;
+  dirty_.push_back(&client);
+}
+
+void Server::Handle() {
+  struct epoll_event events[64];
+  const int n = epoll_wait(epoll_.get(), events, 64, 0);
+  for (int i = 0; i < n; ++i) {
+    if (events[i].data.ptr == nullptr) {
+      Accept();
+      continue;
+    }
+    Client& client = *static_cast<Client*>(events[i].data.ptr);
+    if (events[i].events & EPOLLIN) Read(client);
     // Gone for good (closed, both ways shut): forgotten at once.  A client
     // that only shut its sending side still gets its replies and records.
-    if ((events & (POLLERR | POLLNVAL | POLLHUP)) || client->fd.get() < 0 ||
-        ((events & POLLOUT) && !Flush(*client))) {
+    if ((events[i].events & (EPOLLERR | EPOLLHUP)) || client.fd.get() < 0 ||
+        ((events[i].events & EPOLLOUT) && !Flush(client))) {
       Drop(client);
+      continue;
     }
+    Watch(client);
   }
-  if (fds[first].revents & POLLIN) Accept();
 }
 
 void Server::Accept() {
@@ -150,8 +177,14 @@ void Server::Accept() {
       continue;
     }
     clients_.emplace_back();
-    clients_.back().fd = std::move(fd);
-    clients_.back().who = who;
+    Client& client = clients_.back();
+    client.fd = std::move(fd);
+    client.who = who;
+    client.self = std::prev(clients_.end());
+    struct epoll_event event = {};
+    event.events = client.interest = EPOLLIN;
+    event.data.ptr = &client;
+    if (epoll_ctl(epoll_.get(), EPOLL_CTL_ADD, client.fd.get(), &event) != 0) Drop(client);
   }
 }
 
@@ -196,6 +229,7 @@ void Server::Read(Client& client) {
   if (n == 0) client.sent_all = true;  // its requests are all in
   if (n > 0) client.in.append(buffer, static_cast<size_t>(n));
   Answer(client);
+  Touch(client);
 }
 
 void Server::Answer(Client& client) {
@@ -310,6 +344,9 @@ void Server::Subscribe(Client& client, const Subscription& subscription, bool ha
 
 void Server::FollowNew(const std::vector<QueueLog*>& created) {
   for (Client& client : clients_) {
+    // A reload may have added notices to the logs it follows.
+    client.behind = true;
+    Touch(client);
     for (QueueLog* log : created) {
       for (const Subscription& subscription : client.subscriptions) {
         if (log->name() != subscription.name ||
@@ -369,9 +406,11 @@ void Server::Recorded(QueueLog* log) {
     }
     if (next != log->last_seq() || client.out.size() - client.sent >= options_.client_buffer) {
       client.behind = true;
+      Touch(client);
       continue;
     }
     client.out += log->at(next++).line;
+    Touch(client);
     if (client.out.size() - client.sent >= std::min(kWriteAt, options_.client_buffer) &&
         !Write(client)) {
       client.closing = true;
@@ -418,24 +457,31 @@ bool Server::Flush(Client& client) {
 }
 
 void Server::Deliver() {
-  for (auto it = clients_.begin(); it != clients_.end();) {
-    const auto client = it++;
-    if (!Flush(*client)) Drop(client);
+  std::vector<Client*> dirty;
+  dirty.swap(dirty_);
+  for (Client* client : dirty) {
+    client->dirty = false;
+    if (!Flush(*client)) {
+      Drop(*client);
+      continue;
+    }
+    Watch(*client);
   }
 }
 
-void Server::Drop(std::list<Client>::iterator client) {
-  for (auto& [log, next] : client->next) {
+void Server::Drop(Client& client) {
+  for (auto& [log, next] : client.next) {
     const auto range = followers_.equal_range(log);
     for (auto it = range.first; it != range.second; ++it) {
-      if (it->second == &*client) {
+      if (it->second == &client) {
         followers_.erase(it);
         break;
       }
     }
     logs_.Unfollow(log);
   }
-  clients_.erase(client);
+  if (client.dirty) dirty_.erase(std::find(dirty_.begin(), dirty_.end(), &client));
+  clients_.erase(client.self);  // closing the descriptor takes it out of epoll
 }
 
 }  // namespace zorvnotifyd

@@ -5,7 +5,6 @@
 #ifndef ZORVNOTIFYD_DAEMON_SERVER_H_
 #define ZORVNOTIFYD_DAEMON_SERVER_H_
 
-#include <poll.h>
 #include <sys/types.h>
 
 #include <cstdint>
@@ -42,12 +41,11 @@ class Server {
   // that failed (logged).
   bool Listen();
 
-  // Appends the descriptors to poll to |fds|: the socket, then each client
-  // (for input, and for output while it has some waiting).
-  void AddPollFds(std::vector<struct pollfd>* fds) const;
-  // Handles what poll found on the descriptors AddPollFds appended from
-  // position |first| of |fds|: new connections, requests, hang-ups.
-  void HandlePoll(const std::vector<struct pollfd>& fds, size_t first);
+  // The descriptor to poll (for input) in the event loop.
+  int fd() const { return epoll_.get(); }
+  // Handles what is ready: new connections, requests, sockets that take
+  // output again, hang-ups.
+  void Handle();
 
   // After a catalogue load: clients whose subscriptions name a queue that
   // is new (|created|) follow it from its first record.
@@ -93,14 +91,20 @@ class Server {
   bool Flush(Client& client);
   // |client| follows |log| from record |next| on.
   void Follow(Client& client, QueueLog* log, uint64_t next);
-  void Drop(std::list<Client>::iterator client);
+  void Drop(Client& client);
+  // Waits for what |client| needs now: input, output or both.
+  void Watch(Client& client);
+  // Makes Deliver look at |client|.
+  void Touch(Client& client);
 
   ServerOptions options_;
   QueueLogs& logs_;
   std::string run_id_;
   std::function<std::string()> status_;
   UniqueFd listener_;
+  UniqueFd epoll_;
   std::list<Client> clients_;
+  std::vector<Client*> dirty_;  // clients with output or records to move
   std::multimap<QueueLog*, Client*> followers_;
 };
 

@@ -150,14 +150,14 @@ int Serve(const Options& options) {
              reporter.size());
   const int64_t retry_ms = std::max<int64_t>(1, int64_t(options.retry_seconds * 1000));
   int64_t next_tick = NowMs() + retry_ms;
-  std::vector<struct pollfd> fds;
+  struct pollfd fds[] = {{signals.get(), POLLIN, 0},
+                         {tree.fd(), POLLIN, 0},
+                         {catalogue_watch.fd(), POLLIN, 0},
+                         {server.fd(), POLLIN, 0}};
   for (;;) {
-    fds.assign(
-        {{signals.get(), POLLIN, 0}, {tree.fd(), POLLIN, 0}, {catalogue_watch.fd(), POLLIN, 0}});
-    server.AddPollFds(&fds);
     // Trees that went away, were replaced or did not fit under the watch
     // limit are looked at again on a fixed period, whatever the load.
-    const int ready = poll(fds.data(), fds.size(), int(std::max<int64_t>(0, next_tick - NowMs())));
+    const int ready = poll(fds, 4, int(std::max<int64_t>(0, next_tick - NowMs())));
     if (ready < 0 && errno != EINTR) {
       syslog(LOG_ERR, "poll failed: %s", strerror(errno));
       return 1;
@@ -180,7 +180,7 @@ int Serve(const Options& options) {
       sd_notifyf(0, "READY=1\nSTATUS=watching %zu directories for %zu queues", tree.size(),
                  reporter.size());
     }
-    if (ready > 0) server.HandlePoll(fds, 3);
+    if (ready > 0 && (fds[3].revents & POLLIN)) server.Handle();
     if (NowMs() >= next_tick) {
       tree.Tick(reporter);
       next_tick = NowMs() + retry_ms;
