@@ -1,6 +1,11 @@
 // Queue files: what a save writes and a load appends, the files a load
 // refuses, the file mode, and the temporary files of the atomic write.
 
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cstdio>
 #include <filesystem>
 #include <fstream>
 #include <sstream>
@@ -9,8 +14,22 @@
 #include <gtest/gtest.h>
 
 #include "monitor_queue.h"
+#include "platform/platform.h"
+#include "support/run_as.h"
 #include "support/sandbox.h"
 #include "support/syslog_capture.h"
+
+static std::string g_link_to;
+
+// The library's rename lands here, as its syslog does.  Once |g_link_to| is
+// set, the next rename is followed by a link to it put in place of the
+// renamed file, as another user could do in a directory open to them.
+extern "C" int rename(const char* from, const char* to) noexcept {
+  const int result = renameat(AT_FDCWD, from, AT_FDCWD, to);
+  if (result == 0 && !g_link_to.empty() && unlink(to) == 0) symlink(g_link_to.c_str(), to);
+  g_link_to.clear();
+  return result;
+}
 
 namespace ZORV::ZORVNOTIFYD {
 
@@ -72,6 +91,41 @@ TEST(QueueFileTest, LoadAppendsWhatAFileHoldsAndSaveWritesItBack) {
   EXPECT_THAT(zorv_test::DumpLogs(),  // the only line of the whole test
               testing::MatchesRegex("3 monitor_queue:[0-9]+ Failed to save json\n"));
   EXPECT_EQ(zorv_test::CapturedLogs().at(0).format, "%s:%d Failed to save json");
+
+  std::ofstream(kDir + "/other") << "x";
+  fs::permissions(kDir + "/other", fs::perms(0644));
+  g_link_to = kDir + "/other";  // swapped in right after the rename
+  EXPECT_TRUE(MonitorQueue::SaveToFile(saved, kFile));
+  EXPECT_EQ(fs::status(kDir + "/other").permissions(), fs::perms(0644));  // not followed
+}
+
+TEST(QueueFileTest, LoadRefusesAtOnceFilesNotRegularOrTooLarge) {
+  ZORV_REQUIRE_SANDBOX();
+  zorv_test::ResetStore();
+  const std::string dir = MonitorQueue::GetConfDir(MONITOR_QUEUE_TYPE_ETC_DIR);
+  ASSERT_EQ(mkfifo((dir + "/fifo").c_str(), 0600), 0);
+  fs::create_symlink("/dev/zero", dir + "/zero");
+  const zorv_test::ChildResult child = zorv_test::RunAs({0, 0, 0, 0, 0, 0}, [&dir] {
+    alarm(3);  // a load that blocks or reads without end kills the child
+    std::vector<MonitorQueue> queues;
+    return MonitorQueue::LoadFromFile(queues, dir + "/fifo") +
+           2 * MonitorQueue::LoadFromFile(queues, dir + "/zero") +
+           4 * MonitorQueue::Upsert(MonitorQueue(Json::Value()), "fifo",
+                                    MONITOR_QUEUE_TYPE_ETC_DIR);
+  });
+  ASSERT_TRUE(child.exited) << child.error;
+  EXPECT_EQ(child.result, 0);
+  ASSERT_EQ(child.logs.size(), 1u);
+  EXPECT_THAT(child.logs[0].text, testing::EndsWith(" LoadFromFile failed, path=" + dir + "/fifo"));
+  EXPECT_TRUE(fs::is_fifo(dir + "/fifo"));
+
+  // A file of the largest size loads; one byte more and it is refused.
+  std::string text = "[" + std::string(platform::kMaxJsonFileSize - 2, ' ') + "]";
+  std::vector<MonitorQueue> queues;
+  std::ofstream(kFile) << text;
+  EXPECT_TRUE(MonitorQueue::LoadFromFile(queues, kFile));
+  std::ofstream(kFile) << text << ' ';
+  EXPECT_FALSE(MonitorQueue::LoadFromFile(queues, kFile));
 }
 
 }  // namespace ZORV::ZORVNOTIFYD

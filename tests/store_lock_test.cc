@@ -3,7 +3,9 @@
 
 #include <fcntl.h>
 #include <signal.h>
+#include <sys/file.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -16,13 +18,29 @@
 #include "monitor_queue.h"
 #include "support/sandbox.h"
 
-static int g_draws = 0, g_release_at = 0;
+static int g_draws = 0, g_release_at = 0, g_other = -1;
 static pid_t g_holder = -1;
+static bool g_replace = false;
 
-// Ends the holder process, which releases the lock with its descriptor.
+// Ends the holder process, which releases the lock with its descriptor, and
+// closes |g_other|, which releases the lock it holds.
 static void EndHolder() {
   if (g_holder > 0 && kill(g_holder, SIGKILL) == 0) waitpid(g_holder, nullptr, 0);
   g_holder = -1;
+  if (g_other >= 0) close(g_other);
+  g_other = -1;
+}
+
+// The library's flock lands here as well.  Once |g_replace| is set, the lock
+// file is replaced before the next flock, and the new file is locked through
+// |g_other|, as by a writer that came after the replacement.
+extern "C" int flock(int fd, int operation) noexcept {
+  if (g_replace && unlink("/tmp/zorvnotifyd_monitor_q.lock") == 0) {
+    g_other = open("/tmp/zorvnotifyd_monitor_q.lock", O_RDWR | O_CREAT | O_CLOEXEC, 0644);
+    syscall(SYS_flock, g_other, LOCK_EX | LOCK_NB);
+  }
+  g_replace = false;
+  return static_cast<int>(syscall(SYS_flock, fd, operation));
 }
 
 // The library's rand lands here, as its syslog does (the executable comes
@@ -95,6 +113,25 @@ TEST(StoreLockTest, LockHeldPastTheRetriesFailsAndOneReleasedDuringThemIsTaken) 
     EXPECT_EQ(LockFileDescriptors(), 1);  // the failed attempts closed theirs
     Unlock(fd);
     EXPECT_EQ(LockFileDescriptors(), 0);
+    EndHolder();
+  }
+  g_release_at = 0;
+}
+
+TEST(StoreLockTest, LockOnAFileReplacedSinceItsOpenIsNotTaken) {
+  ZORV_REQUIRE_SANDBOX();
+  zorv_test::ResetStore();
+  for (const int release_at : {0, 2}) {  // the new file's holder never ends, or at draw 2
+    g_draws = 0;
+    g_release_at = release_at;
+    g_replace = true;
+    int fd = -1;
+    EXPECT_EQ(Lock(fd, kLockFile), release_at != 0);
+    EXPECT_EQ(g_draws, release_at ? release_at : 5);
+    struct stat held, named;  // the descriptor left is one of the file at the path
+    EXPECT_TRUE(fstat(fd, &held) == 0 && stat(kLockFile, &named) == 0 &&
+                held.st_ino == named.st_ino);
+    Unlock(fd);
     EndHolder();
   }
   g_release_at = 0;

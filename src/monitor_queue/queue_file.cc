@@ -9,8 +9,9 @@
 #include "monitor_queue.h"
 #include "monitor_queue/log.h"
 #include "monitor_queue/privileged_section.h"
-#include "syslog_percent_m.h"
 #include "platform/platform.h"
+#include "platform/scoped.h"
+#include "syslog_percent_m.h"
 
 namespace ZORV {
 namespace ZORVNOTIFYD {
@@ -26,11 +27,14 @@ bool MonitorQueue::SaveToFile(const std::vector<MonitorQueue>& queues, const std
   PrivilegedSection section(kSource, __LINE__);
   if (!RootCheck(kSource, __LINE__)) return false;
   for (const MonitorQueue& queue : queues) root.append(queue.ToJson());
-  if (!platform::JsonToFile(root, path)) {
+  platform::ScopedFd written;
+  if (!platform::JsonToFile(root, path, written)) {
     syslog(LOG_ERR, "%s:%d Failed to save json", kSource, __LINE__);
     return false;
   }
-  if (chmod(path.c_str(), kQueueFileMode) < 0) {
+  // The mode is set on the file just written, through its descriptor: a
+  // link put at |path| since the write is never followed.
+  if (fchmod(written.get(), kQueueFileMode) < 0) {
     ZORV_PERCENT_M_BEGIN
     syslog(LOG_ERR, "%s:%d chmod failed, path=%s, reason=%m", kSource, __LINE__, path.c_str());
     ZORV_PERCENT_M_END

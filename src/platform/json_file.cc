@@ -17,6 +17,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <exception>
 #include <memory>
 #include <string>
@@ -57,10 +58,11 @@ bool WriteAll(int fd, const std::string& text) {
   return true;
 }
 
-bool ReadAll(int fd, std::string& text) {
+// Reads |fd| to its end, or until |text| holds |limit| bytes.
+bool ReadAll(int fd, std::string& text, size_t limit) {
   char buffer[8192];
-  for (;;) {
-    const ssize_t n = read(fd, buffer, sizeof buffer);
+  while (text.size() < limit) {
+    const ssize_t n = read(fd, buffer, std::min(sizeof buffer, limit - text.size()));
     if (n == 0) return true;
     if (n < 0) {
       if (errno == EINTR) continue;
@@ -68,6 +70,7 @@ bool ReadAll(int fd, std::string& text) {
     }
     text.append(buffer, static_cast<size_t>(n));
   }
+  return true;
 }
 
 bool SyncDirectory(const std::string& dir) {
@@ -98,9 +101,21 @@ void RemoveAbandoned(const std::string& dir, const std::string& prefix) {
 }  // namespace
 
 bool JsonFromFile(Json::Value& value, const std::string& path) {
-  ScopedFd fd(open(path.c_str(), O_RDONLY | O_CLOEXEC));
+  // Non-blocking, so that opening a fifo never waits for a writer; the type
+  // and size are those of the file opened, not of whatever the path names
+  // by then.  Only a regular file is read, and never past one byte over the
+  // limit: a file that grows after the check is refused all the same.
+  ScopedFd fd(open(path.c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC));
+  struct stat st;
+  if (!fd.valid() || fstat(fd.get(), &st) != 0 || !S_ISREG(st.st_mode) ||
+      st.st_size > static_cast<off_t>(kMaxJsonFileSize)) {
+    return false;
+  }
   std::string text;
-  if (!fd.valid() || !ReadAll(fd.get(), text)) return false;
+  text.reserve(static_cast<size_t>(st.st_size));
+  if (!ReadAll(fd.get(), text, kMaxJsonFileSize + 1) || text.size() > kMaxJsonFileSize) {
+    return false;
+  }
   fd.Reset();
 
   Json::CharReaderBuilder builder;
@@ -121,7 +136,7 @@ bool JsonFromFile(Json::Value& value, const std::string& path) {
   return true;
 }
 
-bool JsonToFile(const Json::Value& value, const std::string& path) {
+bool JsonToFile(const Json::Value& value, const std::string& path, ScopedFd& written) {
   Json::StreamWriterBuilder builder;
   builder["indentation"] = "  ";
   // Strings go out byte for byte (only quotes, backslashes and control
@@ -150,6 +165,7 @@ bool JsonToFile(const Json::Value& value, const std::string& path) {
   }
   ok = SyncDirectory(dir);
   RemoveAbandoned(dir, prefix);
+  if (ok) written.Reset(fd.Release());
   return ok;
 }
 

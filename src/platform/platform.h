@@ -11,6 +11,8 @@
 
 #include <json/json.h>
 
+#include "platform/scoped.h"
+
 // Non-zero when a directory exists at |path|, 0 otherwise.
 int ZORBCFileCheckDir(const char* path);
 
@@ -63,9 +65,16 @@ void SetLastError(unsigned int code, const char* file, int line);
 #define ZORB_SET_ERROR(code) ::ZORV::ZORVNOTIFYD::platform::SetLastError((code), __FILE__, __LINE__)
 #endif
 
-// Replaces |value| with the JSON text of the file at |path|.  The whole file
-// must be one valid JSON value: an empty file or trailing garbage fails.
-// False when the file cannot be read or is not valid JSON.
+// The largest JSON file JsonFromFile reads, in bytes: 16 MiB, far more than
+// any catalogue needs, and a bound on the memory and time a load can take.
+constexpr size_t kMaxJsonFileSize = size_t{16} << 20;
+
+// Replaces |value| with the JSON text of the file at |path| (links are
+// followed).  The whole file must be one valid JSON value: an empty file or
+// trailing garbage fails.  False when the file cannot be read or is not
+// valid JSON, and also, without blocking or reading it, when it is not a
+// regular file (a fifo, a device, a directory) or holds more than
+// kMaxJsonFileSize bytes.
 bool JsonFromFile(Json::Value& value, const std::string& path);
 
 // Writes |value| as JSON text to |path| atomically and durably: a temporary
@@ -73,8 +82,11 @@ bool JsonFromFile(Json::Value& value, const std::string& path);
 // written, synced and renamed over |path|, and the directory is synced.
 // Readers see the old file or the new one, never a mix.  Temporary files
 // left by a writer that died are removed by the next completed write to the
-// same path.  False on failure, with the target untouched.
-bool JsonToFile(const Json::Value& value, const std::string& path);
+// same path.  On success |written| holds a descriptor of the file that was
+// renamed into place, so that the caller can act on that very file whatever
+// |path| names by then.  False on failure, with the target untouched and
+// |written| unchanged.
+bool JsonToFile(const Json::Value& value, const std::string& path, ScopedFd& written);
 
 }  // namespace platform
 }  // namespace ZORVNOTIFYD
