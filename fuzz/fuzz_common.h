@@ -9,6 +9,8 @@
 #include <string>
 #include <vector>
 
+#include <fuzzer/FuzzedDataProvider.h>
+
 #include <json/json.h>
 
 #include "monitor_queue.h"
@@ -54,6 +56,37 @@ inline bool Tame(const std::string& pattern) {
     }
   }
   return pluses <= 8;
+}
+
+// A path of up to |max_length| bytes, mostly "/", "a", "b" and ".", with
+// now and then any byte or a control byte (NUL included): the bytes the
+// boundary rules single out.
+inline std::string Path(FuzzedDataProvider& input, size_t max_length) {
+  std::string path = input.ConsumeRandomLengthString(max_length);
+  for (char& c : path) {
+    switch (static_cast<unsigned char>(c) % 8) {
+      case 0:
+      case 1:
+      case 2:
+        c = '/';
+        break;
+      case 3:
+        c = 'a';
+        break;
+      case 4:
+        c = 'b';
+        break;
+      case 5:
+        c = '.';
+        break;
+      case 6:
+        break;  // any byte
+      default:
+        c = static_cast<char>(static_cast<unsigned char>(c) >> 3);  // a control byte
+        break;
+    }
+  }
+  return path;
 }
 
 }  // namespace zorv_fuzz

@@ -22,7 +22,7 @@
 
 #include <fuzzer/FuzzedDataProvider.h>
 
-#include "monitor_queue.h"
+#include "fuzz_common.h"
 #include "monitor_queue_index.h"
 
 using ZORV::ZORVNOTIFYD::MonitorQueue;
@@ -33,33 +33,7 @@ namespace {
 
 // ---- Building the input. ----
 
-std::string Path(FuzzedDataProvider& input) {
-  std::string path = input.ConsumeRandomLengthString(16);
-  for (char& c : path) {
-    switch (static_cast<unsigned char>(c) % 8) {
-      case 0:
-      case 1:
-      case 2:
-        c = '/';
-        break;
-      case 3:
-        c = 'a';
-        break;
-      case 4:
-        c = 'b';
-        break;
-      case 5:
-        c = '.';
-        break;
-      case 6:
-        break;  // any byte
-      default:
-        c = static_cast<char>(static_cast<unsigned char>(c) >> 3);  // a control byte, NUL included
-        break;
-    }
-  }
-  return path;
-}
+std::string Path(FuzzedDataProvider& input) { return zorv_fuzz::Path(input, 16); }
 
 // Patterns bounded as in matching_fuzzer.cc (glibc's regcomp takes time
 // exponential in nested repetitions): up to twelve bytes without "{" or

@@ -95,33 +95,7 @@ void RefShares(const MonitorQueue& queue, std::set<std::string>& shares) {
 
 // ---- Building the input. ----
 
-std::string Path(FuzzedDataProvider& input) {
-  std::string path = input.ConsumeRandomLengthString(24);
-  for (char& c : path) {
-    switch (static_cast<unsigned char>(c) % 8) {
-      case 0:
-      case 1:
-      case 2:
-        c = '/';
-        break;
-      case 3:
-        c = 'a';
-        break;
-      case 4:
-        c = 'b';
-        break;
-      case 5:
-        c = '.';
-        break;
-      case 6:
-        break;  // any byte
-      default:
-        c = static_cast<char>(static_cast<unsigned char>(c) >> 3);  // a control byte
-        break;
-    }
-  }
-  return path;
-}
+std::string Path(FuzzedDataProvider& input) { return zorv_fuzz::Path(input, 24); }
 
 // Patterns of up to twelve bytes from an alphabet without "{" and "\\", with at most two
 // repetition operators and one group: glibc's regcomp takes time exponential in nested
