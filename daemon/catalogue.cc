@@ -16,6 +16,7 @@
 #include <cstdio>
 #include <memory>
 
+#include "queue_files.h"
 #include "text.h"
 #include "watch_path.h"
 #include "watch_tree.h"
@@ -28,23 +29,13 @@ using zorvcommon::Quoted;
 
 namespace {
 
-// The names of the regular files (links followed) of |dir| whose name does
-// not begin with ".", sorted: the files the library's catalogue reads.
+// The queue files of |dir| in name order.  A missing directory holds none;
+// CatalogueWatch says that it is missing.
 std::vector<std::string> QueueFiles(const std::string& dir) {
   std::vector<std::string> names;
-  std::unique_ptr<DIR, int (*)(DIR*)> handle(opendir(dir.c_str()), closedir);
-  if (!handle) {
+  if (!zorvcommon::QueueFileNames(dir, &names) && errno != ENOENT) {
     syslog(LOG_ERR, "cannot read %s: %s", dir.c_str(), strerror(errno));
-    return names;
   }
-  while (const struct dirent* entry = readdir(handle.get())) {
-    struct stat st;
-    if (entry->d_name[0] != '.' && stat((dir + "/" + entry->d_name).c_str(), &st) == 0 &&
-        S_ISREG(st.st_mode)) {
-      names.emplace_back(entry->d_name);
-    }
-  }
-  std::sort(names.begin(), names.end());
   return names;
 }
 
@@ -87,12 +78,22 @@ Catalogue CatalogueLoader::Load() {
   Catalogue catalogue;
   std::map<FileKey, std::vector<MonitorQueue>> good;
   std::map<FileKey, std::string> failing;
+  std::set<FileKey> backups;
   for (QueueType type : zorvcommon::kAllQueueTypes) {
     const std::string dir = MonitorQueue::GetConfDir(type);
     for (const std::string& file : QueueFiles(dir)) {
       const FileKey key(type, file);
       const std::string label =
           Printable(std::string(zorvcommon::QueueTypeName(type)) + "/" + file);
+      if (zorvcommon::LooksLikeBackupCopy(file)) {
+        if (backups_.count(key) == 0) {
+          syslog(LOG_WARNING,
+                 "queue file %s looks like a backup copy, and is loaded like any queue file: "
+                 "remove it or move it out of the directory",
+                 label.c_str());
+        }
+        backups.insert(key);
+      }
       std::vector<MonitorQueue> queues;
       if (MonitorQueue::List(queues, file, type)) {
         good[key] = queues;
@@ -122,6 +123,7 @@ Catalogue CatalogueLoader::Load() {
   }
   last_good_ = std::move(good);
   failing_ = std::move(failing);
+  backups_ = std::move(backups);
   return catalogue;
 }
 
@@ -164,17 +166,29 @@ bool CatalogueWatch::Open() {
 }
 
 bool CatalogueWatch::WatchDirs() {
+  std::set<std::string> missing;
   for (QueueType type : zorvcommon::kAllQueueTypes) {
     const std::string dir = MonitorQueue::GetConfDir(type);
     // IN_CREATE as well: a queue file added as a symbolic link gives no other event.
     const uint32_t mask =
         IN_CREATE | IN_CLOSE_WRITE | IN_MOVED_TO | IN_DELETE | IN_MOVED_FROM | IN_ONLYDIR;
-    if (inotify_add_watch(inotify_.get(), dir.c_str(), mask) < 0) {
-      syslog(LOG_ERR, "cannot watch the configuration directory %s: %s", dir.c_str(),
-             strerror(errno));
-      return false;
+    if (inotify_add_watch(inotify_.get(), dir.c_str(), mask) >= 0) continue;
+    if (errno == ENOENT) {
+      // Missing and not creatable (a read-only /usr): an empty type.
+      if (missing_.count(dir) == 0) {
+        syslog(LOG_WARNING,
+               "the configuration directory %s is missing and could not be created; its queue "
+               "type counts as empty and it is not watched",
+               dir.c_str());
+      }
+      missing.insert(dir);
+      continue;
     }
+    syslog(LOG_ERR, "cannot watch the configuration directory %s: %s", dir.c_str(),
+           strerror(errno));
+    return false;
   }
+  missing_ = std::move(missing);
   return true;
 }
 

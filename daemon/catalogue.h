@@ -52,6 +52,7 @@ class CatalogueLoader {
   std::map<FileKey, std::vector<ZORV::ZORVNOTIFYD::MonitorQueue>> last_good_;
   std::map<FileKey, std::string> failing_;  // files that fail to load, and why
   std::set<std::string> skipped_;           // skipped configurations, as logged
+  std::set<FileKey> backups_;               // files named like backup copies, as logged
 };
 
 // A watch on the three configuration directories.
@@ -59,7 +60,9 @@ class CatalogueWatch {
  public:
   // Opens an inotify instance of its own and watches the directories
   // (created first when missing) for files written, renamed in or out, or
-  // removed.  False when that failed (logged).
+  // removed.  A directory that is missing and cannot be created (a
+  // read-only /usr) is logged once and left unwatched.  False when the
+  // instance or a watch on an existing directory failed (logged).
   bool Open();
   // The descriptor to poll.
   int fd() const { return inotify_.get(); }
@@ -70,11 +73,13 @@ class CatalogueWatch {
   bool ReadChanges();
 
  private:
-  // Watches the three configuration directories, creating missing ones.
-  // False when a watch could not be added (logged).
+  // Watches the three configuration directories, creating missing ones
+  // and skipping those that stay missing.  False when a watch on an
+  // existing directory could not be added (logged).
   bool WatchDirs();
 
   UniqueFd inotify_;
+  std::set<std::string> missing_;  // directories missing at the last WatchDirs, as logged
 };
 
 }  // namespace zorvnotifyd

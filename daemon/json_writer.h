@@ -11,7 +11,8 @@
 namespace zorvnotifyd {
 
 // Appends |text| to |out| as a JSON string, quotes included: '"', '\' and
-// control bytes escaped (\n, \t, ... or \u00XX), every other byte as it is.
+// control bytes escaped (\n, \t, ... or \u00XX), each byte that is not part
+// of valid UTF-8 as \udcXY, valid UTF-8 as it is (see json_bytes.h).
 void AppendJsonString(std::string* out, std::string_view text);
 
 // Appends "KEY": and |text| as a JSON string (KEY is written as it is).

@@ -609,4 +609,28 @@ TEST(DaemonTest, DeliversEachQueueItsEventsToItsSubscribers) {
   EXPECT_EQ(daemon.Stop(), 0);
 }
 
+// A read-only /usr holding only the etc configuration directory, as seen
+// by this process alone: the daemon serves the queues that exist and says
+// which directories it cannot have, and which file looks like a backup.
+TEST(DaemonTest, ServesWhatExistsOnAReadOnlyUsr) {
+  ZORV_REQUIRE_SANDBOX();
+  zorv_test::ResetStore();
+  ASSERT_EQ(std::system("rm -rf /tmp/ro && mkdir /tmp/ro"), 0);
+  Register("ro", "f", MONITOR_QUEUE_TYPE_ETC_DIR, "/tmp/ro", IN_CREATE);
+  ASSERT_TRUE(Put("/usr/zorv/etc/zorvnotifyd/f.bak", "[]"));
+  Daemon daemon({"--json"}, [] {
+    return unshare(CLONE_NEWNS) == 0 &&
+           mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == 0 &&
+           mount(nullptr, "/usr", nullptr, MS_REMOUNT | MS_BIND | MS_RDONLY, nullptr) == 0;
+  });
+  ASSERT_TRUE(daemon.Logged("the configuration directory /usr/zorv/share/zorvnotifyd is missing"));
+  ASSERT_TRUE(
+      daemon.Logged("queue file etc/f.bak looks like a backup copy, and is loaded like any "
+                    "queue file: remove it or move it out of the directory"));
+  ASSERT_TRUE(daemon.Logged("ready: watching 1 directories for 1 queues"));
+  Put("/tmp/ro/x", "x");
+  Expect(daemon, {"ro etc f /tmp/ro/x " + std::to_string(IN_CREATE)});
+  EXPECT_EQ(daemon.Stop(), 0);
+}
+
 }  // namespace

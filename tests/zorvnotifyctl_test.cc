@@ -5,9 +5,12 @@
 
 #include <fcntl.h>
 #include <poll.h>
+#include <sched.h>
 #include <signal.h>
 #include <stdlib.h>
+#include <sys/file.h>
 #include <sys/inotify.h>
+#include <sys/mount.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -15,6 +18,7 @@
 #include <cerrno>
 #include <fstream>
 #include <sstream>
+#include <thread>
 
 #include <gmock/gmock.h>
 #include <json/json.h>
@@ -87,11 +91,21 @@ TEST(ZorvnotifyctlTest, RefusalsExitStatusesAndJsonOutput) {
       {"upsert q", obj + R"("mask": 1, "ignore": ["("]}]})", 2, "not a valid extended regular"},
       {"upsert q", "[" + ok + "]", 2, "the queue must be a JSON object, not an array"},
       {"upsert q", ok + "{}", 2, "invalid JSON"},
+      {"upsert q", obj + R"("mask": 1 /* c */}]})", 2, "line 1: comments are not allowed"},
+      {"upsert q",
+       R"({"queue": "q", // c)"
+       "\n}",
+       2, "line 1: comments are not allowed"},
+      {"upsert q", std::string(5000, '['), 2, "invalid JSON: nested too deeply"},
+      {"upsert q", obj + R"("mask": 1, "ignore": ["a\u0000|b"]}]})", 2,
+       R"(ignore[0] "a\x00|b" holds a NUL)"},
       {"upsert ''", ok, 2, "the queue file name is empty"},
       {"list .", "", 2, R"(name "." names a directory)"},
       {"get a ..", "", 2, R"(name ".." names a directory)"},
       {"delete a a/b", "", 2, R"("a/b" contains "/")"},
       {"list .q", "", 2, R"(".q" begins with ".")"},
+      {"upsert " + std::string(244, 'f'), ok, 2,
+       "is 244 bytes long; a queue file name has at most 243"},
       // Paths the daemon could never match, each with the spelling to use.
       {"upsert q", WatchingPath(""), 2, R"(config[0].path "" cannot be watched: it is empty)"},
       {"upsert q", WatchingPath("rel/dir"), 2,
@@ -146,6 +160,85 @@ TEST(ZorvnotifyctlTest, RefusalsExitStatusesAndJsonOutput) {
       {"--json delete b e", "", 0, removed + "true}"},
       {"--json delete b e", "", 0, removed + "false}"},
   });
+
+  // Bytes that are not UTF-8 come out as \udcXY, which strict JSON readers
+  // accept, and go back in as the same bytes.
+  Json::Value raw;
+  raw["queue"] = "caf\xe9-q";
+  raw["config"][0]["path"] = "/d\xff";
+  raw["config"][0]["mask"] = 1;
+  ASSERT_TRUE(ZORV::ZORVNOTIFYD::MonitorQueue::Upsert(
+      ZORV::ZORVNOTIFYD::MonitorQueue(raw), "r", ZORV::ZORVNOTIFYD::MONITOR_QUEUE_TYPE_ETC_DIR));
+  EXPECT_EQ(RunTool("get --json $(printf 'caf\\351-q') r", "", &out, &err), 0) << err;
+  EXPECT_THAT(out, ::testing::HasSubstr(R"("caf\udce9-q")"));
+  EXPECT_EQ(system("python3 -c 'import json,sys; json.loads(sys.stdin.read())' </tmp/out"), 0);
+  EXPECT_EQ(RunTool("upsert r", out, &out, &err), 0) << err;
+  std::vector<ZORV::ZORVNOTIFYD::MonitorQueue> stored;
+  ASSERT_TRUE(ZORV::ZORVNOTIFYD::MonitorQueue::List(stored, "r",
+                                                    ZORV::ZORVNOTIFYD::MONITOR_QUEUE_TYPE_ETC_DIR));
+  ASSERT_EQ(stored.size(), 1u);
+  EXPECT_EQ(stored[0]._name, "caf\xe9-q");
+  ASSERT_EQ(stored[0]._configs.size(), 1u);
+  EXPECT_EQ(stored[0]._configs[0]._path, "/d\xff");
+}
+
+// Runs the tool with |args| and /tmp/in on standard input as real user 1000
+// with effective and saved user id 0, as when installed set-user-ID root;
+// returns its exit status (-1 when it did not exit) and sets |err|.
+int RunSetUserId(std::vector<std::string> args, std::string* err) {
+  args.insert(args.begin(), ZORVNOTIFYCTL_PATH);
+  const pid_t pid = fork();
+  if (pid == 0) {
+    const int in = open("/tmp/in", O_RDONLY);
+    const int out = open("/tmp/err", O_WRONLY | O_CREAT | O_TRUNC, 0644);
+    if (in < 0 || out < 0 || dup2(in, 0) < 0 || dup2(out, 1) < 0 || dup2(out, 2) < 0 ||
+        setresuid(1000, 0, 0) != 0) {
+      _exit(125);
+    }
+    std::vector<char*> argv;
+    for (std::string& arg : args) argv.push_back(&arg[0]);
+    argv.push_back(nullptr);
+    execv(argv[0], argv.data());
+    _exit(127);
+  }
+  int status = 0;
+  waitpid(pid, &status, 0);
+  std::ostringstream text;
+  text << std::ifstream("/tmp/err").rdbuf();
+  *err = text.str();
+  return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+}
+
+TEST(ZorvnotifyctlTest, RefusesSetUserIdAndReportsABusyStore) {
+  ZORV_REQUIRE_SANDBOX();
+  zorv_test::ResetStore();
+  const std::string queue = WatchingPath("/a");
+  std::ofstream("/tmp/in") << queue;
+  std::string out, err;
+  EXPECT_EQ(RunSetUserId({"upsert", "q"}, &err), 77);
+  EXPECT_THAT(err, ::testing::HasSubstr("must be run as root (real user id 1000); it is not "
+                                        "meant to be installed set-user-ID"));
+  EXPECT_NE(access("/usr/zorv", F_OK), 0) << "the set-user-ID tool reached the library";
+  EXPECT_EQ(RunSetUserId({"--version"}, &err), 0) << err;
+
+  // Another writer holds the store lock: no wait gives up at once and
+  // names it; a wait outlasting it stores.
+  int lock = open("/tmp/zorvnotifyd_monitor_q.lock", O_RDWR | O_CREAT | O_CLOEXEC, 0644);
+  ASSERT_EQ(flock(lock, LOCK_EX), 0);
+  EXPECT_EQ(RunTool("--wait 0 upsert q", queue, &out, &err), 75);
+  EXPECT_THAT(err, ::testing::HasSubstr("held by pid " + std::to_string(getpid()) + " (user root"));
+  std::thread release([lock] {
+    usleep(500000);
+    close(lock);
+  });
+  EXPECT_EQ(RunTool("--wait 2 upsert q", queue, &out, &err), 0) << err;
+  release.join();
+  // A stored change whose report cannot be written is still a success.
+  const int status = system("'" ZORVNOTIFYCTL_PATH "' delete q q </dev/null >/dev/full 2>/tmp/err");
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
+  std::ostringstream text;
+  text << std::ifstream("/tmp/err").rdbuf();
+  EXPECT_THAT(text.str(), ::testing::HasSubstr("the change is stored, but its report could not"));
 }
 
 // A program run in the background, its standard output and error on one
@@ -232,6 +325,7 @@ TEST(ZorvnotifyctlTest, WatchAndStatusAskTheDaemon) {
   std::ofstream("/tmp/wd/new").flush();
   EXPECT_EQ(watch.Line(), "backup [etc/nas] #1 IN_CREATE /tmp/wd/new");
   EXPECT_EQ(watch.Stop(SIGINT), 0);
+  std::ofstream("/tmp/wd/b\xff").flush();
 
   // Kept records come first with --since; the daemon's going away ends
   // the watch with status 1.
@@ -241,9 +335,63 @@ TEST(ZorvnotifyctlTest, WatchAndStatusAskTheDaemon) {
   const Json::Value event = Parse(json.Line());
   EXPECT_EQ(event["seq"], 1);
   EXPECT_EQ(event["path"], "/tmp/wd/new");
+  EXPECT_THAT(json.Line(), ::testing::HasSubstr(R"("path":"/tmp/wd/b\udcff")"));
   EXPECT_EQ(daemon.Stop(SIGTERM), 0);
   EXPECT_THAT(json.Line(), ::testing::HasSubstr("zorvnotifyd closed the connection"));
   EXPECT_EQ(json.Stop(0), 1);
+}
+
+// Runs the tool with |args| in a mount namespace of its own where /usr is
+// read-only; returns its exit status (-1 when it did not exit) and sets
+// |out| and |err|.
+int RunOnReadOnlyUsr(const std::string& args, std::string* out, std::string* err) {
+  const pid_t pid = fork();
+  if (pid == 0) {
+    if (unshare(CLONE_NEWNS) != 0 ||
+        mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0 ||
+        mount(nullptr, "/usr", nullptr, MS_REMOUNT | MS_BIND | MS_RDONLY, nullptr) != 0) {
+      _exit(125);
+    }
+    _exit(RunTool(args, "", out, err));
+  }
+  int status = 0;
+  waitpid(pid, &status, 0);
+  std::ostringstream out_text, err_text;
+  out_text << std::ifstream("/tmp/out").rdbuf();
+  err_text << std::ifstream("/tmp/err").rdbuf();
+  *out = out_text.str();
+  *err = err_text.str();
+  return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+}
+
+// Files created in an order other than their names' (tmpfs lists the
+// newest first), one named like a backup copy, and the other two
+// configuration directories missing on a read-only /usr.
+TEST(ZorvnotifyctlTest, ReadsFilesInNameOrderAndAReadOnlyUsrWithWarnings) {
+  ZORV_REQUIRE_SANDBOX();
+  zorv_test::ResetStore();
+  ASSERT_EQ(std::system("mkdir -p -m 0700 /usr/zorv/etc/zorvnotifyd"), 0);
+  const std::vector<std::string> names = {"a", "m", "nas.bak", "z"};
+  for (const char* file : {"m", "z", "a", "nas.bak"}) {
+    std::ofstream(std::string("/usr/zorv/etc/zorvnotifyd/") + file)
+        << R"([{"queue": ")" << file << R"(", "config": [{"path": "/s/t", "mask": 1}]}])";
+  }
+  std::string out, err;
+  for (const char* args : {"catalogue --json", "shares", "dirs /s", "match /s/t 1"}) {
+    EXPECT_EQ(RunOnReadOnlyUsr(args, &out, &err), 0) << args << err;
+    EXPECT_THAT(err, ::testing::HasSubstr(
+                         "warning: the configuration directory /usr/local/etc/zorvnotifyd is "
+                         "missing and could not be created; the local-etc type counts as empty"));
+    EXPECT_THAT(err, ::testing::HasSubstr(
+                         "warning: queue file etc/nas.bak looks like a backup copy, and is loaded "
+                         "like any queue file: remove it or move it out of the directory"));
+    if (std::string(args) == "catalogue --json") {
+      std::vector<std::string> listed;
+      for (const Json::Value& queue : Parse(out)) listed.push_back(queue["queue"].asString());
+      EXPECT_EQ(listed, names);
+    }
+  }
+  EXPECT_NE(access("/usr/zorv/share", F_OK), 0);
 }
 
 }  // namespace

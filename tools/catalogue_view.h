@@ -2,6 +2,7 @@
 #ifndef ZORVNOTIFYD_TOOLS_CATALOGUE_VIEW_H_
 #define ZORVNOTIFYD_TOOLS_CATALOGUE_VIEW_H_
 
+#include <string>
 #include <vector>
 
 #include "monitor_queue.h"
@@ -20,11 +21,17 @@ struct TypedQueue {
   ZORV::ZORVNOTIFYD::MonitorQueue queue;
 };
 
-// Replaces |queues| with every queue of every type, in catalogue order
-// (share, etc, local-etc; within a type as the library lists it).  The
-// library's LoadAll does not tell types apart, so this loads type by type.
-// False when a type could not be read (the library has logged why); then
-// |queues| is empty.
+// Replaces |queues| with every queue of every type: types in the order
+// share, etc, local-etc; within a type the files the library's catalogue
+// reads (regular, links followed, name not beginning with ".") in byte-wise
+// name order, as the daemon reads them; within a file the queues in file
+// order.  A file that fails to load contributes what the library appended
+// before failing, as in the library's LoadAllByType.  Warns on standard
+// error about a configuration directory that is missing (and could not be
+// created), which then counts as empty, and about each file whose name
+// looks like a backup copy, since the library loads it like any queue file.
+// False when a directory exists but cannot be read (said on standard
+// error); then |queues| is empty.
 bool LoadCatalogue(std::vector<TypedQueue>* queues);
 
 }  // namespace zorvnotifyctl

@@ -5,8 +5,8 @@
 namespace zorvnotifyctl {
 namespace {
 
-// Where the value of the option NAME ("--type", "--since" or "--socket")
-// goes, marking it as given; null for any other NAME.
+// Where the value of the option NAME ("--type", "--since", "--wait" or
+// "--socket") goes, marking it as given; null for any other NAME.
 std::string* ValueOf(const std::string& name, CommandLine* line) {
   if (name == "--type") {
     line->type_given = true;
@@ -15,6 +15,10 @@ std::string* ValueOf(const std::string& name, CommandLine* line) {
   if (name == "--since") {
     line->since_given = true;
     return &line->since;
+  }
+  if (name == "--wait") {
+    line->wait_given = true;
+    return &line->wait;
   }
   return name == "--socket" ? &line->socket : nullptr;
 }
@@ -51,6 +55,7 @@ std::string ParseCommandLine(int argc, const char* const* argv, CommandLine* lin
         return "option " + arg + " needs a value (" +
                (value == &line->type    ? "share, etc or local-etc"
                 : value == &line->since ? "N"
+                : value == &line->wait  ? "SECONDS"
                                         : "PATH") +
                ")";
       }

@@ -20,12 +20,14 @@ struct CommandLine {
   std::string type;               // the value of the last --type
   bool since_given = false;       // --since appeared
   std::string since;              // the value of the last --since
+  bool wait_given = false;        // --wait appeared
+  std::string wait;               // the value of the last --wait
   // --socket: the daemon's socket (the default unless given)
   std::string socket = "/run/zorvnotifyd/zorvnotifyd.sock";
 };
 
 // Parses argv[1] to argv[argc - 1] into |line|.  Options may stand before or
-// after the command; "--type", "--since" and "--socket" take their value as
+// after the command; "--type", "--since", "--wait" and "--socket" take their value as
 // the next argument or after "=".  "--" ends the options, and "-" alone is
 // a positional argument (the standard input).  Returns "" on success,
 // otherwise the usage error.

@@ -8,8 +8,10 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <chrono>
 #include <cstring>
 #include <fstream>
+#include <functional>
 #include <iostream>
 #include <memory>
 #include <set>
@@ -19,6 +21,8 @@
 #include "daemon_client.h"
 #include "event_names.h"
 #include "json_output.h"
+#include "library_log.h"
+#include "lock_holder.h"
 #include "masks.h"
 #include "monitor_queue.h"
 #include "monitor_queue_index.h"
@@ -31,6 +35,9 @@ namespace {
 
 using ZORV::ZORVNOTIFYD::MonitorQueue;
 using ZORV::ZORVNOTIFYD::MonitorQueueIndex;
+
+// Set once an upsert or delete has been stored.
+bool g_store_changed = false;
 
 // |text| in double quotes, control bytes escaped, for messages.
 std::string Quoted(const std::string& text) {
@@ -108,6 +115,49 @@ Json::Value WriteResult(const Invocation& invocation, const std::string& file,
   return result;
 }
 
+// Runs |store| (one Upsert or Delete of the library) until it succeeds,
+// fails for a reason other than the store lock held by another writer, or
+// |invocation.wait| seconds have passed.  Each call is a whole load, change
+// and save under the lock, so calling it again is safe.  Returns true when
+// stored; otherwise |status| is set: kExitBusy, with the lock's holder
+// named, when the lock stayed held (the library's own "Lock failed" lines
+// are then left out), else kExitRefused with |failure| (the library's
+// message precedes it).
+bool StoreWithRetry(const Invocation& invocation, const std::function<bool()>& store,
+                    const std::string& failure, int* status) {
+  using Clock = std::chrono::steady_clock;
+  const Clock::time_point deadline = Clock::now() + std::chrono::seconds(invocation.wait);
+  for (;;) {
+    ResetLibraryLog(true);
+    const bool stored = store();
+    const bool busy = !stored && LibraryReportedLockFailure();
+    const bool service_failed = LibraryReportedServiceFailure();
+    ResetLibraryLog(false);
+    if (stored) {
+      g_store_changed = true;
+      if (service_failed) {
+        Fail(kExitOk,
+             "the change is stored, but the service manager could not be asked to start or "
+             "stop zorvnotifyd (systemctl is missing or failed); run \"systemctl start "
+             "zorvnotifyd\" or \"systemctl stop zorvnotifyd\" as needed");
+      }
+      return true;
+    }
+    if (!busy) {
+      *status = Fail(kExitRefused, failure);
+      return false;
+    }
+    if (Clock::now() >= deadline) break;
+    usleep(100000);
+  }
+  const std::string holder = LockHolder(kStoreLockFile);
+  *status = Fail(kExitBusy, failure + ": the store lock " + kStoreLockFile + " was held by " +
+                                (holder.empty() ? "another writer" : holder) + " for " +
+                                std::to_string(invocation.wait) +
+                                " s (--wait); nothing was changed, try again");
+  return false;
+}
+
 // Reads the whole of |source| ("-" is standard input) into |text|.
 bool ReadSource(const std::string& source, std::string* text, std::string* error) {
   std::ostringstream content;
@@ -149,7 +199,7 @@ MonitorQueueIndex CatalogueIndex(const std::vector<TypedQueue>& queues) {
 // Loads the catalogue with types, or reports the failure (exit status 1).
 bool LoadCatalogueOrFail(std::vector<TypedQueue>* queues, int* status) {
   if (LoadCatalogue(queues)) return true;
-  *status = Fail(kExitRefused, "cannot read the catalogue (see the library's message above)");
+  *status = Fail(kExitRefused, "cannot read the catalogue (see the message above)");
   return false;
 }
 
@@ -293,6 +343,8 @@ std::string ReadableSubscription(const Json::Value& reply, const std::string& na
 
 }  // namespace
 
+bool StoreChanged() { return g_store_changed; }
+
 int Fail(int status, const std::string& message) {
   std::cerr << "zorvnotifyctl: " << message << std::endl;
   return status;
@@ -348,9 +400,12 @@ int RunUpsert(const Invocation& invocation) {
                                 problem);
   }
   const MonitorQueue queue(object);
-  if (!MonitorQueue::Upsert(queue, file, invocation.type)) {
-    return Fail(kExitRefused, "the library did not store queue " + Quoted(queue._name) + " in " +
-                                  FileLabel(invocation, file));
+  if (!StoreWithRetry(
+          invocation, [&] { return MonitorQueue::Upsert(queue, file, invocation.type); },
+          "the library did not store queue " + Quoted(queue._name) + " in " +
+              FileLabel(invocation, file),
+          &status)) {
+    return status;
   }
   const std::string path = MonitorQueue::GetConfDir(invocation.type) + "/" + file;
   if (invocation.json) {
@@ -374,9 +429,12 @@ int RunDelete(const Invocation& invocation) {
   if (MonitorQueue::List(before, file, invocation.type)) {
     for (const MonitorQueue& queue : before) present |= queue._name == name;
   }
-  if (!MonitorQueue::Delete(name, file, invocation.type)) {
-    return Fail(kExitRefused, "the library did not delete queue " + Quoted(name) + " from " +
-                                  FileLabel(invocation, file));
+  if (!StoreWithRetry(
+          invocation, [&] { return MonitorQueue::Delete(name, file, invocation.type); },
+          "the library did not delete queue " + Quoted(name) + " from " +
+              FileLabel(invocation, file),
+          &status)) {
+    return status;
   }
   const std::string path = MonitorQueue::GetConfDir(invocation.type) + "/" + file;
   if (invocation.json) {
@@ -480,10 +538,11 @@ int RunDirs(const Invocation& invocation) {
 }
 
 int RunShares(const Invocation& invocation) {
+  std::vector<TypedQueue> typed;
+  int status = kExitOk;
+  if (!LoadCatalogueOrFail(&typed, &status)) return status;
   std::vector<MonitorQueue> queues;
-  if (!MonitorQueue::LoadAll(queues)) {
-    return Fail(kExitRefused, "cannot read the catalogue (see the library's message above)");
-  }
+  for (const TypedQueue& entry : typed) queues.push_back(entry.queue);
   const std::set<std::string> shares = MonitorQueue::GetShareSet(queues);
   if (invocation.json) {
     Json::Value array(Json::arrayValue);

@@ -19,9 +19,11 @@ using zorvcommon::QueueTypeName;
 
 // Exit statuses of the tool.
 enum ExitStatus : int {
-  kExitOk = 0,       // done
-  kExitRefused = 1,  // the library or zorvnotifyd refused or failed, or is not running
-  kExitUsage = 2,    // bad command line or invalid input; nothing was changed
+  kExitOk = 0,        // done
+  kExitRefused = 1,   // the library or zorvnotifyd refused or failed, or is not running
+  kExitUsage = 2,     // bad command line or invalid input; nothing was changed
+  kExitBusy = 75,     // the store lock stayed held by another writer: try again (EX_TEMPFAIL)
+  kExitNotRoot = 77,  // not run by root, or run set-user-ID: nothing was read (EX_NOPERM)
 };
 
 // What a command runs with.  The caller has checked the number of
@@ -34,11 +36,16 @@ struct Invocation {
   bool since_given = false;  // --since appeared
   uint64_t since = 0;        // its sequence number
   std::string socket;        // the daemon's socket
+  unsigned wait = 10;        // --wait: seconds upsert and delete retry while the store is busy
 };
 
 // Writes "zorvnotifyctl: " and |message| as one line to standard error and
 // returns |status|.
 int Fail(int status, const std::string& message);
+
+// True once upsert or delete has stored its change (also when writing its
+// report fails afterwards).
+bool StoreChanged();
 
 // list FILE: the queues of one queue file.
 int RunList(const Invocation& invocation);

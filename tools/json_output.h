@@ -9,8 +9,10 @@
 namespace zorvnotifyctl {
 
 // Writes |value| to |out| as one JSON text, indented by two blanks, with a
-// final newline.  Non-ASCII text is written as \u escapes, so the output is
-// plain ASCII.
+// final newline.  Strings are written as zorvcommon::AppendJsonString does:
+// valid UTF-8 as it is, each byte that is not part of valid UTF-8 as
+// \udcXY, so that reading the output back (ParseQueueObject) gives the
+// same bytes.
 void WriteJson(std::ostream& out, const Json::Value& value);
 
 }  // namespace zorvnotifyctl

@@ -8,6 +8,7 @@
 #include <memory>
 #include <sstream>
 
+#include "json_bytes.h"
 #include "text.h"
 #include "watch_path.h"
 
@@ -72,6 +73,11 @@ std::string UnknownKeyProblem(const Json::Value& object, const std::string& wher
 }
 
 std::string PatternProblem(const std::string& pattern, const std::string& where) {
+  // regcomp reads a C string: a NUL would silently cut the pattern short.
+  if (pattern.find('\0') != std::string::npos) {
+    return where + " " + zorvcommon::Quoted(pattern) +
+           " holds a NUL, which would end the regular expression there";
+  }
   regex_t compiled;
   const int status = regcomp(&compiled, pattern.c_str(), REG_EXTENDED);
   if (status == 0) {
@@ -133,21 +139,55 @@ std::string ConfigProblem(const Json::Value& config, const std::string& where) {
   return std::string();
 }
 
+// Returns "" when |text| holds no comment, else the message for the first.
+// Outside strings, JSON never holds "/", so any "/" there begins a comment
+// (which the reader would skip, also in strict mode, between the values of
+// an object or array) or is a syntax error the reader reports.
+std::string CommentProblem(const std::string& text) {
+  bool in_string = false;
+  size_t line = 1;
+  for (size_t i = 0; i < text.size(); ++i) {
+    const char c = text[i];
+    if (c == '\n') ++line;
+    if (in_string) {
+      if (c == '\\') {
+        ++i;
+      } else if (c == '"') {
+        in_string = false;
+      }
+    } else if (c == '"') {
+      in_string = true;
+    } else if (c == '/' && i + 1 < text.size() && (text[i + 1] == '/' || text[i + 1] == '*')) {
+      return "invalid JSON: line " + std::to_string(line) + ": comments are not allowed";
+    }
+  }
+  return std::string();
+}
+
 }  // namespace
 
 std::string ParseQueueObject(const std::string& text, Json::Value* queue) {
   Json::CharReaderBuilder builder;
   Json::CharReaderBuilder::strictMode(&builder.settings_);
   const std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
+  std::string problem = CommentProblem(text);
+  if (!problem.empty()) return problem;
   Json::Value value;
   std::string errors;
-  if (!reader->parse(text.data(), text.data() + text.size(), &value, &errors)) {
-    return "invalid JSON: " + OneLine(errors);
+  try {
+    if (!reader->parse(text.data(), text.data() + text.size(), &value, &errors)) {
+      return "invalid JSON: " + OneLine(errors);
+    }
+  } catch (const Json::Exception& e) {
+    // The reader throws when values nest deeper than its stack limit.
+    return std::string("invalid JSON: nested too deeply (") + e.what() + ")";
   }
   if (!value.isObject()) return "the queue must be a JSON object, not " + TypeName(value);
+  // "\udcXY" stands for the byte XY that is not part of valid UTF-8, as the
+  // tool's and the daemon's JSON output write it.
+  zorvcommon::DecodeRawBytes(&value);
   static const char* const kKeys[] = {"queue", "config", nullptr};
-  std::string problem =
-      UnknownKeyProblem(value, "", kKeys, "a queue object has only \"queue\" and \"config\"");
+  problem = UnknownKeyProblem(value, "", kKeys, "a queue object has only \"queue\" and \"config\"");
   if (!problem.empty()) return problem;
   if (!value.isMember("queue")) return "missing key \"queue\" (the queue's name)";
   if (!value["queue"].isString()) {

@@ -4,10 +4,12 @@
 //
 // Exit status: 0 done (for watch: stopped by SIGINT or SIGTERM), 1 the
 // library or the daemon refused or failed, or the daemon is not running, 2
-// bad command line or invalid input (nothing was changed).  The library's
+// bad command line or invalid input (nothing was changed), 75 the store
+// lock stayed held by another writer (try again), 77 not run by root.  The library's
 // own log lines go to standard error as well as to syslog.
 
 #include <syslog.h>
+#include <unistd.h>
 
 #include <cerrno>
 #include <cstdlib>
@@ -32,6 +34,7 @@ enum Takes : unsigned {
   kTypeFilter = 2,  // --type: only queues of that type
   kSince = 4,       // --since
   kDaemon = 8,      // asks the daemon (the usage line shows --socket)
+  kWait = 16,       // --wait: changes the store
 };
 
 // One command: its arguments, the options it takes, what runs it, and its
@@ -55,7 +58,7 @@ constexpr CommandInfo kCommands[] = {
      "Shows the first queue named NAME (exactly, case included) of queue file FILE.\n"
      "Exit status 1 when the file holds no such queue.  With --json: the queue\n"
      "object, which upsert accepts back.\n"},
-    {"upsert", 1, 2, kFileType, RunUpsert, "FILE [SOURCE]",
+    {"upsert", 1, 2, kFileType | kWait, RunUpsert, "FILE [SOURCE]",
      "Stores one queue object, read from SOURCE (a file; standard input when SOURCE\n"
      "is absent or \"-\"), in queue file FILE: it replaces the first queue of the\n"
      "same name or is appended.  The library then asks for the service zorvnotifyd\n"
@@ -71,7 +74,7 @@ constexpr CommandInfo kCommands[] = {
      "Unknown keys, wrong types, missing keys, such paths and patterns that do not\n"
      "compile are refused with exit status 2, before anything is written; for a\n"
      "path the message says how to write it.\n"},
-    {"delete", 2, 2, kFileType, RunDelete, "NAME FILE",
+    {"delete", 2, 2, kFileType | kWait, RunDelete, "NAME FILE",
      "Removes the first queue named NAME from queue file FILE.  A name the file does\n"
      "not hold changes nothing and is not an error.  When no queue is left in the\n"
      "whole catalogue, the library asks for the service zorvnotifyd to be stopped.\n"},
@@ -139,6 +142,8 @@ const char kOverview[] =
     "                    for watch, only queues of that type\n"
     "      --json        write JSON instead of tables\n"
     "      --since N     watch: first the kept events after number N\n"
+    "      --wait SECONDS  upsert, delete: retry this long while another writer\n"
+    "                    holds the store lock (default 10; 0: no retry)\n"
     "      --socket PATH the daemon's socket, for watch and status\n"
     "                    (default /run/zorvnotifyd/zorvnotifyd.sock)\n"
     "  -v, --verbose     also show the library's detailed log lines\n"
@@ -146,9 +151,11 @@ const char kOverview[] =
     "      --version     show the version and exit\n"
     "\n"
     "FILE is a plain name inside the configuration directory of the type, not\n"
-    "beginning with \".\".  The store operations and the daemon's socket need root.\n"
+    "beginning with \".\".  The store operations and the daemon's socket need root;\n"
+    "the tool refuses to run set-user-ID.\n"
     "Exit status: 0 done, 1 the library or the daemon refused or failed, or the\n"
-    "daemon is not running, 2 bad usage or input.\n"
+    "daemon is not running, 2 bad usage or input, 75 the store lock stayed busy\n"
+    "(try again), 77 not run by root.\n"
     "See zorvnotifyctl(1).\n";
 
 const CommandInfo* FindCommand(const std::string& name) {
@@ -163,6 +170,7 @@ std::string UsageLine(const CommandInfo& info) {
   if (info.takes & kDaemon) line += " [--socket PATH]";
   if (info.takes & (kFileType | kTypeFilter)) line += " [--type TYPE]";
   if (info.takes & kSince) line += " [--since N]";
+  if (info.takes & kWait) line += " [--wait SECONDS]";
   line += " [--json] ";
   line += info.name;
   if (*info.synopsis != '\0') line += std::string(" ") + info.synopsis;
@@ -179,14 +187,33 @@ void PrintCommandHelp(const CommandInfo& info, std::ostream& out) {
   if (info.takes & kTypeFilter) out << "\nTYPE is share, etc or local-etc.\n";
 }
 
-// Parses a decimal sequence number of up to 64 bits, digits only.
-bool ParseSince(const std::string& text, uint64_t* since) {
+// The longest --wait: one day.
+constexpr uint64_t kMaxWait = 86400;
+
+// Parses a decimal number of up to 64 bits, digits only.
+bool ParseDecimal(const std::string& text, uint64_t* since) {
   if (text.empty() || text.find_first_not_of("0123456789") != std::string::npos) return false;
   errno = 0;
   const unsigned long long value = strtoull(text.c_str(), nullptr, 10);
   if (errno == ERANGE) return false;
   *since = value;
   return true;
+}
+
+// Why the tool must not run |info| with the process's ids; "" when it may.
+// Installed set-user-ID or set-group-ID, the tool would open any file the
+// caller names with raised ids (and quote its contents in messages) and let
+// any user change any queue, so it refuses whenever the real user is not
+// root and its ids differ from the caller's.  A non-root caller running it
+// plainly may still ask the daemon, whose socket may admit its group;
+// every store command needs root.  Nothing has been read or changed yet.
+std::string PrivilegeRefusal(const CommandInfo& info) {
+  const uid_t uid = getuid();
+  if (uid == 0) return std::string();
+  const bool set_id = geteuid() != uid || getegid() != getgid();
+  if (!set_id && (info.takes & kDaemon)) return std::string();
+  return "must be run as root (real user id " + std::to_string(uid) + ")" +
+         (set_id ? "; it is not meant to be installed set-user-ID or set-group-ID" : "");
 }
 
 int UsageError(const std::string& message) {
@@ -226,6 +253,8 @@ int Dispatch(int argc, char** argv) {
   }
   const CommandInfo* info = FindCommand(line.command);
   if (info == nullptr) return UsageError("unknown command \"" + line.command + "\"");
+  const std::string refusal = PrivilegeRefusal(*info);
+  if (!refusal.empty()) return Fail(kExitNotRoot, refusal);
   if (line.args.size() < info->min_args || line.args.size() > info->max_args) {
     Fail(kExitUsage, std::string(info->name) + ": wrong number of arguments");
     std::cerr << UsageLine(*info) << '\n';
@@ -248,11 +277,21 @@ int Dispatch(int argc, char** argv) {
   if (line.since_given) {
     if (!(info->takes & kSince))
       return UsageError(std::string("--since does not apply to ") + info->name);
-    if (!ParseSince(line.since, &invocation.since)) {
+    if (!ParseDecimal(line.since, &invocation.since)) {
       return UsageError("--since \"" + line.since +
                         "\" is not a sequence number (0 to 18446744073709551615)");
     }
     invocation.since_given = true;
+  }
+  if (line.wait_given) {
+    if (!(info->takes & kWait))
+      return UsageError(std::string("--wait does not apply to ") + info->name);
+    uint64_t seconds = 0;
+    if (!ParseDecimal(line.wait, &seconds) || seconds > kMaxWait) {
+      return UsageError("--wait \"" + line.wait + "\" is not a number of seconds (0 to " +
+                        std::to_string(kMaxWait) + ")");
+    }
+    invocation.wait = static_cast<unsigned>(seconds);
   }
   if (line.verbose) ZORV::ZORVNOTIFYD::LOG_LEVEL = 7;
   return info->run(invocation);
@@ -274,7 +313,12 @@ int main(int argc, char** argv) {
                                  std::string("unexpected failure: ") + e.what());
   }
   std::cout.flush();
-  if (!std::cout) {
+  if (!std::cout && zorvnotifyctl::StoreChanged()) {
+    // The change is made: a report that could not be written does not undo it.
+    zorvnotifyctl::Fail(status,
+                        "the change is stored, but its report could not be written to "
+                        "standard output");
+  } else if (!std::cout) {
     status = zorvnotifyctl::Fail(zorvnotifyctl::kExitRefused, "cannot write the output");
   }
   closelog();

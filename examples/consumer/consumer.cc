@@ -1,15 +1,17 @@
 // A program that links an installed libzorvnotifyd: builds a queue from
 // JSON, copies it, asks matching questions of it and of an index over it,
 // and writes it back.  The build checks run it against the staged install;
-// it needs no privileges.
+// it needs no privileges.  It spells its includes both ways the installed
+// headers are found: <monitor_queue.h> and <zorvnotifyd/monitor_queue.h>.
 
 #include <iostream>
 #include <sstream>
 #include <vector>
 
 #include <monitor_queue.h>
-#include <monitor_queue_index.h>
 #include <thread.h>
+#include <zorvnotifyd/monitor_queue_index.h>
+#include <zorvnotifyd/zorvnotifyd_export.h>
 
 using ZORV::ZORVNOTIFYD::MonitorQueue;
 

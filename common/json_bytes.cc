@@ -1,0 +1,120 @@
+// Encoding and decoding of bytes that are not UTF-8 in JSON strings.
+
+#include "json_bytes.h"
+
+#include <cstdio>
+
+namespace zorvcommon {
+namespace {
+
+bool Continuation(unsigned char byte) { return (byte & 0xC0) == 0x80; }
+
+// The length of the valid UTF-8 sequence at the start of |text| (1 for an
+// ASCII byte), or 0 when its first byte does not begin one.  The ranges of
+// the second byte exclude overlong forms, surrogates and code points above
+// U+10FFFF.
+size_t Utf8Length(std::string_view text) {
+  const auto at = [&text](size_t i) { return static_cast<unsigned char>(text[i]); };
+  const unsigned char lead = at(0);
+  if (lead < 0x80) return 1;
+  size_t length;
+  unsigned char low = 0x80, high = 0xBF;  // the range of the second byte
+  if (lead >= 0xC2 && lead <= 0xDF) {
+    length = 2;
+  } else if (lead >= 0xE0 && lead <= 0xEF) {
+    length = 3;
+    if (lead == 0xE0) low = 0xA0;
+    if (lead == 0xED) high = 0x9F;
+  } else if (lead >= 0xF0 && lead <= 0xF4) {
+    length = 4;
+    if (lead == 0xF0) low = 0x90;
+    if (lead == 0xF4) high = 0x8F;
+  } else {
+    return 0;
+  }
+  if (text.size() < length || at(1) < low || at(1) > high) return 0;
+  for (size_t i = 2; i < length; ++i) {
+    if (!Continuation(at(i))) return 0;
+  }
+  return length;
+}
+
+}  // namespace
+
+void AppendJsonString(std::string* out, std::string_view text) {
+  out->push_back('"');
+  for (size_t i = 0; i < text.size();) {
+    const auto byte = static_cast<unsigned char>(text[i]);
+    const size_t length = Utf8Length(text.substr(i));
+    if (length > 1 || (length == 1 && byte >= 0x20 && byte != '"' && byte != '\\')) {
+      out->append(text.substr(i, length));
+      i += length;
+      continue;
+    }
+    ++i;
+    switch (byte) {
+      case '"':
+        out->append("\\\"");
+        break;
+      case '\\':
+        out->append("\\\\");
+        break;
+      case '\n':
+        out->append("\\n");
+        break;
+      case '\t':
+        out->append("\\t");
+        break;
+      case '\r':
+        out->append("\\r");
+        break;
+      case '\b':
+        out->append("\\b");
+        break;
+      case '\f':
+        out->append("\\f");
+        break;
+      default: {
+        // A control byte as \u00XX; a byte outside UTF-8 as \udcXY.
+        char escaped[7];
+        snprintf(escaped, sizeof(escaped), "\\u%s%02x", byte < 0x80 ? "00" : "dc", byte);
+        out->append(escaped);
+      }
+    }
+  }
+  out->push_back('"');
+}
+
+std::string DecodeRawBytes(std::string_view text) {
+  std::string decoded;
+  decoded.reserve(text.size());
+  for (size_t i = 0; i < text.size(); ++i) {
+    const auto at = [&text](size_t j) { return static_cast<unsigned char>(text[j]); };
+    if (at(i) == 0xED && i + 2 < text.size() && (at(i + 1) == 0xB2 || at(i + 1) == 0xB3) &&
+        Continuation(at(i + 2))) {
+      decoded.push_back(static_cast<char>(((at(i + 1) & 0x03) << 6) | (at(i + 2) & 0x3F)));
+      i += 2;
+    } else {
+      decoded.push_back(text[i]);
+    }
+  }
+  return decoded;
+}
+
+void DecodeRawBytes(Json::Value* value) {
+  if (value->isString()) {
+    *value = DecodeRawBytes(value->asString());
+  } else if (value->isArray()) {
+    for (Json::Value& element : *value) DecodeRawBytes(&element);
+  } else if (value->isObject()) {
+    Json::Value decoded(Json::objectValue);
+    for (const std::string& key : value->getMemberNames()) {
+      Json::Value member = (*value)[key];
+      DecodeRawBytes(&member);
+      decoded[DecodeRawBytes(key)] = member;
+    }
+    *value = decoded;
+  }
+}
+
+}  // namespace zorvcommon
