@@ -240,6 +240,11 @@ TEST(ZorvnotifyctlTest, RefusesSetUserIdAndReportsABusyStore) {
   std::ostringstream text;
   text << std::ifstream("/tmp/err").rdbuf();
   EXPECT_THAT(text.str(), ::testing::HasSubstr("the change is stored, but its report could not"));
+  // A service manager that fails is said in words; the change stays.
+  zorv_test::SetSystemctlExitStatus(1);
+  EXPECT_EQ(RunTool("upsert q", queue, &out, &err), 0) << err;
+  EXPECT_THAT(err, ::testing::HasSubstr("the change is stored, but the service manager could not "
+                                        "be asked to start or stop zorvnotifyd"));
 }
 
 // A program run in the background, its standard output and error on one
@@ -393,6 +398,11 @@ TEST(ZorvnotifyctlTest, ReadsFilesInNameOrderAndAReadOnlyUsrWithWarnings) {
     }
   }
   EXPECT_NE(access("/usr/zorv/share", F_OK), 0);
+  // A save that cannot be written says why.
+  std::ofstream("/tmp/q.json") << R"({"queue": "q", "config": []})";
+  EXPECT_EQ(RunOnReadOnlyUsr("upsert a /tmp/q.json", &out, &err), 1);
+  EXPECT_THAT(
+      err, ::testing::HasSubstr("the file system holding /usr/zorv/etc/zorvnotifyd is read-only"));
 }
 
 }  // namespace

@@ -5,6 +5,7 @@
 #include <signal.h>
 #include <sys/signalfd.h>
 #include <sys/stat.h>
+#include <sys/statvfs.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -123,6 +124,20 @@ Json::Value WriteResult(const Invocation& invocation, const std::string& file,
 // named, when the lock stayed held (the library's own "Lock failed" lines
 // are then left out), else kExitRefused with |failure| (the library's
 // message precedes it).
+// Why nothing could be written in the configuration directory of |type|,
+// when its file system says so: ": the file system holding DIR is
+// read-only" or "... is full"; otherwise "" (the library's lines say why).
+std::string WhyNotWritten(QueueType type) {
+  const std::string dir = MonitorQueue::GetConfDir(type);
+  struct statvfs fs;
+  if (statvfs(dir.c_str(), &fs) != 0) return "";
+  if (fs.f_flag & ST_RDONLY) return ": the file system holding " + Printable(dir) + " is read-only";
+  if (fs.f_bavail == 0 || fs.f_favail == 0) {
+    return ": the file system holding " + Printable(dir) + " is full";
+  }
+  return "";
+}
+
 bool StoreWithRetry(const Invocation& invocation, const std::function<bool()>& store,
                     const std::string& failure, int* status) {
   using Clock = std::chrono::steady_clock;
@@ -144,7 +159,7 @@ bool StoreWithRetry(const Invocation& invocation, const std::function<bool()>& s
       return true;
     }
     if (!busy) {
-      *status = Fail(kExitRefused, failure);
+      *status = Fail(kExitRefused, failure + WhyNotWritten(invocation.type));
       return false;
     }
     if (Clock::now() >= deadline) break;
