@@ -28,6 +28,7 @@
 
 #include "monitor_queue.h"
 #include "monitor_queue_index.h"
+#include "register.h"
 
 namespace {
 
@@ -120,15 +121,7 @@ std::string Thousands(int n) {
   return text;
 }
 
-// Registers the benchmark |name| running |body| once per iteration, labelled
-// with |label| (the setup or the baseline it measures).
-template <typename Body>
-void Register(const std::string& name, const std::string& label, Body body) {
-  benchmark::RegisterBenchmark(name.c_str(), [label, body](benchmark::State& state) {
-    for (auto _ : state) body();
-    state.SetLabel(label);
-  })->Unit(benchmark::kNanosecond);
-}
+using zorv_bench::Register;
 
 // Registers a memory row: |compile| runs once per repetition with regcomp
 // counted; the row's value is the counter "heap_bytes" and its label says

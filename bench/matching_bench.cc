@@ -11,6 +11,7 @@
 #include <vector>
 
 #include "monitor_queue.h"
+#include "register.h"
 
 namespace {
 
@@ -70,15 +71,7 @@ struct DirCase {
   bool want;
 };
 
-// Registers the benchmark |name| running |body| once per iteration, labelled
-// with |label| (the setup or the baseline it measures).
-template <typename Body>
-void Register(const std::string& name, const std::string& label, Body body) {
-  benchmark::RegisterBenchmark(name.c_str(), [label, body](benchmark::State& state) {
-    for (auto _ : state) body();
-    state.SetLabel(label);
-  })->Unit(benchmark::kNanosecond);
-}
+using zorv_bench::Register;
 
 }  // namespace
 

@@ -89,6 +89,34 @@ inline std::string Path(FuzzedDataProvider& input, size_t max_length) {
   return path;
 }
 
+// A mask of one to eight neighbouring bits anywhere in the low 32.
+inline unsigned Mask(FuzzedDataProvider& input) {
+  const unsigned low = input.ConsumeIntegral<uint8_t>();
+  return low << input.ConsumeIntegralInRange(0, 24);
+}
+
+// A queue "q" of up to four configurations, each with a path of up to
+// |path_length| bytes (see Path), a mask and up to three ignore patterns
+// from |next_pattern|.
+template <typename NextPattern>
+ZORV::ZORVNOTIFYD::MonitorQueue RandomQueue(FuzzedDataProvider& input, size_t path_length,
+                                            NextPattern next_pattern) {
+  Json::Value value(Json::objectValue);
+  value["queue"] = "q";
+  value["config"] = Json::Value(Json::arrayValue);
+  const int configs = input.ConsumeIntegralInRange(0, 4);
+  for (int i = 0; i < configs; ++i) {
+    Json::Value config(Json::objectValue);
+    config["path"] = Path(input, path_length);
+    config["mask"] = Mask(input);
+    config["ignore"] = Json::Value(Json::arrayValue);
+    const int patterns = input.ConsumeIntegralInRange(0, 3);
+    for (int j = 0; j < patterns; ++j) config["ignore"].append(next_pattern());
+    value["config"].append(config);
+  }
+  return ZORV::ZORVNOTIFYD::MonitorQueue(value);
+}
+
 }  // namespace zorv_fuzz
 
 #endif  // ZORVNOTIFYD_FUZZ_FUZZ_COMMON_H_

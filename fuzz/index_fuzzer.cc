@@ -56,26 +56,8 @@ std::string Pattern(FuzzedDataProvider& input, std::vector<std::string>& drawn) 
   return pattern;
 }
 
-unsigned Mask(FuzzedDataProvider& input) {
-  const unsigned low = input.ConsumeIntegral<uint8_t>();
-  return low << input.ConsumeIntegralInRange(0, 24);
-}
-
 MonitorQueue Queue(FuzzedDataProvider& input, std::vector<std::string>& drawn) {
-  Json::Value value(Json::objectValue);
-  value["queue"] = "q";
-  value["config"] = Json::Value(Json::arrayValue);
-  const int configs = input.ConsumeIntegralInRange(0, 4);
-  for (int i = 0; i < configs; ++i) {
-    Json::Value config(Json::objectValue);
-    config["path"] = Path(input);
-    config["mask"] = Mask(input);
-    config["ignore"] = Json::Value(Json::arrayValue);
-    const int patterns = input.ConsumeIntegralInRange(0, 3);
-    for (int j = 0; j < patterns; ++j) config["ignore"].append(Pattern(input, drawn));
-    value["config"].append(config);
-  }
-  return MonitorQueue(value);
+  return zorv_fuzz::RandomQueue(input, 16, [&] { return Pattern(input, drawn); });
 }
 
 // A question's path: a fresh one, or a configured path with a tail.
@@ -147,7 +129,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     const std::string path = Question(input, queues);
     switch (which) {
       case 0: {
-        const unsigned mask = input.ConsumeBool() ? ~0u : Mask(input);
+        const unsigned mask = input.ConsumeBool() ? ~0u : zorv_fuzz::Mask(input);
         expected.clear();
         for (size_t i = 0; i < queues.size(); ++i) {
           if (queues[i].IsMonitoring(path, mask)) expected.push_back(i);

@@ -113,26 +113,8 @@ std::string Pattern(FuzzedDataProvider& input) {
   return pattern;
 }
 
-unsigned Mask(FuzzedDataProvider& input) {
-  const unsigned low = input.ConsumeIntegral<uint8_t>();
-  return low << input.ConsumeIntegralInRange(0, 24);
-}
-
 MonitorQueue Queue(FuzzedDataProvider& input) {
-  Json::Value value(Json::objectValue);
-  value["queue"] = "q";
-  value["config"] = Json::Value(Json::arrayValue);
-  const int configs = input.ConsumeIntegralInRange(0, 4);
-  for (int i = 0; i < configs; ++i) {
-    Json::Value config(Json::objectValue);
-    config["path"] = Path(input);
-    config["mask"] = Mask(input);
-    config["ignore"] = Json::Value(Json::arrayValue);
-    const int patterns = input.ConsumeIntegralInRange(0, 3);
-    for (int j = 0; j < patterns; ++j) config["ignore"].append(Pattern(input));
-    value["config"].append(config);
-  }
-  return MonitorQueue(value);
+  return zorv_fuzz::RandomQueue(input, 24, [&] { return Pattern(input); });
 }
 
 [[noreturn]] void Mismatch(const char* question, const std::string& argument, long got,
@@ -188,7 +170,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     const std::string path = Path(input);
     switch (which) {
       case 0: {  // IsMonitoring, queue form: the first configuration that wants it decides
-        const unsigned mask = Mask(input);
+        const unsigned mask = zorv_fuzz::Mask(input);
         bool expected = false;
         for (size_t i = 0; i < queue._configs.size() && !expected; ++i) {
           if (PassesMaskAndPath(queue._configs[i], path, mask)) one.reached[i] = true;
@@ -201,7 +183,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
       case 1: {  // IsMonitoring, configuration form
         if (queue._configs.empty()) break;
         const size_t i = input.ConsumeIntegralInRange<size_t>(0, queue._configs.size() - 1);
-        const unsigned mask = Mask(input);
+        const unsigned mask = zorv_fuzz::Mask(input);
         Config& config = queue._configs[i];
         if (PassesMaskAndPath(config, path, mask)) one.reached[i] = true;
         const bool expected = RefWants(config, path, mask);
