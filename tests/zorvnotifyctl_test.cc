@@ -4,19 +4,16 @@
 // its --json output, parsed back, and its commands on a real daemon.
 
 #include <fcntl.h>
-#include <poll.h>
-#include <sched.h>
 #include <signal.h>
 #include <stdlib.h>
 #include <sys/file.h>
 #include <sys/inotify.h>
-#include <sys/mount.h>
 #include <sys/stat.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <cerrno>
 #include <fstream>
+#include <functional>
 #include <sstream>
 #include <thread>
 
@@ -24,9 +21,12 @@
 #include <json/json.h>
 
 #include "monitor_queue.h"
+#include "support/child_process.h"
 #include "support/sandbox.h"
 
 namespace {
+
+using namespace ZORV::ZORVNOTIFYD;  // NOLINT
 
 struct Case {
   std::string args;      // shell words after the tool's name
@@ -42,18 +42,41 @@ Json::Value Parse(const std::string& text) {
   return value;
 }
 
-// Runs the tool with |args| and |input| on standard input; returns its exit
-// status (-1 when it did not exit) and sets |out| and |err|.
-int RunTool(const std::string& args, const std::string& input, std::string* out, std::string* err) {
+// The content of the file at |path|.
+std::string Slurp(const char* path) {
+  std::ostringstream text;
+  text << std::ifstream(path).rdbuf();
+  return text.str();
+}
+
+// In a child, opens |path| with |flags| as descriptor |fd|.
+bool Redirect(int fd, const char* path, int flags) {
+  const int opened = open(path, flags | O_CLOEXEC, 0644);
+  return opened >= 0 && dup2(opened, fd) == fd;
+}
+
+// Runs |args| with /tmp/in on standard input, standard output and error in
+// /tmp/out and /tmp/err, after |in_child|; returns its exit status (-1 when
+// it did not exit) and sets |out| and |err|.
+int Run(std::vector<std::string> args, std::string* out, std::string* err,
+        const std::function<bool()>& in_child = nullptr) {
+  const int status = zorv_test::ChildProcess(std::move(args), [&in_child] {
+                       return Redirect(0, "/tmp/in", O_RDONLY) &&
+                              Redirect(1, "/tmp/out", O_WRONLY | O_CREAT | O_TRUNC) &&
+                              Redirect(2, "/tmp/err", O_WRONLY | O_CREAT | O_TRUNC) &&
+                              (!in_child || in_child());
+                     }).Stop(0);
+  *out = Slurp("/tmp/out");
+  *err = Slurp("/tmp/err");
+  return status;
+}
+
+// Runs the tool with |args| (shell words) and |input| on standard input,
+// after |in_child|, as Run does.
+int RunTool(const std::string& args, const std::string& input, std::string* out, std::string* err,
+            const std::function<bool()>& in_child = nullptr) {
   std::ofstream("/tmp/in") << input;
-  const int status =
-      system(("'" ZORVNOTIFYCTL_PATH "' " + args + " </tmp/in >/tmp/out 2>/tmp/err").c_str());
-  std::ostringstream out_text, err_text;
-  out_text << std::ifstream("/tmp/out").rdbuf();
-  err_text << std::ifstream("/tmp/err").rdbuf();
-  *out = out_text.str();
-  *err = err_text.str();
-  return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+  return Run({"/bin/sh", "-c", "exec '" ZORVNOTIFYCTL_PATH "' " + args}, out, err, in_child);
 }
 
 // Runs the tool for each case in turn and checks what it gave.
@@ -167,60 +190,39 @@ TEST(ZorvnotifyctlTest, RefusalsExitStatusesAndJsonOutput) {
   raw["queue"] = "caf\xe9-q";
   raw["config"][0]["path"] = "/d\xff";
   raw["config"][0]["mask"] = 1;
-  ASSERT_TRUE(ZORV::ZORVNOTIFYD::MonitorQueue::Upsert(
-      ZORV::ZORVNOTIFYD::MonitorQueue(raw), "r", ZORV::ZORVNOTIFYD::MONITOR_QUEUE_TYPE_ETC_DIR));
+  ASSERT_TRUE(MonitorQueue::Upsert(MonitorQueue(raw), "r", MONITOR_QUEUE_TYPE_ETC_DIR));
   EXPECT_EQ(RunTool("get --json $(printf 'caf\\351-q') r", "", &out, &err), 0) << err;
   EXPECT_THAT(out, ::testing::HasSubstr(R"("caf\udce9-q")"));
   EXPECT_EQ(system("python3 -c 'import json,sys; json.loads(sys.stdin.read())' </tmp/out"), 0);
   EXPECT_EQ(RunTool("upsert r", out, &out, &err), 0) << err;
-  std::vector<ZORV::ZORVNOTIFYD::MonitorQueue> stored;
-  ASSERT_TRUE(ZORV::ZORVNOTIFYD::MonitorQueue::List(stored, "r",
-                                                    ZORV::ZORVNOTIFYD::MONITOR_QUEUE_TYPE_ETC_DIR));
+  std::vector<MonitorQueue> stored;
+  ASSERT_TRUE(MonitorQueue::List(stored, "r", MONITOR_QUEUE_TYPE_ETC_DIR));
   ASSERT_EQ(stored.size(), 1u);
   EXPECT_EQ(stored[0]._name, "caf\xe9-q");
   ASSERT_EQ(stored[0]._configs.size(), 1u);
   EXPECT_EQ(stored[0]._configs[0]._path, "/d\xff");
 }
 
-// Runs the tool with |args| and /tmp/in on standard input as real user 1000
-// with effective and saved user id 0, as when installed set-user-ID root;
-// returns its exit status (-1 when it did not exit) and sets |err|.
-int RunSetUserId(std::vector<std::string> args, std::string* err) {
+// Runs the tool with |args| and |input| as Run does, as real user 1000 with
+// effective and saved user id 0, as when installed set-user-ID root.
+int RunSetUserId(std::vector<std::string> args, const std::string& input, std::string* out,
+                 std::string* err) {
+  std::ofstream("/tmp/in") << input;
   args.insert(args.begin(), ZORVNOTIFYCTL_PATH);
-  const pid_t pid = fork();
-  if (pid == 0) {
-    const int in = open("/tmp/in", O_RDONLY);
-    const int out = open("/tmp/err", O_WRONLY | O_CREAT | O_TRUNC, 0644);
-    if (in < 0 || out < 0 || dup2(in, 0) < 0 || dup2(out, 1) < 0 || dup2(out, 2) < 0 ||
-        setresuid(1000, 0, 0) != 0) {
-      _exit(125);
-    }
-    std::vector<char*> argv;
-    for (std::string& arg : args) argv.push_back(&arg[0]);
-    argv.push_back(nullptr);
-    execv(argv[0], argv.data());
-    _exit(127);
-  }
-  int status = 0;
-  waitpid(pid, &status, 0);
-  std::ostringstream text;
-  text << std::ifstream("/tmp/err").rdbuf();
-  *err = text.str();
-  return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+  return Run(std::move(args), out, err, [] { return setresuid(1000, 0, 0) == 0; });
 }
 
 TEST(ZorvnotifyctlTest, RefusesSetUserIdAndReportsABusyStore) {
   ZORV_REQUIRE_SANDBOX();
   zorv_test::ResetStore();
   const std::string queue = WatchingPath("/a");
-  std::ofstream("/tmp/in") << queue;
   std::string out, err;
-  EXPECT_EQ(RunSetUserId({"upsert", "q"}, &err), 77);
+  EXPECT_EQ(RunSetUserId({"upsert", "q"}, queue, &out, &err), 77);
   // Under an emulator the wrapper shell drops the effective id first: the
   // tool then sees a plain non-root caller, refused the same way.
   EXPECT_THAT(err, ::testing::HasSubstr("must be run as root (real user id 1000)"));
   EXPECT_NE(access("/usr/zorv", F_OK), 0) << "the set-user-ID tool reached the library";
-  EXPECT_EQ(RunSetUserId({"--version"}, &err), 0) << err;
+  EXPECT_EQ(RunSetUserId({"--version"}, queue, &out, &err), 0) << err;
 
   // Another writer holds the store lock: no wait gives up at once and
   // names it; a wait outlasting it stores.
@@ -235,74 +237,14 @@ TEST(ZorvnotifyctlTest, RefusesSetUserIdAndReportsABusyStore) {
   EXPECT_EQ(RunTool("--wait 2 upsert q", queue, &out, &err), 0) << err;
   release.join();
   // A stored change whose report cannot be written is still a success.
-  const int status = system("'" ZORVNOTIFYCTL_PATH "' delete q q </dev/null >/dev/full 2>/tmp/err");
-  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
-  std::ostringstream text;
-  text << std::ifstream("/tmp/err").rdbuf();
-  EXPECT_THAT(text.str(), ::testing::HasSubstr("the change is stored, but its report could not"));
+  EXPECT_EQ(RunTool("delete q q </dev/null >/dev/full", "", &out, &err), 0) << err;
+  EXPECT_THAT(err, ::testing::HasSubstr("the change is stored, but its report could not"));
   // A service manager that fails is said in words; the change stays.
   zorv_test::SetSystemctlExitStatus(1);
   EXPECT_EQ(RunTool("upsert q", queue, &out, &err), 0) << err;
   EXPECT_THAT(err, ::testing::HasSubstr("the change is stored, but the service manager could not "
                                         "be asked to start or stop zorvnotifyd"));
 }
-
-// A program run in the background, its standard output and error on one
-// pipe; killed at the end when it still runs.
-class Background {
- public:
-  explicit Background(std::vector<std::string> args) {
-    int fds[2];
-    EXPECT_EQ(pipe2(fds, O_CLOEXEC), 0);
-    if ((pid_ = fork()) == 0) {
-      if (dup2(fds[1], 1) < 0 || dup2(fds[1], 2) < 0) _exit(125);
-      std::vector<char*> argv;
-      for (std::string& arg : args) argv.push_back(&arg[0]);
-      argv.push_back(nullptr);
-      execv(argv[0], argv.data());
-      _exit(127);
-    }
-    close(fds[1]);
-    out_ = fds[0];
-  }
-  ~Background() {
-    if (pid_ > 0 && kill(pid_, SIGKILL) == 0) waitpid(pid_, nullptr, 0);
-    close(out_);
-  }
-  // The next line of output holding |text|, waiting up to 10 s; "" when
-  // none came.
-  std::string Line(const std::string& text = "") {
-    for (;;) {
-      for (size_t end; (end = buffered_.find('\n')) != std::string::npos;) {
-        const std::string line = buffered_.substr(0, end);
-        buffered_.erase(0, end + 1);
-        if (line.find(text) != std::string::npos) return line;
-      }
-      struct pollfd p = {out_, POLLIN, 0};
-      char chunk[4096];
-      ssize_t n = 0;
-      if (poll(&p, 1, 10000) <= 0 || (n = read(out_, chunk, sizeof(chunk))) <= 0) return "";
-      buffered_.append(chunk, size_t(n));
-    }
-  }
-  // Sends |signal| (0: none) and returns the exit status; -1 when the
-  // program did not exit within 10 s or was killed.
-  int Stop(int signal) {
-    int status = 0;
-    if (kill(pid_, signal) != 0) return -1;
-    for (int i = 0; i < 1000; ++i, usleep(10000)) {
-      if (waitpid(pid_, &status, WNOHANG) != pid_) continue;
-      pid_ = -1;
-      return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
-    }
-    return -1;
-  }
-
- private:
-  pid_t pid_ = -1;
-  int out_ = -1;
-  std::string buffered_;
-};
 
 TEST(ZorvnotifyctlTest, WatchAndStatusAskTheDaemon) {
   ZORV_REQUIRE_SANDBOX();
@@ -313,61 +255,36 @@ TEST(ZorvnotifyctlTest, WatchAndStatusAskTheDaemon) {
   EXPECT_THAT(err, ::testing::HasSubstr("zorvnotifyd is not running (no socket at /tmp/ctl.sock)"));
 
   ASSERT_TRUE(mkdir("/tmp/wd", 0755) == 0 || errno == EEXIST);
-  Json::Value queue;
-  queue["queue"] = "backup";
-  queue["config"][0]["path"] = "/tmp/wd";
-  queue["config"][0]["mask"] = IN_CREATE;
-  ASSERT_TRUE(
-      ZORV::ZORVNOTIFYD::MonitorQueue::Upsert(ZORV::ZORVNOTIFYD::MonitorQueue(queue), "nas",
-                                              ZORV::ZORVNOTIFYD::MONITOR_QUEUE_TYPE_ETC_DIR));
-  Background daemon({ZORVNOTIFYD_PATH, "--socket", socket});
-  ASSERT_THAT(daemon.Line("ready:"), ::testing::HasSubstr("for 1 queues"));
+  const Json::Value queue = Parse(R"({"queue": "backup", "config": [{"path": "/tmp/wd", "mask": )" +
+                                  std::to_string(IN_CREATE) + "}]}");
+  ASSERT_TRUE(MonitorQueue::Upsert(MonitorQueue(queue), "nas", MONITOR_QUEUE_TYPE_ETC_DIR));
+  zorv_test::ChildProcess daemon({ZORVNOTIFYD_PATH, "--socket", socket}, nullptr, true);
+  ASSERT_THAT(daemon.WaitFor("ready:"), ::testing::HasSubstr("for 1 queues"));
   EXPECT_EQ(RunTool("--socket " + socket + " status", "", &out, &err), 0) << err;
   EXPECT_THAT(out, ::testing::ContainsRegex("\nqueues +1\n"));
 
   // Its first line comes once the subscription is in place.
-  Background watch({ZORVNOTIFYCTL_PATH, "--socket", socket, "watch", "backup"});
-  EXPECT_EQ(watch.Line(), "watching backup: etc/nas (last #0)");
+  zorv_test::ChildProcess watch({ZORVNOTIFYCTL_PATH, "--socket", socket, "watch", "backup"},
+                                nullptr, true);
+  EXPECT_EQ(watch.Read(), "watching backup: etc/nas (last #0)");
   std::ofstream("/tmp/wd/new").flush();
-  EXPECT_EQ(watch.Line(), "backup [etc/nas] #1 IN_CREATE /tmp/wd/new");
+  EXPECT_EQ(watch.Read(), "backup [etc/nas] #1 IN_CREATE /tmp/wd/new");
   EXPECT_EQ(watch.Stop(SIGINT), 0);
   std::ofstream("/tmp/wd/b\xff").flush();
 
   // Kept records come first with --since; the daemon's going away ends
   // the watch with status 1.
-  Background json(
-      {ZORVNOTIFYCTL_PATH, "--json", "--since", "0", "--socket", socket, "watch", "backup", "nas"});
-  EXPECT_EQ(Parse(json.Line())["reply"], "subscribe");
-  const Json::Value event = Parse(json.Line());
+  zorv_test::ChildProcess json(
+      {ZORVNOTIFYCTL_PATH, "--json", "--since", "0", "--socket", socket, "watch", "backup", "nas"},
+      nullptr, true);
+  EXPECT_EQ(Parse(json.Read())["reply"], "subscribe");
+  const Json::Value event = Parse(json.Read());
   EXPECT_EQ(event["seq"], 1);
   EXPECT_EQ(event["path"], "/tmp/wd/new");
-  EXPECT_THAT(json.Line(), ::testing::HasSubstr(R"("path":"/tmp/wd/b\udcff")"));
+  EXPECT_THAT(json.Read(), ::testing::HasSubstr(R"("path":"/tmp/wd/b\udcff")"));
   EXPECT_EQ(daemon.Stop(SIGTERM), 0);
-  EXPECT_THAT(json.Line(), ::testing::HasSubstr("zorvnotifyd closed the connection"));
+  EXPECT_THAT(json.Read(), ::testing::HasSubstr("zorvnotifyd closed the connection"));
   EXPECT_EQ(json.Stop(0), 1);
-}
-
-// Runs the tool with |args| in a mount namespace of its own where /usr is
-// read-only; returns its exit status (-1 when it did not exit) and sets
-// |out| and |err|.
-int RunOnReadOnlyUsr(const std::string& args, std::string* out, std::string* err) {
-  const pid_t pid = fork();
-  if (pid == 0) {
-    if (unshare(CLONE_NEWNS) != 0 ||
-        mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0 ||
-        mount(nullptr, "/usr", nullptr, MS_REMOUNT | MS_BIND | MS_RDONLY, nullptr) != 0) {
-      _exit(125);
-    }
-    _exit(RunTool(args, "", out, err));
-  }
-  int status = 0;
-  waitpid(pid, &status, 0);
-  std::ostringstream out_text, err_text;
-  out_text << std::ifstream("/tmp/out").rdbuf();
-  err_text << std::ifstream("/tmp/err").rdbuf();
-  *out = out_text.str();
-  *err = err_text.str();
-  return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
 }
 
 // Files created in an order other than their names' (tmpfs lists the
@@ -384,7 +301,7 @@ TEST(ZorvnotifyctlTest, ReadsFilesInNameOrderAndAReadOnlyUsrWithWarnings) {
   }
   std::string out, err;
   for (const char* args : {"catalogue --json", "shares", "dirs /s", "match /s/t 1"}) {
-    EXPECT_EQ(RunOnReadOnlyUsr(args, &out, &err), 0) << args << err;
+    EXPECT_EQ(RunTool(args, "", &out, &err, zorv_test::PrivateReadOnlyUsr), 0) << args << err;
     EXPECT_THAT(err, ::testing::HasSubstr(
                          "warning: the configuration directory /usr/local/etc/zorvnotifyd is "
                          "missing and could not be created; the local-etc type counts as empty"));
@@ -400,7 +317,7 @@ TEST(ZorvnotifyctlTest, ReadsFilesInNameOrderAndAReadOnlyUsrWithWarnings) {
   EXPECT_NE(access("/usr/zorv/share", F_OK), 0);
   // A save that cannot be written says why.
   std::ofstream("/tmp/q.json") << R"({"queue": "q", "config": []})";
-  EXPECT_EQ(RunOnReadOnlyUsr("upsert a /tmp/q.json", &out, &err), 1);
+  EXPECT_EQ(RunTool("upsert a /tmp/q.json", "", &out, &err, zorv_test::PrivateReadOnlyUsr), 1);
   EXPECT_THAT(
       err, ::testing::HasSubstr("the file system holding /usr/zorv/etc/zorvnotifyd is read-only"));
 }
