@@ -193,7 +193,9 @@ TEST(ZorvnotifyctlTest, RefusalsExitStatusesAndJsonOutput) {
   ASSERT_TRUE(MonitorQueue::Upsert(MonitorQueue(raw), "r", MONITOR_QUEUE_TYPE_ETC_DIR));
   EXPECT_EQ(RunTool("get --json $(printf 'caf\\351-q') r", "", &out, &err), 0) << err;
   EXPECT_THAT(out, ::testing::HasSubstr(R"("caf\udce9-q")"));
-  EXPECT_EQ(system("python3 -c 'import json,sys; json.loads(sys.stdin.read())' </tmp/out"), 0);
+  if (access("/usr/bin/python3", X_OK) == 0) {  // a strict reader, where there is one
+    EXPECT_EQ(system("python3 -c 'import json,sys; json.loads(sys.stdin.read())' </tmp/out"), 0);
+  }
   EXPECT_EQ(RunTool("upsert r", out, &out, &err), 0) << err;
   std::vector<MonitorQueue> stored;
   ASSERT_TRUE(MonitorQueue::List(stored, "r", MONITOR_QUEUE_TYPE_ETC_DIR));
