@@ -256,7 +256,7 @@ TEST(ZorvnotifyctlTest, WatchAndStatusAskTheDaemon) {
   EXPECT_EQ(RunTool("--socket " + socket + " watch backup", "", &out, &err), 1);
   EXPECT_THAT(err, ::testing::HasSubstr("zorvnotifyd is not running (no socket at /tmp/ctl.sock)"));
 
-  ASSERT_TRUE(mkdir("/tmp/wd", 0755) == 0 || errno == EEXIST);
+  ASSERT_EQ(std::system("rm -rf /tmp/wd && mkdir /tmp/wd"), 0);
   const Json::Value queue = Parse(R"({"queue": "backup", "config": [{"path": "/tmp/wd", "mask": )" +
                                   std::to_string(IN_CREATE) + "}]}");
   ASSERT_TRUE(MonitorQueue::Upsert(MonitorQueue(queue), "nas", MONITOR_QUEUE_TYPE_ETC_DIR));
