@@ -24,20 +24,13 @@
 
 #include "catalogue.h"
 #include "json_writer.h"
+#include "notify.h"
 #include "queue_log.h"
 #include "report.h"
 #include "server.h"
 #include "text.h"
 #include "unique_fd.h"
 #include "watch_tree.h"
-
-#if ZORVNOTIFYD_HAVE_SYSTEMD
-#include <systemd/sd-daemon.h>
-#else
-// Built without libsystemd (test builds only): systemd is told nothing.
-static int sd_notify(int, const char*) { return 0; }
-static int sd_notifyf(int, const char*, ...) { return 0; }
-#endif
 
 namespace zorvnotifyd {
 namespace {
@@ -107,6 +100,12 @@ std::string RunId() {
   return id;
 }
 
+// READY=1 with the status line the service manager shows for the daemon.
+std::string ReadyState(size_t directories, size_t queues) {
+  return "READY=1\nSTATUS=watching " + std::to_string(directories) + " directories for " +
+         std::to_string(queues) + " queues";
+}
+
 struct Options {
   ServerOptions server;
   Stdout out = Stdout::kNone;
@@ -153,8 +152,7 @@ int Serve(const Options& options) {
   };
   load();
   syslog(LOG_INFO, "ready: watching %zu directories for %zu queues", tree.size(), reporter.size());
-  sd_notifyf(0, "READY=1\nSTATUS=watching %zu directories for %zu queues", tree.size(),
-             reporter.size());
+  NotifyServiceManager(ReadyState(tree.size(), reporter.size()));
   const int64_t retry_ms = std::max<int64_t>(1, int64_t(options.retry_seconds * 1000));
   int64_t next_tick = NowMs() + retry_ms;
   struct pollfd fds[] = {{signals.get(), POLLIN, 0},
@@ -172,7 +170,7 @@ int Serve(const Options& options) {
     struct signalfd_siginfo info;
     if (ready > 0 && (fds[0].revents & POLLIN) &&
         read(signals.get(), &info, sizeof(info)) == sizeof(info)) {
-      sd_notify(0, "STOPPING=1");
+      NotifyServiceManager("STOPPING=1");
       syslog(LOG_INFO, "stopping on %s: releasing %zu watches", strsignal(int(info.ssi_signo)),
              tree.size());
       tree.Clear();
@@ -180,12 +178,11 @@ int Serve(const Options& options) {
     }
     if (ready > 0 && (fds[1].revents & POLLIN) && !tree.ReadEvents(reporter)) return 1;
     if (ready > 0 && (fds[2].revents & POLLIN) && catalogue_watch.ReadChanges()) {
-      sd_notify(0, "RELOADING=1");
+      NotifyServiceManager("RELOADING=1");
       load();
       syslog(LOG_INFO, "catalogue reloaded: watching %zu directories for %zu queues", tree.size(),
              reporter.size());
-      sd_notifyf(0, "READY=1\nSTATUS=watching %zu directories for %zu queues", tree.size(),
-                 reporter.size());
+      NotifyServiceManager(ReadyState(tree.size(), reporter.size()));
     }
     if (ready > 0 && (fds[3].revents & POLLIN)) server.Handle();
     if (NowMs() >= next_tick) {

@@ -4,6 +4,7 @@
 // come shows up in place of one that must.
 
 #include <fcntl.h>
+#include <poll.h>
 #include <sched.h>
 #include <signal.h>
 #include <sys/inotify.h>
@@ -123,6 +124,36 @@ void Register(const char* name, const char* path, unsigned mask, const char* ign
   ASSERT_TRUE(MonitorQueue::Upsert(MonitorQueue(json), file, type));
 }
 
+// A datagram socket bound at |path| that hears what the daemon tells its
+// service manager (NOTIFY_SOCKET).
+class NotifySocket {
+ public:
+  explicit NotifySocket(const char* path) : fd_(socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0)) {
+    struct sockaddr_un address = {};
+    address.sun_family = AF_UNIX;
+    strncpy(address.sun_path, path, sizeof(address.sun_path) - 1);
+    unlink(path);
+    EXPECT_EQ(bind(fd_, reinterpret_cast<struct sockaddr*>(&address), sizeof(address)), 0);
+  }
+  ~NotifySocket() { close(fd_); }
+  // The messages received until one equal to |last|, |last| included; the
+  // result lacks |last| when nothing came for 10 s.
+  Lines Until(const std::string& last) {
+    Lines messages;
+    while (messages.empty() || messages.back() != last) {
+      struct pollfd p = {fd_, POLLIN, 0};
+      char text[4096];
+      ssize_t n = 0;
+      if (poll(&p, 1, 10000) <= 0 || (n = recv(fd_, text, sizeof(text), 0)) < 0) break;
+      messages.emplace_back(text, size_t(n));
+    }
+    return messages;
+  }
+
+ private:
+  int fd_;
+};
+
 void MakeDirs(const Lines& dirs) {
   for (const std::string& dir : dirs) ASSERT_EQ(mkdir(dir.c_str(), 0755), 0) << dir;
 }
@@ -143,8 +174,12 @@ TEST_F(DaemonTest, ReportsToEachQueueExactlyItsEventsAndFollowsTheCatalogue) {
   for (const char* path : {"/tmp/d/f", "/tmp/d/inner/g"}) Put(path, "x");
   Register("a", "/tmp/w", kCreate | kModify | kDelete, "\\.tmp$", "fa");
   Register("b", "/tmp/w/b", IN_CLOSE_WRITE | kDelete, nullptr, "fb", MONITOR_QUEUE_TYPE_SHARE_DIR);
-  Daemon daemon;
+  // The service manager hears of readiness, reloads and the stop.
+  NotifySocket manager("/tmp/notify.sock");
+  Daemon daemon({"--json"}, [] { return setenv("NOTIFY_SOCKET", "/tmp/notify.sock", 1) == 0; });
   ASSERT_TRUE(daemon.Logged("ready: watching 2 directories"));
+  const std::string ready = "READY=1\nSTATUS=watching 2 directories for 2 queues";
+  EXPECT_EQ(manager.Until(ready), Lines({ready}));
 
   // Two masks on overlapping trees (queues in catalogue order: share
   // first); the ignored file never shows.
@@ -181,6 +216,11 @@ TEST_F(DaemonTest, ReportsToEachQueueExactlyItsEventsAndFollowsTheCatalogue) {
   Register("c", "/tmp/w2", kCreate, nullptr, "fc", MONITOR_QUEUE_TYPE_LOCAL_ETC_DIR);
   Put("/tmp/w/during", "x");
   ASSERT_TRUE(daemon.Logged("catalogue reloaded: watching 3 directories for 3 queues"));
+  const std::string reloaded = "READY=1\nSTATUS=watching 3 directories for 3 queues";
+  const Lines told = manager.Until(reloaded);
+  ASSERT_GE(told.size(), 2u);
+  EXPECT_EQ(told[told.size() - 2], "RELOADING=1");
+  EXPECT_EQ(told.back(), reloaded);
   Put("/tmp/w2/p", "x");
   daemon.Expect(
       {E('a', "w/during", kCreate), E('a', "w/during", kModify), E('c', "w2/p", kCreate)});
@@ -197,6 +237,8 @@ TEST_F(DaemonTest, ReportsToEachQueueExactlyItsEventsAndFollowsTheCatalogue) {
 
   EXPECT_EQ(daemon.Stop(SIGTERM), 0);
   EXPECT_EQ(daemon.Read(), "") << "a line after the last expected one";
+  const Lines stopping = manager.Until("STOPPING=1");
+  EXPECT_TRUE(!stopping.empty() && stopping.back() == "STOPPING=1");
 }
 
 // Symbolic links and bind mounts to a watched directory, paths the watcher

@@ -23,10 +23,14 @@ static std::string g_link_to;
 
 // The library's rename lands here, as its syslog does.  Once |g_link_to| is
 // set, the next rename is followed by a link to it put in place of the
-// renamed file, as another user could do in a directory open to them.
+// renamed file, as another user could do in a directory open to them; a
+// link that cannot be put makes the rename fail, so the test sees it.
 extern "C" int rename(const char* from, const char* to) noexcept {
-  const int result = renameat(AT_FDCWD, from, AT_FDCWD, to);
-  if (result == 0 && !g_link_to.empty() && unlink(to) == 0) symlink(g_link_to.c_str(), to);
+  int result = renameat(AT_FDCWD, from, AT_FDCWD, to);
+  if (result == 0 && !g_link_to.empty() &&
+      (unlink(to) != 0 || symlink(g_link_to.c_str(), to) != 0)) {
+    result = -1;
+  }
   g_link_to.clear();
   return result;
 }
