@@ -42,6 +42,11 @@ std::vector<std::string> QueueFiles(const std::string& dir) {
 // The event kinds the watcher reports: inotify's, on files and directories.
 constexpr uint32_t kDeliverable = IN_ALL_EVENTS | IN_ISDIR;
 
+// What a configuration directory is watched for.  IN_CREATE as well: a
+// queue file added as a symbolic link gives no other event.
+constexpr uint32_t kDirEvents =
+    IN_CREATE | IN_CLOSE_WRITE | IN_MOVED_TO | IN_DELETE | IN_MOVED_FROM | IN_ONLYDIR;
+
 // Queue files larger than this are not read to say why they failed.
 constexpr off_t kMaxExplainedSize = 16 << 20;
 
@@ -169,10 +174,7 @@ bool CatalogueWatch::WatchDirs() {
   std::set<std::string> missing;
   for (QueueType type : zorvcommon::kAllQueueTypes) {
     const std::string dir = MonitorQueue::GetConfDir(type);
-    // IN_CREATE as well: a queue file added as a symbolic link gives no other event.
-    const uint32_t mask =
-        IN_CREATE | IN_CLOSE_WRITE | IN_MOVED_TO | IN_DELETE | IN_MOVED_FROM | IN_ONLYDIR;
-    if (inotify_add_watch(inotify_.get(), dir.c_str(), mask) >= 0) continue;
+    if (inotify_add_watch(inotify_.get(), dir.c_str(), kDirEvents) >= 0) continue;
     if (errno == ENOENT) {
       // Missing and not creatable (a read-only /usr): an empty type.
       if (missing_.count(dir) == 0) {
@@ -190,6 +192,23 @@ bool CatalogueWatch::WatchDirs() {
   }
   missing_ = std::move(missing);
   return true;
+}
+
+bool CatalogueWatch::WatchMissing() {
+  // Only looked for, not made: on a read-only /usr every attempt to create
+  // one would log a failure.
+  bool appeared = false;
+  for (auto it = missing_.begin(); it != missing_.end();) {
+    if (inotify_add_watch(inotify_.get(), it->c_str(), kDirEvents) < 0) {
+      ++it;
+      continue;
+    }
+    syslog(LOG_INFO, "the configuration directory %s appeared: reading the catalogue again",
+           it->c_str());
+    it = missing_.erase(it);
+    appeared = true;
+  }
+  return appeared;
 }
 
 bool CatalogueWatch::ReadChanges() {

@@ -61,8 +61,9 @@ class CatalogueWatch {
   // Opens an inotify instance of its own and watches the directories
   // (created first when missing) for files written, renamed in or out, or
   // removed.  A directory that is missing and cannot be created (a
-  // read-only /usr) is logged once and left unwatched.  False when the
-  // instance or a watch on an existing directory failed (logged).
+  // read-only /usr) is logged once and left unwatched until WatchMissing
+  // finds it.  False when the instance or a watch on an existing directory
+  // failed (logged).
   bool Open();
   // The descriptor to poll.
   int fd() const { return inotify_.get(); }
@@ -71,6 +72,10 @@ class CatalogueWatch {
   // watched again); names beginning with "." (the library's temporary
   // files) do not count.
   bool ReadChanges();
+  // Watches the directories that were missing and exist now (made by the
+  // library once /usr became writable).  True when one of them is watched
+  // now: the catalogue must be read again.
+  bool WatchMissing();
 
  private:
   // Watches the three configuration directories, creating missing ones

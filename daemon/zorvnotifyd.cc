@@ -177,7 +177,11 @@ int Serve(const Options& options) {
       return 0;
     }
     if (ready > 0 && (fds[1].revents & POLLIN) && !tree.ReadEvents(reporter)) return 1;
-    if (ready > 0 && (fds[2].revents & POLLIN) && catalogue_watch.ReadChanges()) {
+    // A configuration directory that was missing (a read-only /usr) and
+    // exists now is read as soon as the next tick finds it.
+    const bool tick = NowMs() >= next_tick;
+    if ((ready > 0 && (fds[2].revents & POLLIN) && catalogue_watch.ReadChanges()) ||
+        (tick && catalogue_watch.WatchMissing())) {
       NotifyServiceManager("RELOADING=1");
       load();
       syslog(LOG_INFO, "catalogue reloaded: watching %zu directories for %zu queues", tree.size(),
@@ -185,7 +189,7 @@ int Serve(const Options& options) {
       NotifyServiceManager(ReadyState(tree.size(), reporter.size()));
     }
     if (ready > 0 && (fds[3].revents & POLLIN)) server.Handle();
-    if (NowMs() >= next_tick) {
+    if (tick) {
       tree.Tick(reporter);
       next_tick = NowMs() + retry_ms;
     }

@@ -571,13 +571,15 @@ TEST_F(DaemonTest, DeliversEachQueueItsEventsToItsSubscribers) {
 }
 
 // A read-only /usr holding only the etc configuration directory, as seen
-// by this process alone: the daemon serves the queues that exist and says
+// by the daemon alone: the daemon serves the queues that exist and says
 // which directories it cannot have, and which file looks like a backup.
+// A directory made later (here, where /usr is writable) is read at the
+// next tick.
 TEST_F(DaemonTest, ServesWhatExistsOnAReadOnlyUsr) {
   ASSERT_EQ(std::system("rm -rf /tmp/ro && mkdir /tmp/ro"), 0);
   Register("ro", "/tmp/ro", IN_CREATE);
   ASSERT_TRUE(Put("/usr/zorv/etc/zorvnotifyd/f.bak", "[]"));
-  Daemon daemon({"--json"}, zorv_test::PrivateReadOnlyUsr);
+  Daemon daemon({"--json", "--retry", "0.1"}, zorv_test::PrivateReadOnlyUsr);
   ASSERT_TRUE(daemon.Logged("the configuration directory /usr/zorv/share/zorvnotifyd is missing"));
   ASSERT_TRUE(
       daemon.Logged("queue file etc/f.bak looks like a backup copy, and is loaded like any "
@@ -585,6 +587,11 @@ TEST_F(DaemonTest, ServesWhatExistsOnAReadOnlyUsr) {
   ASSERT_TRUE(daemon.Logged("ready: watching 1 directories for 1 queues"));
   Put("/tmp/ro/x", "x");
   daemon.Expect({"ro etc f /tmp/ro/x " + std::to_string(IN_CREATE)});
+  Register("late", "/tmp/ro", IN_CREATE, nullptr, "g", MONITOR_QUEUE_TYPE_SHARE_DIR);
+  ASSERT_TRUE(daemon.Logged("catalogue reloaded: watching 1 directories for 2 queues"));
+  Put("/tmp/ro/y", "y");
+  daemon.Expect({"late share g /tmp/ro/y " + std::to_string(IN_CREATE),
+                 "ro etc f /tmp/ro/y " + std::to_string(IN_CREATE)});
   EXPECT_EQ(daemon.Stop(SIGTERM), 0);
 }
 
