@@ -6,8 +6,6 @@
 #include <fcntl.h>
 #include <sys/stat.h>
 
-#include <memory>
-
 namespace zorvnotifyd {
 namespace {
 
@@ -37,24 +35,25 @@ UniqueFd OpenBelow(const std::string& root, const std::string& path) {
 
 std::vector<DirEntry> ListDir(int dir) {
   std::vector<DirEntry> entries;
-  // A descriptor of its own, which fdopendir takes over; it shares the
-  // read position with |dir|, which is only ever used for openat.
-  const int own = fcntl(dir, F_DUPFD_CLOEXEC, 0);
-  if (own < 0) return entries;
-  std::unique_ptr<DIR, int (*)(DIR*)> handle(fdopendir(own), closedir);
-  if (!handle) {
-    close(own);
-    return entries;
-  }
-  while (const struct dirent* entry = readdir(handle.get())) {
-    const std::string name = entry->d_name;
-    if (name == "." || name == "..") continue;
-    bool is_dir = entry->d_type == DT_DIR;
-    if (entry->d_type == DT_UNKNOWN) {
-      struct stat st;
-      is_dir = fstatat(dir, name.c_str(), &st, AT_SYMLINK_NOFOLLOW) == 0 && S_ISDIR(st.st_mode);
+  // Straight from the kernel into a buffer on the stack: a DIR stream would
+  // cost a duplicate descriptor, two fcntl calls and a heap buffer for
+  // every directory of a walk.
+  alignas(struct dirent64) char buffer[16 * 1024];
+  for (;;) {
+    const ssize_t n = getdents64(dir, buffer, sizeof(buffer));
+    if (n <= 0) break;  // the end, or a directory that cannot be read further
+    for (ssize_t at = 0; at < n;) {
+      const auto* entry = reinterpret_cast<const struct dirent64*>(buffer + at);
+      at += entry->d_reclen;
+      const char* name = entry->d_name;
+      if (name[0] == '.' && (name[1] == '\0' || (name[1] == '.' && name[2] == '\0'))) continue;
+      bool is_dir = entry->d_type == DT_DIR;
+      if (entry->d_type == DT_UNKNOWN) {
+        struct stat st;
+        is_dir = fstatat(dir, name, &st, AT_SYMLINK_NOFOLLOW) == 0 && S_ISDIR(st.st_mode);
+      }
+      entries.push_back({name, is_dir});
     }
-    entries.push_back({name, is_dir});
   }
   return entries;
 }

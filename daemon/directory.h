@@ -32,8 +32,8 @@ struct DirEntry {
 
 // The entries of the open directory |dir| but "." and "..", in the order
 // the file system gives them.  Reads from |dir|'s position (a directory
-// just opened: all of it) through a duplicate of it, leaving it open.
-// Empty when it cannot be read.
+// just opened: all of it) to the end, leaving it open; |dir| stays usable
+// for openat().  Empty when it cannot be read.
 std::vector<DirEntry> ListDir(int dir);
 
 }  // namespace zorvnotifyd

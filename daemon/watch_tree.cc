@@ -3,13 +3,12 @@
 #include "watch_tree.h"
 
 #include <errno.h>
+#include <fcntl.h>
 #include <poll.h>
 #include <string.h>
 #include <sys/inotify.h>
 #include <syslog.h>
 #include <unistd.h>
-
-#include <cstdio>
 
 #include "directory.h"
 #include "text.h"
@@ -53,9 +52,22 @@ UniqueFd OpenInotify() {
 }
 
 WatchTree::WatchTree(UniqueFd inotify, double retry_seconds)
-    : inotify_(std::move(inotify)), retry_seconds_(retry_seconds) {}
+    : inotify_(std::move(inotify)),
+      home_(open(".", O_PATH | O_DIRECTORY | O_CLOEXEC)),
+      retry_seconds_(retry_seconds) {
+  if (home_.get() < 0) home_ = UniqueFd(open("/", O_PATH | O_DIRECTORY | O_CLOEXEC));
+}
 
 WatchTree::~WatchTree() { Clear(); }
+
+WatchTree::HomeAtReturn::~HomeAtReturn() {
+  if (!tree_.away_) return;
+  tree_.away_ = false;
+  // Else a directory of a tree would stay busy (it could not be unmounted).
+  if (fchdir(tree_.home_.get()) != 0) {
+    syslog(LOG_ERR, "cannot return to the working directory: %s", strerror(errno));
+  }
+}
 
 void WatchTree::Resync() {
   const std::vector<std::string> roots(roots_.begin(), roots_.end());
@@ -65,6 +77,7 @@ void WatchTree::Resync() {
 
 void WatchTree::Sync(const std::vector<std::string>& roots,
                      const ZORV::ZORVNOTIFYD::MonitorQueueIndex& index) {
+  const HomeAtReturn home(*this);
   roots_ = std::set<std::string, std::less<>>(roots.begin(), roots.end());
   index_ = index;
   std::set<int> synced;
@@ -114,6 +127,7 @@ void WatchTree::Sync(const std::vector<std::string>& roots,
 }
 
 void WatchTree::Tick(EventSink& sink) {
+  const HomeAtReturn home(*this);
   for (const std::string& root : roots_) {
     struct stat st;
     const bool exists = stat(root.c_str(), &st) == 0 && S_ISDIR(st.st_mode);
@@ -159,6 +173,7 @@ bool WatchTree::Fill(bool* failed) {
 }
 
 bool WatchTree::ReadEvents(EventSink& sink) {
+  const HomeAtReturn home(*this);
   bool failed = false;
   // At most kReadsPerRound buffers before the caller polls again, so that a
   // steady flood of events cannot keep it from stop signals and reloads.
@@ -324,11 +339,17 @@ int WatchTree::Add(int dir, const struct stat& st, const std::string& path, Walk
   const auto known = by_inode_.find(id);
   const bool exact = context.synced != nullptr &&
                      (known == by_inode_.end() || context.synced->count(known->second) == 0);
-  // The open directory itself, never a path that a link could redirect.
-  char self[40];
-  snprintf(self, sizeof(self), "/proc/self/fd/%d", dir);
+  // The open directory itself, never a path that a link could redirect:
+  // "." while it is the working directory.  (Naming it as /proc/self/fd/N
+  // does the same, at the cost of a walk through /proc that was most of the
+  // daemon's start-up time.)  The public calls go back home as they return.
+  away_ = true;
+  if (fchdir(dir) != 0) {
+    syslog(LOG_WARNING, "cannot watch %s: %s", Quoted(path).c_str(), strerror(errno));
+    return -1;
+  }
   const int wd =
-      inotify_add_watch(fd(), self, wanted | kTreeKeeping | IN_ONLYDIR | (exact ? 0 : IN_MASK_ADD));
+      inotify_add_watch(fd(), ".", wanted | kTreeKeeping | IN_ONLYDIR | (exact ? 0 : IN_MASK_ADD));
   if (wd < 0) {
     if (errno == ENOSPC) {
       ++context.unwatched;

@@ -170,7 +170,20 @@ class WatchTree {
   // Sync again with the same roots and index.
   void Resync();
 
+  // Puts the working directory back to home_ as the public call that made
+  // it returns, if Add moved it: a walk then pays one fchdir per directory.
+  class HomeAtReturn {
+   public:
+    explicit HomeAtReturn(WatchTree& tree) : tree_(tree) {}
+    ~HomeAtReturn();
+
+   private:
+    WatchTree& tree_;
+  };
+
   UniqueFd inotify_;
+  UniqueFd home_;                             // the working directory between public calls
+  bool away_ = false;                         // Add moved the working directory away from home_
   std::set<std::string, std::less<>> roots_;  // the configured trees
   ZORV::ZORVNOTIFYD::MonitorQueueIndex index_{{}};
   std::unordered_map<int, Watch> watches_;           // by watch descriptor

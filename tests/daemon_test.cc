@@ -16,6 +16,7 @@
 
 #include <cstdlib>
 #include <cstring>
+#include <filesystem>
 #include <fstream>
 #include <functional>
 #include <map>
@@ -204,6 +205,10 @@ TEST_F(DaemonTest, ReportsToEachQueueExactlyItsEventsAndFollowsTheCatalogue) {
                  E('a', "w/d/inner/g", kCreate | kModify)});
   Put("/tmp/w/d/inner/k", "x");
   daemon.Expect({E('a', "w/d/inner/k", kCreate), E('a', "w/d/inner/k", kModify)});
+  // Watches are added through the working directory, which is left where
+  // it was (a tree must stay free to unmount).
+  EXPECT_EQ(std::filesystem::read_symlink("/proc/" + std::to_string(daemon.pid()) + "/cwd"),
+            std::filesystem::current_path());
 
   // A directory moved away is no longer watched.
   ASSERT_EQ(rename("/tmp/w/d", "/tmp/d"), 0);
