@@ -144,6 +144,7 @@ TEST(MatchingTest, PreparedQueriesMakeNoHeapAllocation) {
 
 using Shares = std::set<std::string>;
 
+// The share prefix of each configuration path, and their union over queues.
 TEST(ShareSetTest, PrefixesOfEveryConfigurationPath) {
   // A path and the length of its share prefix, which leads it (0: none).
   const std::pair<const char*, std::size_t> rows[] = {

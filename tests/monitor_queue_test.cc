@@ -49,6 +49,7 @@ static std::string State(const std::string& json, const char* cache) {
   return Parse(json).toStyledString() + cache;
 }
 
+// A configuration's defaults, its round trip, and the conversions it refuses.
 TEST(MonitorQueueConfigTest, JsonFormDefaultsAndConversionErrors) {
   // Non-objects, missing keys and an "ignore" that is not an array give the defaults.
   const std::string defaults = State(R"({"path": "", "mask": 0, "ignore": []})", "0");
@@ -63,6 +64,7 @@ TEST(MonitorQueueConfigTest, JsonFormDefaultsAndConversionErrors) {
     EXPECT_THROW(Config{Parse(input)}, std::exception) << input;
 }
 
+// Copies, moves and assignments leave each compiled pattern one owner, freed once.
 TEST(MonitorQueueConfigTest, CompiledPatternsHaveExactlyOneOwner) {
   const char* fields = R"({"path": "/a", "mask": 5, "ignore": ["(", "x", "y"]})";
   {
@@ -100,6 +102,7 @@ TEST(MonitorQueueConfigTest, CompiledPatternsHaveExactlyOneOwner) {
 static std::string Styled(const std::string& text) { return Parse(text).toStyledString(); }
 static std::string Written(const MonitorQueue& queue) { return queue.ToJson().toStyledString(); }
 
+// A queue's defaults, its round trip, and the conversions it refuses.
 TEST(MonitorQueueTest, JsonFormDefaultsAndConversionErrors) {
   // Non-objects, missing keys and a "config" that is not an array give the defaults.
   for (const char* input : {"null", "[]", "\"q\"", "{}", R"({"config": {"path": "/a"}})"})
@@ -116,6 +119,7 @@ TEST(MonitorQueueTest, JsonFormDefaultsAndConversionErrors) {
     EXPECT_THROW(MonitorQueue{Parse(input)}, std::exception) << input;
 }
 
+// Copying a queue copies its configurations' fields and no compiled pattern.
 TEST(MonitorQueueTest, CopiesCarryNoCompiledPatterns) {
   MonitorQueue queue = Parse(R"({"queue": "q", "config": [{"path": "/a", "ignore": ["x"]}]})");
   MonitorQueue assigned = Parse(R"({"queue": "other", "config": [{}, {"ignore": ["y"]}]})");
