@@ -1,6 +1,7 @@
-// The catalogue queries: which directory entries a scan loads, the order of
-// the whole catalogue, what List and Get append or copy, and the lines of
-// their failures.
+// The configuration directory of each queue type (its path, its creation
+// when missing) and the catalogue queries: which directory entries a scan
+// loads, the order of the whole catalogue, what List and Get append or copy,
+// and the lines of their failures, a directory that cannot be made included.
 
 #include <algorithm>
 #include <filesystem>
@@ -18,6 +19,26 @@ namespace ZORV::ZORVNOTIFYD {
 namespace fs = std::filesystem;
 constexpr _tag_monitor_queue_type_ kEtc = MONITOR_QUEUE_TYPE_ETC_DIR;
 const std::string kEtcDir = "/usr/zorv/etc/zorvnotifyd", kLocal = "/usr/local/etc/zorvnotifyd";
+
+// Every call makes a missing directory (0700, parents too) and logs nothing.
+TEST(ConfDirTest, EachTypeHasItsDirectoryCreatedWhenMissing) {
+  ZORV_REQUIRE_SANDBOX();
+  zorv_test::ResetStore();
+  zorv_test::ClearLogs();
+  const std::pair<int, std::string> kCases[] = {
+      {1, kEtcDir}, {3, kEtcDir}, {-1, kEtcDir}, {0, "/usr/zorv/share/zorvnotifyd"}, {2, kLocal}};
+  for (const auto& [type, dir] : kCases) {
+    fs::remove(dir);  // nothing is cached: every call checks again
+    EXPECT_EQ(MonitorQueue::GetConfDir(static_cast<_tag_monitor_queue_type_>(type)), dir) << type;
+    EXPECT_TRUE(fs::is_directory(dir)) << type;
+    for (const fs::path& made : {fs::path(dir), fs::path("/usr/zorv"), fs::path("/usr/zorv/etc")})
+      EXPECT_EQ(fs::status(made).permissions(), fs::perms(0700)) << made;  // parents too
+  }
+  fs::permissions(kLocal, fs::perms(0751));  // an existing directory keeps its mode
+  EXPECT_EQ(MonitorQueue::GetConfDir(MONITOR_QUEUE_TYPE_LOCAL_ETC_DIR), kLocal);
+  EXPECT_EQ(fs::status(kLocal).permissions(), fs::perms(0751));
+  EXPECT_EQ(zorv_test::DumpLogs(), "");
+}
 
 // Writes queue file |file| of |type|, its directory created as needed.
 static void Write(int type, const std::string& file, const std::string& text) {
@@ -87,6 +108,9 @@ TEST(CatalogueTest, LoadAllListAndGetReadTheFilesInOrder) {
   fs::remove_all(kLocal);  // a directory that cannot be listed fails its type only
   std::ofstream(kLocal) << R"([{"queue": "l"}])";
   EXPECT_FALSE(MonitorQueue::LoadAll(queues));
+  EXPECT_TRUE(fs::is_regular_file(kLocal));  // a file in the directory's way is left in place
+  EXPECT_EQ(zorv_test::LogsContaining("conf dir").at(0).format,
+            "%s:%d Failed to create conf dir: %s");
   EXPECT_EQ(Seen(queues),
             "s,a,b,a,3 No such monitor queue: c\n3 No such monitor queue: A\n"
             "3 No such monitor queue: a\n3 LoadFromFile failed, path=" +

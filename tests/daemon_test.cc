@@ -259,19 +259,17 @@ TEST_F(DaemonTest, ServesEveryPathOfADirectoryAndNothingItCannotHonour) {
   ASSERT_EQ(mount("/tmp/w", "/tmp/bind", nullptr, MS_BIND, nullptr), 0);
   const unsigned mask = IN_CREATE | IN_MOVED_FROM | IN_MOVED_TO | IN_ATTRIB;
   for (const char* path : {"/tmp/w", "/tmp/link", "/tmp/bind"}) Register(path + 5, path, mask);
+  // The daemon shares zorvnotifyctl's path check, whose every reason the tool's
+  // test goes through; one path shows that the daemon skips on it.
   Register("slash", "/tmp/w/", mask);
-  Register("root", "/", mask);
-  Register("empty", "", mask);
   Register("unmount", "/tmp/w", IN_UNMOUNT);
   Daemon daemon({"--stdout"});
   for (const char* line :
        {"skipping configuration \"/tmp/w/\" of queue \"slash\" (etc/f): it ends in \"/\", which no "
         "reported path can match; write it as \"/tmp/w\"",
-        "skipping configuration \"/\" of queue \"root\" (etc/f): it is the root directory",
-        "skipping configuration \"\" of queue \"empty\" (etc/f): it is empty",
         "skipping configuration \"/tmp/w\" of queue \"unmount\" (etc/f): its mask 0x2000 holds no "
         "event kind",
-        "ready: watching 1 directories for 7 queues"}) {
+        "ready: watching 1 directories for 5 queues"}) {
     ASSERT_TRUE(daemon.Logged(line)) << line;
   }
 
@@ -590,8 +588,6 @@ TEST_F(DaemonTest, ServesWhatExistsOnAReadOnlyUsr) {
       daemon.Logged("queue file etc/f.bak looks like a backup copy, and is loaded like any "
                     "queue file: remove it or move it out of the directory"));
   ASSERT_TRUE(daemon.Logged("ready: watching 1 directories for 1 queues"));
-  Put("/tmp/ro/x", "x");
-  daemon.Expect({"ro etc f /tmp/ro/x " + std::to_string(IN_CREATE)});
   Register("late", "/tmp/ro", IN_CREATE, nullptr, "g", MONITOR_QUEUE_TYPE_SHARE_DIR);
   ASSERT_TRUE(daemon.Logged("catalogue reloaded: watching 1 directories for 2 queues"));
   Put("/tmp/ro/y", "y");

@@ -1,11 +1,14 @@
 // Path matching: the order of the mask, prefix, boundary and pattern tests,
 // lazy compilation of ignore patterns, directory and union-mask queries, and
-// that prepared queries make no C++ heap allocation.
+// that prepared queries make no C++ heap allocation.  The share set: the
+// first two components of each absolute configuration path, byte for byte,
+// gathered without duplicates.
 
 #include <gtest/gtest.h>
 
 #include <cstdlib>
 #include <new>
+#include <set>
 #include <tuple>
 
 #include "monitor_queue.h"
@@ -137,6 +140,32 @@ TEST(MatchingTest, PreparedQueriesMakeNoHeapAllocation) {
   for (const std::string& dir : dirs) answers += queue.IsDirMonitoring(dir);
   EXPECT_EQ(g_allocations - before, 0);
   EXPECT_EQ(answers, 3);  // report.txt, archivex and /volume1/share
+}
+
+using Shares = std::set<std::string>;
+
+// The share prefix of each configuration path, and their union over queues.
+TEST(ShareSetTest, PrefixesOfEveryConfigurationPath) {
+  // A path and the length of its share prefix, which leads it (0: none).
+  const std::pair<const char*, std::size_t> rows[] = {
+      {"/vol/share/a/b", 10}, {"/vol/share", 10}, {"/vol/share/", 10},
+      {"/vol/", 5},           {"/vol", 0},        {"/", 0},
+      {"vol/share", 0},       {"//x", 3},         {"//x/y", 3},
+      {"/a//b", 3},           {"//", 2},
+  };
+  for (const auto& [path, length] : rows) {
+    Shares shares = {"/held"};  // what the set held stays
+    MakeQueue({{path, 0}}).CollectShareSet(shares);
+    EXPECT_EQ(shares, (length ? Shares{"/held", std::string(path, length)} : Shares{"/held"}))
+        << path;
+  }
+  // GetShareSet joins every configuration of every queue.
+  const MonitorQueue first = MakeQueue({{"/vol/share/a", 0}, {"/x", 0}, {"/vol/share/b", 0}});
+  const MonitorQueue second =
+      MakeQueue({{"/vol/share", 0}, {"/pub/docs/", 0}, {"rel/a", 0}, {"", 0}});
+  EXPECT_EQ(MonitorQueue::GetShareSet({first, second}), (Shares{"/pub/docs", "/vol/share"}));
+  EXPECT_TRUE(MonitorQueue::GetShareSet({}).empty() &&
+              MonitorQueue::GetShareSet({MakeQueue({}), MakeQueue({})}).empty());
 }
 
 }  // namespace ZORV::ZORVNOTIFYD

@@ -1,13 +1,37 @@
-// Tests of the monitor queue record: JSON form and copies without compiled
-// patterns.
+// Tests of the monitor queue record and its watch configurations: JSON form
+// and ownership of the compiled-pattern cache.
 
+#include <dlfcn.h>
+
+#include <set>
 #include <sstream>
 
 #include <gtest/gtest.h>
 
 #include "monitor_queue.h"
 
+// The compiled programs (what a regex_t points to; the regex_t itself is
+// copied around) that are alive.  These definitions take the place of the C
+// library's for the shared library too, so a pattern freed twice or never
+// fails a test, not only a sanitizer.
+static std::set<const void*> live_patterns;
+
+extern "C" int regcomp(regex_t* preg, const char* pattern, int cflags) {
+  static auto real = reinterpret_cast<decltype(&regcomp)>(dlsym(RTLD_NEXT, "regcomp"));
+  const int rc = real(preg, pattern, cflags);
+  if (rc == 0) live_patterns.insert(preg->buffer);
+  return rc;
+}
+
+extern "C" void regfree(regex_t* preg) {
+  static auto real = reinterpret_cast<decltype(&regfree)>(dlsym(RTLD_NEXT, "regfree"));
+  if (live_patterns.erase(preg->buffer) == 0) ADD_FAILURE() << "regfree of a dead pattern";
+  real(preg);
+}
+
 namespace ZORV::ZORVNOTIFYD {
+
+using Config = MonitorQueue::MonitorQueueConfig;
 
 static Json::Value Parse(const std::string& text) {
   Json::Value value;
@@ -15,9 +39,70 @@ static Json::Value Parse(const std::string& text) {
   return value;
 }
 
+// A record's JSON form followed by the state of its cache: the number of
+// compiled patterns, then " prepared" when it is prepared.
+static std::string State(const Config& c) {
+  return c.ToJson().toStyledString() + std::to_string(c._regexes.size()) +
+         (c._prepared ? " prepared" : "");
+}
+static std::string State(const std::string& json, const char* cache) {
+  return Parse(json).toStyledString() + cache;
+}
+
+// A configuration's defaults, its round trip, and the conversions it refuses.
+TEST(MonitorQueueConfigTest, JsonFormDefaultsAndConversionErrors) {
+  // Non-objects, missing keys and an "ignore" that is not an array give the defaults.
+  const std::string defaults = State(R"({"path": "", "mask": 0, "ignore": []})", "0");
+  for (const char* input : {"null", "[]", "\"text\"", "{}", R"({"ignore": "x.*", "other": 1})",
+                            R"({"ignore": {"k": "x"}})"})
+    EXPECT_EQ(State(Config(Parse(input))), defaults) << input;
+  // A round trip keeps every field, a trailing "/" of the path included.
+  const char* full = R"({"path": "/vol/share/", "mask": 4294967295, "ignore": ["(", "a$", "a$"]})";
+  EXPECT_EQ(State(Config(Config(Parse(full)).ToJson())), State(full, "0"));
+  for (const char* input :
+       {R"({"path": ["x"]})", R"({"mask": -1})", R"({"path": "/a", "ignore": ["x", {}]})"})
+    EXPECT_THROW(Config{Parse(input)}, std::exception) << input;
+}
+
+// Copies, moves and assignments leave each compiled pattern one owner, freed once.
+TEST(MonitorQueueConfigTest, CompiledPatternsHaveExactlyOneOwner) {
+  const char* fields = R"({"path": "/a", "mask": 5, "ignore": ["(", "x", "y"]})";
+  {
+    Config original = Parse(fields), target = Parse(R"({"ignore": ["z"]})");
+    original.PrepareRegex();  // "(" does not compile: dropped, its text kept
+    target.PrepareRegex();
+    EXPECT_EQ(State(original), State(fields, "2 prepared"));
+    const void* program = original._regexes[0].buffer;
+
+    // Copies never carry compiled patterns; assignment releases the target's own.
+    Config copy(original);
+    target = original;
+    for (Config* copied : {&copy, &target}) EXPECT_EQ(State(*copied), State(fields, "0"));
+    EXPECT_EQ(live_patterns.size(), 2u);
+
+    // Moves transfer them and leave the source its mask only.
+    Config moved(std::move(original));
+    target.PrepareRegex();
+    target = std::move(moved);
+    EXPECT_EQ(State(target), State(fields, "2 prepared"));
+    EXPECT_TRUE(target._regexes[0].buffer == program && live_patterns.size() == 2);
+    EXPECT_EQ(State(original), State(R"({"path": "", "mask": 5, "ignore": []})", "0"));
+    EXPECT_TRUE(moved._ignore.empty() && moved._regexes.empty() && !moved._prepared);
+
+    original = target;  // a moved-from record may be assigned to
+    Config& self = target;
+    target = self;  // discards the compiled patterns and nothing else
+    for (Config* copied : {&target, &original}) EXPECT_EQ(State(*copied), State(fields, "0"));
+    EXPECT_TRUE(live_patterns.empty());
+    target.PrepareRegex();  // released by the destructor
+  }
+  EXPECT_TRUE(live_patterns.empty()) << live_patterns.size() << " compiled patterns not released";
+}
+
 static std::string Styled(const std::string& text) { return Parse(text).toStyledString(); }
 static std::string Written(const MonitorQueue& queue) { return queue.ToJson().toStyledString(); }
 
+// A queue's defaults, its round trip, and the conversions it refuses.
 TEST(MonitorQueueTest, JsonFormDefaultsAndConversionErrors) {
   // Non-objects, missing keys and a "config" that is not an array give the defaults.
   for (const char* input : {"null", "[]", "\"q\"", "{}", R"({"config": {"path": "/a"}})"})
@@ -34,6 +119,7 @@ TEST(MonitorQueueTest, JsonFormDefaultsAndConversionErrors) {
     EXPECT_THROW(MonitorQueue{Parse(input)}, std::exception) << input;
 }
 
+// Copying a queue copies its configurations' fields and no compiled pattern.
 TEST(MonitorQueueTest, CopiesCarryNoCompiledPatterns) {
   MonitorQueue queue = Parse(R"({"queue": "q", "config": [{"path": "/a", "ignore": ["x"]}]})");
   MonitorQueue assigned = Parse(R"({"queue": "other", "config": [{}, {"ignore": ["y"]}]})");
@@ -46,6 +132,7 @@ TEST(MonitorQueueTest, CopiesCarryNoCompiledPatterns) {
     EXPECT_TRUE(!copied->_configs[0]._prepared && copied->_configs[0]._regexes.empty());
   }
   EXPECT_EQ(queue._configs[0]._regexes.size(), 1u);  // the source keeps its own
+  EXPECT_EQ(live_patterns.size(), 1u);
 }
 
 }  // namespace ZORV::ZORVNOTIFYD

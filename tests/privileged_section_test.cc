@@ -98,6 +98,7 @@ TEST(PrivilegedSectionTest, CallerThatCannotBecomeRootTouchesNothing) {
         zorv_test::RunAs(kMayNot, [&] { return op() ? -1 : static_cast<int>(queues.size()); });
     ASSERT_TRUE(child.exited) << child.error;
     EXPECT_EQ(child.result, &op == &kOps[3] ? 0 : 1) << &op - kOps;
+    EXPECT_EQ(child.after, kMayNot) << &op - kOps;
     EXPECT_NE(Messages(child.logs).find(kDenied), std::string::npos) << &op - kOps;
     for (const char* path : {"/tmp/zorvnotifyd_monitor_q.lock", "/tmp/new", "/usr/zorv"})
       EXPECT_NE(access(path, F_OK), 0) << path;

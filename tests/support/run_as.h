@@ -39,9 +39,9 @@ struct ChildResult {
 
 // Forks.  The child forgets the captured lines, drops its supplementary
 // groups, sets its gids then its uids to |ids| with setresgid/setresuid (the
-// caller must be root), runs |fn|, records errno and its ids at once, sends
-// everything to the parent through a pipe and _exit(0)s.  Returns after the
-// child has been reaped.  gtest assertions made inside |fn| are lost with the
+// caller must be root), runs |fn|, records errno and its ids at once, hands
+// everything to the parent in shared memory and _exit(0)s.  Returns after
+// the child has been reaped.  gtest assertions made inside |fn| are lost with the
 // child: report through the result instead.
 ChildResult RunAs(const Ids& ids, const std::function<int()>& fn);
 
