@@ -63,9 +63,9 @@ double Now() {
   return ts.tv_sec + ts.tv_nsec / 1e9;
 }
 
-// Runs |argv| and returns its exit status: 128 + signal when it was killed,
-// 124 when it was still running after |timeout| seconds, 127 when it could not
-// be started.
+// Runs |args| and returns its exit status: 128 + signal when it was killed,
+// 124 when it was still running after |timeout| seconds (its process group
+// is then killed), 127 when it could not be started.
 int Run(std::vector<std::string> args, int timeout) {
   std::vector<char*> argv;
   for (std::string& arg : args) argv.push_back(arg.data());
@@ -84,22 +84,31 @@ int Run(std::vector<std::string> args, int timeout) {
   }
   setpgid(pid, pid);
   const double deadline = Now() + timeout;
+  bool ended = false, timed_out = false;
   int status = 0;
-  for (;;) {
-    const pid_t done = waitpid(pid, &status, WNOHANG);
-    if (done == pid) break;
-    if (done < 0 && errno != EINTR) return 127;
-    if (Now() > deadline) {
+  while (!ended) {
+    // As the first process, collects every orphan too: a test that waits
+    // for a grandchild to vanish must not find it a zombie.
+    for (int any = 0;;) {
+      const pid_t done = waitpid(-1, &any, WNOHANG);
+      if (done <= 0) break;
+      if (done == pid) {
+        ended = true;
+        status = any;
+      }
+    }
+    if (!ended && Now() > deadline) {
       printf("init: %s still running after %d s: killed\n", program.c_str(), timeout);
       kill(-pid, SIGKILL);
-      waitpid(pid, &status, 0);
-      status = 124;
-      break;
+      timed_out = true;
+      while (waitpid(pid, &status, 0) < 0 && errno == EINTR) {
+      }
+      ended = true;
     }
-    usleep(50 * 1000);
+    if (!ended) usleep(50 * 1000);
   }
   kill(-pid, SIGKILL);  // whatever the program left running in its group
-  if (status == 124) return 124;
+  if (timed_out) return 124;
   return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
 }
 
