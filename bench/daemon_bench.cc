@@ -527,10 +527,29 @@ std::string BurstLabel(int queues) {
          "events)";
 }
 
-void SetCpuCounters(benchmark::State& state, int64_t cpu_ns, long user, long system) {
+// Runs the burst once per iteration, |wait_for_end| returning once |child|
+// has every event, and reports |child|'s CPU time over the last one: per
+// event, in all, the user share, and the wall time.
+template <typename WaitForEnd>
+void TimeBurst(benchmark::State& state, const Child& child, WaitForEnd wait_for_end) {
+  int64_t cpu_ns = 0;
+  long user0 = 0, system0 = 0, user1 = 0, system1 = 0;
+  double wall = 0;
+  for (auto _ : state) {
+    child.Ticks(&user0, &system0);
+    const int64_t cpu0 = child.CpuNs();
+    const auto start = Clock::now();
+    Burst();
+    wait_for_end();
+    cpu_ns = child.CpuNs() - cpu0;
+    wall = std::chrono::duration<double>(Clock::now() - start).count();
+    child.Ticks(&user1, &system1);
+  }
+  const long user = user1 - user0, system = system1 - system0;
   state.counters["cpu_ns_per_event"] = double(cpu_ns) / double(kKernelEvents);
   state.counters["cpu_ms"] = double(cpu_ns) / 1e6;
   state.counters["user_share"] = user + system > 0 ? double(user) / double(user + system) : 0;
+  state.counters["wall_ms"] = wall * 1e3;
 }
 
 // The daemon's CPU time over a burst, its clients subscribed.
@@ -556,21 +575,8 @@ void DaemonBurst(benchmark::State& state, int queues) {
     return;
   }
   const Json::Value before = Status();
-  int64_t cpu_ns = 0;
-  long user0 = 0, system0 = 0, user1 = 0, system1 = 0;
-  double wall = 0;
-  for (auto _ : state) {
-    daemon.Ticks(&user0, &system0);
-    const int64_t cpu0 = daemon.CpuNs();
-    const auto start = Clock::now();
-    Burst();
-    WaitCount(clients.events, catalogue->expected_lines);
-    cpu_ns = daemon.CpuNs() - cpu0;
-    wall = std::chrono::duration<double>(Clock::now() - start).count();
-    daemon.Ticks(&user1, &system1);
-  }
+  TimeBurst(state, daemon, [&] { WaitCount(clients.events, catalogue->expected_lines); });
   const Json::Value after = Status();
-  SetCpuCounters(state, cpu_ns, user1 - user0, system1 - system0);
   state.counters["events_lost"] =
       double(catalogue->expected_lines) -
       double(std::min<uint64_t>(clients.events, catalogue->expected_lines));
@@ -580,7 +586,6 @@ void DaemonBurst(benchmark::State& state, int queues) {
   state.counters["lost_notices"] = double(clients.lost);
   state.counters["kernel_events"] = after["events"].asDouble() - before["events"].asDouble();
   state.counters["overflows"] = after["overflows"].asDouble() - before["overflows"].asDouble();
-  state.counters["wall_ms"] = wall * 1e3;
   state.SetLabel(BurstLabel(queues));
 }
 
@@ -598,35 +603,23 @@ void BareBurst(benchmark::State& state, int queues) {
     state.SkipWithError(("the bare reader did not start as expected: " + bare.Output()).c_str());
     return;
   }
-  int64_t cpu_ns = 0;
-  long user0 = 0, system0 = 0, user1 = 0, system1 = 0;
   std::string done;
-  double wall = 0;
-  for (auto _ : state) {
-    bare.Ticks(&user0, &system0);
-    const int64_t cpu0 = bare.CpuNs();
-    const auto start = Clock::now();
-    Burst();
+  TimeBurst(state, bare, [&] {
     done = bare.WaitFor("done ", std::chrono::seconds(1));
     // Not every event came: stop it (SIGUSR1 ends its read).
     for (int tries = 0; done.empty() && tries < 50; ++tries) {
       kill(bare.pid(), SIGUSR1);
       done = bare.WaitFor("done ", std::chrono::milliseconds(100));
     }
-    cpu_ns = bare.CpuNs() - cpu0;
-    wall = std::chrono::duration<double>(Clock::now() - start).count();
-    bare.Ticks(&user1, &system1);
-  }
+  });
   unsigned long count = 0, overflows = 0;
   if (std::sscanf(done.c_str(), "done %lu %lu", &count, &overflows) != 2) {
     state.SkipWithError("the bare reader did not say what it read");
     return;
   }
-  SetCpuCounters(state, cpu_ns, user1 - user0, system1 - system0);
   state.counters["events_lost"] = double(kKernelEvents - std::min<uint64_t>(count, kKernelEvents));
   state.counters["kernel_events"] = double(count);
   state.counters["overflows"] = double(overflows);
-  state.counters["wall_ms"] = wall * 1e3;
   state.SetLabel("bare inotify reader process, the same watches and masks: read and count");
 }
 
