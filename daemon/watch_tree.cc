@@ -224,14 +224,26 @@ void WatchTree::Handle(const RawEvent& event, EventSink& sink) {
     return;
   }
   if (event.mask & IN_DELETE_SELF) watch.gone = "deleted";
-  // Handling may change the paths: work on a copy.
+  // Reporting changes no watch, so the paths are read in place and the
+  // path of the entry is built in a buffer kept between events: a file's
+  // event costs no allocation here.
+  for (const std::string& path : watch.paths) {
+    if (ToldByParent(path, event)) continue;
+    if (event.name.empty()) {
+      sink.Event(path, event.mask);
+      continue;
+    }
+    entry_path_.assign(path).append(1, '/').append(event.name);
+    sink.Event(entry_path_, event.mask);
+  }
+  const bool is_dir = (event.mask & IN_ISDIR) != 0;
+  if (!is_dir && (event.mask & IN_MOVE_SELF) == 0) return;
+  // What follows may change the paths: work on copies.
   const std::vector<std::string> paths(watch.paths.begin(), watch.paths.end());
   std::vector<std::string> targets;
   for (const std::string& path : paths) {
     targets.push_back(event.name.empty() ? path : path + "/" + event.name);
-    if (!ToldByParent(path, event)) sink.Event(targets.back(), event.mask);
   }
-  const bool is_dir = (event.mask & IN_ISDIR) != 0;
   if (is_dir && (event.mask & IN_MOVED_FROM)) {
     // The other half of a move within the trees follows at once in the
     // queue; when it is not there, the directory left the trees.

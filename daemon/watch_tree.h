@@ -193,6 +193,7 @@ class WatchTree {
   std::map<std::string, size_t> limited_;            // roots the watch limit kept partly unwatched
   std::deque<RawEvent> pending_;                     // events read but not yet handled
   std::set<uint32_t> moves_;  // cookies of directory moves within the trees, already done
+  std::string entry_path_;    // Handle's buffer for the path of an event's entry
   double retry_seconds_;
 };
 

@@ -74,7 +74,7 @@ struct Scratch {
   }
 };
 
-thread_local Scratch scratch;
+thread_local Scratch g_match_scratch;
 
 }  // namespace
 
@@ -189,6 +189,8 @@ void MonitorQueueIndex::Match(const std::string& path, unsigned int mask,
   out.clear();
   if (mask == 0) return;  // no configuration shares a bit with it
   const MonitorQueueIndexData& data = *data_;
+  // One lookup of the thread's scratch, not one per use inside the loops.
+  Scratch& scratch = g_match_scratch;
   scratch.Begin(data.patterns.size(), data.queues);
   const uint32_t call = scratch.call;
   data.ForEachAncestor(path, [&](const IndexNode& node) {
