@@ -3,6 +3,7 @@
 #include "json_bytes.h"
 
 #include <cstdio>
+#include <utility>
 
 namespace zorvcommon {
 namespace {
@@ -108,12 +109,13 @@ void DecodeRawBytes(Json::Value* value) {
     for (Json::Value& element : *value) DecodeRawBytes(&element);
   } else if (value->isObject()) {
     Json::Value decoded(Json::objectValue);
+    // Each member moved, not copied: a deep document is walked once.
     for (const std::string& key : value->getMemberNames()) {
-      Json::Value member = (*value)[key];
+      Json::Value& member = (*value)[key];
       DecodeRawBytes(&member);
-      decoded[DecodeRawBytes(key)] = member;
+      decoded[DecodeRawBytes(key)] = std::move(member);
     }
-    *value = decoded;
+    *value = std::move(decoded);
   }
 }
 

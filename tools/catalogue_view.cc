@@ -2,14 +2,9 @@
 
 #include "catalogue_view.h"
 
-#include <dirent.h>
-#include <sys/stat.h>
-
-#include <algorithm>
 #include <cerrno>
 #include <cstring>
 #include <iostream>
-#include <memory>
 
 #include "queue_files.h"
 #include "text.h"
@@ -17,8 +12,6 @@
 namespace zorvnotifyctl {
 
 using ZORV::ZORVNOTIFYD::MonitorQueue;
-
-namespace {}  // namespace
 
 bool LoadCatalogue(std::vector<TypedQueue>* queues) {
   queues->clear();

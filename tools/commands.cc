@@ -36,14 +36,10 @@ namespace {
 
 using ZORV::ZORVNOTIFYD::MonitorQueue;
 using ZORV::ZORVNOTIFYD::MonitorQueueIndex;
+using zorvcommon::Quoted;
 
 // Set once an upsert or delete has been stored.
 bool g_store_changed = false;
-
-// |text| in double quotes, control bytes escaped, for messages.
-std::string Quoted(const std::string& text) {
-  return text.empty() ? "\"\"" : "\"" + Printable(text) + "\"";
-}
 
 // "queue file "F" of type T", for messages.
 std::string FileLabel(const Invocation& invocation, const std::string& file) {
@@ -116,14 +112,6 @@ Json::Value WriteResult(const Invocation& invocation, const std::string& file,
   return result;
 }
 
-// Runs |store| (one Upsert or Delete of the library) until it succeeds,
-// fails for a reason other than the store lock held by another writer, or
-// |invocation.wait| seconds have passed.  Each call is a whole load, change
-// and save under the lock, so calling it again is safe.  Returns true when
-// stored; otherwise |status| is set: kExitBusy, with the lock's holder
-// named, when the lock stayed held (the library's own "Lock failed" lines
-// are then left out), else kExitRefused with |failure| (the library's
-// message precedes it).
 // Why nothing could be written in the configuration directory of |type|,
 // when its file system says so: ": the file system holding DIR is
 // read-only" or "... is full"; otherwise "" (the library's lines say why).
@@ -138,6 +126,14 @@ std::string WhyNotWritten(QueueType type) {
   return "";
 }
 
+// Runs |store| (one Upsert or Delete of the library) until it succeeds,
+// fails for a reason other than the store lock held by another writer, or
+// |invocation.wait| seconds have passed.  Each call is a whole load, change
+// and save under the lock, so calling it again is safe.  Returns true when
+// stored; otherwise |status| is set: kExitBusy, with the lock's holder
+// named, when the lock stayed held (the library's own "Lock failed" lines
+// are then left out), else kExitRefused with |failure| (the library's
+// message precedes it).
 bool StoreWithRetry(const Invocation& invocation, const std::function<bool()>& store,
                     const std::string& failure, int* status) {
   using Clock = std::chrono::steady_clock;
@@ -556,9 +552,8 @@ int RunShares(const Invocation& invocation) {
   std::vector<TypedQueue> typed;
   int status = kExitOk;
   if (!LoadCatalogueOrFail(&typed, &status)) return status;
-  std::vector<MonitorQueue> queues;
-  for (const TypedQueue& entry : typed) queues.push_back(entry.queue);
-  const std::set<std::string> shares = MonitorQueue::GetShareSet(queues);
+  std::set<std::string> shares;
+  for (const TypedQueue& entry : typed) entry.queue.CollectShareSet(shares);
   if (invocation.json) {
     Json::Value array(Json::arrayValue);
     for (const std::string& share : shares) array.append(share);

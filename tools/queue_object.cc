@@ -86,7 +86,8 @@ std::string PatternProblem(const std::string& pattern, const std::string& where)
   }
   char reason[256];
   regerror(status, &compiled, reason, sizeof(reason));
-  return where + " \"" + pattern + "\" is not a valid extended regular expression: " + reason;
+  return where + " " + zorvcommon::Quoted(pattern) +
+         " is not a valid extended regular expression: " + reason;
 }
 
 std::string MaskProblem(const Json::Value& mask, const std::string& where) {
