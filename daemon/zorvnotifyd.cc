@@ -55,8 +55,8 @@ const char kUsage[] =
     "\n"
     "The daemon runs in the foreground and never forks: start it from a service\n"
     "manager (zorvnotifyd.service for systemd, which it tells when it is ready).  It\n"
-    "needs root.  It reloads the catalogue when a queue file changes and stops on\n"
-    "SIGTERM or SIGINT (status 0).  Log lines go to syslog and to standard error.\n";
+    "needs root.  It reloads the catalogue when a queue file changes or on SIGHUP,\n"
+    "and stops on SIGTERM or SIGINT (status 0).  Log lines go to syslog and to standard error.\n";
 
 constexpr double kDefaultRetrySeconds = 5;
 
@@ -67,15 +67,18 @@ int64_t NowMs() {
   return int64_t(now.tv_sec) * 1000 + now.tv_nsec / 1000000;
 }
 
-// Blocks SIGTERM and SIGINT and returns a descriptor that reads them, or an
-// empty one (logged).
+// Blocks SIGTERM, SIGINT and SIGHUP and returns a descriptor that reads
+// them, or an empty one (logged).  SIGHUP asks for a reload: left to its
+// default action it would end the daemon with a status that a service
+// manager counts as a clean exit, so nothing would start it again.
 UniqueFd OpenSignals() {
   sigset_t signals;
   sigemptyset(&signals);
   sigaddset(&signals, SIGTERM);
   sigaddset(&signals, SIGINT);
+  sigaddset(&signals, SIGHUP);
   if (sigprocmask(SIG_BLOCK, &signals, nullptr) != 0) {
-    syslog(LOG_ERR, "cannot block SIGTERM and SIGINT: %s", strerror(errno));
+    syslog(LOG_ERR, "cannot block SIGTERM, SIGINT and SIGHUP: %s", strerror(errno));
     return UniqueFd();
   }
   UniqueFd fd(signalfd(-1, &signals, SFD_NONBLOCK | SFD_CLOEXEC));
@@ -168,8 +171,14 @@ int Serve(const Options& options) {
       return 1;
     }
     struct signalfd_siginfo info;
+    uint32_t signal_number = 0;
     if (ready > 0 && (fds[0].revents & POLLIN) &&
         read(signals.get(), &info, sizeof(info)) == sizeof(info)) {
+      signal_number = info.ssi_signo;
+    }
+    const bool hangup = signal_number == SIGHUP;
+    if (hangup) syslog(LOG_INFO, "reloading the catalogue on SIGHUP");
+    if (signal_number != 0 && !hangup) {
       NotifyServiceManager("STOPPING=1");
       syslog(LOG_INFO, "stopping on %s: releasing %zu watches", strsignal(int(info.ssi_signo)),
              tree.size());
@@ -180,8 +189,8 @@ int Serve(const Options& options) {
     // A configuration directory that was missing (a read-only /usr) and
     // exists now is read as soon as the next tick finds it.
     const bool tick = NowMs() >= next_tick;
-    if ((ready > 0 && (fds[2].revents & POLLIN) && catalogue_watch.ReadChanges()) ||
-        (tick && catalogue_watch.WatchMissing())) {
+    const bool changed = ready > 0 && (fds[2].revents & POLLIN) && catalogue_watch.ReadChanges();
+    if (hangup || changed || (tick && catalogue_watch.WatchMissing())) {
       NotifyServiceManager("RELOADING=1");
       load();
       syslog(LOG_INFO, "catalogue reloaded: watching %zu directories for %zu queues", tree.size(),

@@ -244,6 +244,12 @@ TEST_F(DaemonTest, ReportsToEachQueueExactlyItsEventsAndFollowsTheCatalogue) {
                   "[{\"queue\": \"c\", \"config\": [{\"path\": \"/tmp/w2\", \"mask\": 256}]}]"));
   ASSERT_TRUE(daemon.Logged("queue file local-etc/fc loads again: 1 queues"));
 
+  // SIGHUP reloads, as the service manager's reload asks; it never ends the
+  // daemon.
+  ASSERT_EQ(kill(daemon.pid(), SIGHUP), 0);
+  ASSERT_TRUE(daemon.Logged("reloading the catalogue on SIGHUP"));
+  ASSERT_TRUE(daemon.Logged("catalogue reloaded: watching 3 directories for 3 queues"));
+
   EXPECT_EQ(daemon.Stop(SIGTERM), 0);
   EXPECT_EQ(daemon.Read(), "") << "a line after the last expected one";
   const Lines stopping = manager.Until("STOPPING=1");
