@@ -66,7 +66,8 @@ static int LockFileDescriptors() {
   return count;
 }
 
-TEST(StoreLockTest, LockIsExclusiveAndLeavesTheFileAlone) {
+// Exclusion, the lock file left alone, and the retries of a held or replaced lock.
+TEST(StoreLockTest, LockIsExclusiveLeavesTheFileAloneAndRetriesFiveTimes) {
   ZORV_REQUIRE_SANDBOX();
   zorv_test::ResetStore();
   int fd = -1, other = -1;
@@ -93,16 +94,12 @@ TEST(StoreLockTest, LockIsExclusiveAndLeavesTheFileAlone) {
   EXPECT_FALSE(Lock(fd, kLockFile));
   EXPECT_LT(fd, 0);
   EXPECT_FALSE(fs::exists("/tmp/target"));
-}
+  fs::remove(kLockFile);
 
-// A lock held past the five attempts is not taken; one released during them
-// is.  A lock on a file replaced since its open counts as held: the
-// descriptor left is one of the file at the path, and no attempt leaves one
-// behind.
-TEST(StoreLockTest, LockHeldOrReplacedIsRetriedFiveTimes) {
-  ZORV_REQUIRE_SANDBOX();
-  zorv_test::ResetStore();
-  // Held by another process or replaced before the flock; released never or at that draw.
+  // Held by another process or replaced before the flock, released never or
+  // at that draw: a lock held past the five attempts is not taken, one
+  // released during them is.  A lock on a replaced file counts as held; the
+  // descriptor left is one of the file at the path, and no attempt leaves one.
   const std::pair<bool, int> kCases[] = {{false, 0}, {false, 3}, {true, 0}, {true, 2}};
   for (const auto& [replace, release_at] : kCases) {
     SCOPED_TRACE(std::to_string(replace) + " " + std::to_string(release_at));
@@ -117,7 +114,6 @@ TEST(StoreLockTest, LockHeldOrReplacedIsRetriedFiveTimes) {
     g_draws = 0;
     g_release_at = release_at;
     g_replace = replace;
-    int fd = -1;
     EXPECT_EQ(Lock(fd, kLockFile), release_at != 0);
     EXPECT_EQ(g_draws, release_at ? release_at : 5);
     // The failed attempts closed theirs; the writer after a replacement may hold one.
