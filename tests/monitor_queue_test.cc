@@ -50,21 +50,6 @@ static std::string State(const std::string& json, const char* cache) {
   return Parse(json).toStyledString() + cache;
 }
 
-// A configuration's defaults, its round trip, and the conversions it refuses.
-TEST(MonitorQueueConfigTest, JsonFormDefaultsAndConversionErrors) {
-  // Non-objects, missing keys and an "ignore" that is not an array give the defaults.
-  const std::string defaults = State(R"({"path": "", "mask": 0, "ignore": []})", "0");
-  for (const char* input : {"null", "[]", "\"text\"", "{}", R"({"ignore": "x.*", "other": 1})",
-                            R"({"ignore": {"k": "x"}})"})
-    EXPECT_EQ(State(Config(Parse(input))), defaults) << input;
-  // A round trip keeps every field, a trailing "/" of the path included.
-  const char* full = R"({"path": "/vol/share/", "mask": 4294967295, "ignore": ["(", "a$", "a$"]})";
-  EXPECT_EQ(State(Config(Config(Parse(full)).ToJson())), State(full, "0"));
-  for (const char* input :
-       {R"({"path": ["x"]})", R"({"mask": -1})", R"({"path": "/a", "ignore": ["x", {}]})"})
-    EXPECT_THROW(Config{Parse(input)}, std::exception) << input;
-}
-
 // Copies, moves and assignments of configurations and queues leave each
 // compiled pattern one owner, freed once.
 TEST(MonitorQueueConfigTest, CompiledPatternsHaveExactlyOneOwner) {
@@ -113,23 +98,29 @@ TEST(MonitorQueueConfigTest, CompiledPatternsHaveExactlyOneOwner) {
   EXPECT_TRUE(live_patterns.empty()) << live_patterns.size() << " compiled patterns not released";
 }
 
-static std::string Written(const MonitorQueue& queue) { return queue.ToJson().toStyledString(); }
-
-// A queue's defaults, its round trip, and the conversions it refuses.
+// Both records' defaults, their round trips, and the conversions they refuse.
 TEST(MonitorQueueTest, JsonFormDefaultsAndConversionErrors) {
   // Non-objects, missing keys and a "config" that is not an array give the defaults.
   for (const char* input : {"null", "[]", "\"q\"", "{}", R"({"config": {"path": "/a"}})"})
-    EXPECT_EQ(Written(Parse(input)), State(R"({"queue": "", "config": []})", "")) << input;
-  // Every element gives a configuration, a non-object an empty one; order and
-  // duplicates survive a round trip.
-  const MonitorQueue queue = Parse(R"({"queue": "q", "config": [{"path": "/a", "mask": 1}, 7,
-                                       {"path": "/a", "mask": 1}]})");
-  EXPECT_EQ(Written(MonitorQueue(queue.ToJson())), State(R"({"queue": "q", "config": [
-      {"path": "/a", "mask": 1, "ignore": []}, {"path": "", "mask": 0, "ignore": []},
-      {"path": "/a", "mask": 1, "ignore": []}]})",
-                                                         ""));
-  for (const char* input :
-       {R"({"queue": ["q"]})", R"({"queue": "q", "config": [{}, {"mask": "x"}]})"})
+    EXPECT_EQ(MonitorQueue(Parse(input)).ToJson(), Parse(R"({"queue": "", "config": []})"))
+        << input;
+  // Every element gives a configuration, non-objects, missing keys and an
+  // "ignore" that is not an array the defaults.  Order, duplicates and every
+  // field, a trailing "/" of the path included, survive a round trip.
+  const std::string full =
+      R"({"path": "/vol/share/", "mask": 4294967295, "ignore": ["(", "a$", "a$"]})";
+  const std::string odd = R"(null, [], "x", {}, {"ignore": "x.*", "other": 1},
+                             {"ignore": {"k": "x"}})";
+  const MonitorQueue back =
+      MonitorQueue(Parse(R"({"queue": "q", "config": [)" + full + ", " + odd + ", " + full + "]}"))
+          .ToJson();
+  std::string seen = back._name, expected = "q" + State(full, "0");
+  for (const Config& config : back._configs) seen += State(config);
+  for (int i = 0; i < 6; ++i) expected += State(R"({"path": "", "mask": 0, "ignore": []})", "0");
+  EXPECT_EQ(seen, expected + State(full, "0"));
+  for (const char* input : {R"({"queue": ["q"]})", R"({"config": [{}, {"mask": "x"}]})",
+                            R"({"config": [{"path": ["x"]}]})", R"({"config": [{"mask": -1}]})",
+                            R"({"config": [{"path": "/a", "ignore": ["x", {}]}]})"})
     EXPECT_THROW(MonitorQueue{Parse(input)}, std::exception) << input;
 }
 
