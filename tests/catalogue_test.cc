@@ -20,8 +20,22 @@ namespace fs = std::filesystem;
 constexpr _tag_monitor_queue_type_ kEtc = MONITOR_QUEUE_TYPE_ETC_DIR;
 const std::string kEtcDir = "/usr/zorv/etc/zorvnotifyd", kLocal = "/usr/local/etc/zorvnotifyd";
 
-// Every call makes a missing directory (0700, parents too) and logs nothing.
-TEST(ConfDirTest, EachTypeHasItsDirectoryCreatedWhenMissing) {
+// Writes queue file |file| of |type|, its directory created as needed.
+static void Write(int type, const std::string& file, const std::string& text) {
+  std::ofstream(MonitorQueue::GetConfDir(_tag_monitor_queue_type_(type)) + "/" + file) << text;
+}
+
+// The names of |queues|, each followed by ",", then the captured lines as
+// "<priority> <message>\n" with "monitor_queue:<line> " removed.
+static std::string Seen(const std::vector<MonitorQueue>& queues) {
+  std::string names;
+  for (const MonitorQueue& queue : queues) names += queue._name + ",";
+  return names + std::regex_replace(zorv_test::DumpLogs(), std::regex("monitor_queue:[0-9]+ "), "");
+}
+
+// Every type's directory is made when missing (0700, parents too) without a
+// line; a scan loads only the regular, visible files in it.
+TEST(CatalogueTest, DirectoriesAreMadeAndScansLoadOnlyRegularVisibleFiles) {
   ZORV_REQUIRE_SANDBOX();
   zorv_test::ResetStore();
   zorv_test::ClearLogs();
@@ -37,29 +51,10 @@ TEST(ConfDirTest, EachTypeHasItsDirectoryCreatedWhenMissing) {
   fs::permissions(kLocal, fs::perms(0751));  // an existing directory keeps its mode
   EXPECT_EQ(MonitorQueue::GetConfDir(MONITOR_QUEUE_TYPE_LOCAL_ETC_DIR), kLocal);
   EXPECT_EQ(fs::status(kLocal).permissions(), fs::perms(0751));
-  EXPECT_EQ(zorv_test::DumpLogs(), "");
-}
-
-// Writes queue file |file| of |type|, its directory created as needed.
-static void Write(int type, const std::string& file, const std::string& text) {
-  std::ofstream(MonitorQueue::GetConfDir(_tag_monitor_queue_type_(type)) + "/" + file) << text;
-}
-
-// The names of |queues|, each followed by ",", then the captured lines as
-// "<priority> <message>\n" with "monitor_queue:<line> " removed.
-static std::string Seen(const std::vector<MonitorQueue>& queues) {
-  std::string names;
-  for (const MonitorQueue& queue : queues) names += queue._name + ",";
-  return names + std::regex_replace(zorv_test::DumpLogs(), std::regex("monitor_queue:[0-9]+ "), "");
-}
-
-TEST(CatalogueTest, ScanLoadsOnlyRegularVisibleFiles) {
-  ZORV_REQUIRE_SANDBOX();
-  zorv_test::ResetStore();
-  zorv_test::ClearLogs();
+  fs::remove(kEtcDir);
   std::vector<MonitorQueue> queues(1, Json::Value());
-  ASSERT_TRUE(MonitorQueue::LoadAllByType(queues, kEtc));  // created empty
-  EXPECT_EQ(Seen(queues), ",");
+  ASSERT_TRUE(MonitorQueue::LoadAllByType(queues, kEtc));  // made again, empty
+  EXPECT_EQ(Seen(queues), ",");                            // no line so far
   Write(1, "q", R"([{"queue": "q"}])");
   Write(1, ".hidden", R"([{"queue": "h"}])");
   fs::create_directory(kEtcDir + "/sub");
