@@ -41,9 +41,37 @@ static std::string Messages(const std::vector<zorv_test::LogLine>& logs) {
   return std::regex_replace(out, std::regex("monitor_queue:[0-9]+ "), "");
 }
 
+// Callers that cannot become root are refused before anything is touched,
+// even where their own rights would have sufficed (/tmp is writable by
+// everyone).  Then, for every kind of caller, the exact lines of the entry
+// and of the leave, the ids and errno afterwards.
 TEST(PrivilegedSectionTest, SwitchesLogsAndRestoresForEveryKindOfCaller) {
   ZORV_REQUIRE_SANDBOX();
   zorv_test::ResetStore();
+  std::vector<MonitorQueue> queues(1, Json::Value());  // each child has its own copy
+  MonitorQueue queue{Json::Value()};
+  const std::function<bool()> kRefused[] = {
+      [&] { return MonitorQueue::SaveToFile(queues, "/tmp/new"); },
+      [&] { return MonitorQueue::LoadFromFile(queues, "/tmp/none"); },
+      [&] { return MonitorQueue::LoadAllByType(queues, kEtc); },
+      [&] { return MonitorQueue::LoadAll(queues); },  // empties the vector first
+      [&] { return MonitorQueue::List(queues, "q", kEtc); },
+      [&] { return MonitorQueue::Get(queue, "x", "q", kEtc); },
+      [&] { return MonitorQueue::Upsert(queue, "q", kEtc); },
+      [&] { return MonitorQueue::Delete("x", "q", kEtc); },
+  };
+  for (const auto& op : kRefused) {
+    const zorv_test::ChildResult child =
+        zorv_test::RunAs(kMayNot, [&] { return op() ? -1 : static_cast<int>(queues.size()); });
+    ASSERT_TRUE(child.exited) << child.error;
+    EXPECT_EQ(child.result, &op == &kRefused[3] ? 0 : 1) << &op - kRefused;
+    EXPECT_EQ(child.after, kMayNot) << &op - kRefused;
+    EXPECT_NE(Messages(child.logs).find(kDenied), std::string::npos) << &op - kRefused;
+    for (const char* path : {"/tmp/zorvnotifyd_monitor_q.lock", "/tmp/new", "/usr/zorv"})
+      EXPECT_NE(access(path, F_OK), 0) << path;
+  }
+  EXPECT_TRUE(zorv_test::SystemctlCalls().empty());
+
   // 0700 root: a caller left unprivileged cannot see it and fails to create it.
   ASSERT_EQ(MonitorQueue::GetConfDir(kEtc), kEtcDir);
   // The caller's ids before and after, the lines of the entry and of the
@@ -56,7 +84,6 @@ TEST(PrivilegedSectionTest, SwitchesLogsAndRestoresForEveryKindOfCaller) {
       {kLost, kLostAfter, kGidUp + kUidFail + kEnterFail,
        "35 ERROR: setresgid(-1, 200, -1) [Operation not permitted]\n" + kLeaveFail, false, 1},
   };
-  std::vector<MonitorQueue> queues;
   const std::function<int()> kOps[] = {
       [] { return MonitorQueue::GetConfDir(kEtc) == kEtcDir; },  // goes on without root
       [] { return MonitorQueue::SaveToFile({Json::Value()}, kEtcDir + "/q"); },
@@ -74,36 +101,6 @@ TEST(PrivilegedSectionTest, SwitchesLogsAndRestoresForEveryKindOfCaller) {
       EXPECT_EQ(child.after, after);
     }
   }
-}
-
-// Refused before anything is touched, even where the caller's own rights
-// would have sufficed (/tmp is writable by everyone).
-TEST(PrivilegedSectionTest, CallerThatCannotBecomeRootTouchesNothing) {
-  ZORV_REQUIRE_SANDBOX();
-  zorv_test::ResetStore();
-  std::vector<MonitorQueue> queues(1, Json::Value());  // each child has its own copy
-  MonitorQueue queue{Json::Value()};
-  const std::function<bool()> kOps[] = {
-      [&] { return MonitorQueue::SaveToFile(queues, "/tmp/new"); },
-      [&] { return MonitorQueue::LoadFromFile(queues, "/tmp/none"); },
-      [&] { return MonitorQueue::LoadAllByType(queues, kEtc); },
-      [&] { return MonitorQueue::LoadAll(queues); },  // empties the vector first
-      [&] { return MonitorQueue::List(queues, "q", kEtc); },
-      [&] { return MonitorQueue::Get(queue, "x", "q", kEtc); },
-      [&] { return MonitorQueue::Upsert(queue, "q", kEtc); },
-      [&] { return MonitorQueue::Delete("x", "q", kEtc); },
-  };
-  for (const auto& op : kOps) {
-    const zorv_test::ChildResult child =
-        zorv_test::RunAs(kMayNot, [&] { return op() ? -1 : static_cast<int>(queues.size()); });
-    ASSERT_TRUE(child.exited) << child.error;
-    EXPECT_EQ(child.result, &op == &kOps[3] ? 0 : 1) << &op - kOps;
-    EXPECT_EQ(child.after, kMayNot) << &op - kOps;
-    EXPECT_NE(Messages(child.logs).find(kDenied), std::string::npos) << &op - kOps;
-    for (const char* path : {"/tmp/zorvnotifyd_monitor_q.lock", "/tmp/new", "/usr/zorv"})
-      EXPECT_NE(access(path, F_OK), 0) << path;
-  }
-  EXPECT_TRUE(zorv_test::SystemctlCalls().empty());
 }
 
 }  // namespace ZORV::ZORVNOTIFYD
