@@ -583,6 +583,32 @@ TEST_F(DaemonTest, DeliversEachQueueItsEventsToItsSubscribers) {
   EXPECT_EQ(daemon.Stop(SIGTERM), 0);
 }
 
+// A request nested deeper than a parser's stack is refused with an error
+// line, and the daemon goes on serving.
+TEST_F(DaemonTest, OutlivesHostileClients) {
+  ASSERT_EQ(std::system("rm -rf /tmp/h && mkdir /tmp/h"), 0);
+  Register("h", "/tmp/h", kCreate);
+  Daemon daemon;
+  ASSERT_TRUE(daemon.Logged("ready: watching 1 directories"));
+  Client subscriber;
+  EXPECT_EQ(Subscribe(subscriber, "h")["reply"], "subscribe");
+
+  // Nested far deeper than a request needs: refused, and the connection
+  // still answers.
+  Client nested;
+  ASSERT_TRUE(nested.Send(std::string(1001, '[') + std::string(1001, ']')));
+  ASSERT_EQ(nested.Next()["error"], "a request is one JSON object on one line");
+  ASSERT_TRUE(nested.Send("{\"request\":\"status\",\"x\":[[[[[[[[[[[[[[[[[[[]]]]]]]]]]]]]]]]]]]}"));
+  EXPECT_EQ(nested.Next()["error"], "a request is one JSON object on one line");
+  ASSERT_TRUE(nested.Send("{\"request\":\"status\"}"));
+  const Json::Value status = nested.Next();
+  EXPECT_EQ(status["reply"], "status");
+
+  ASSERT_TRUE(Put("/tmp/h/f", "x"));
+  EXPECT_EQ(subscriber.Line(), "h 1 /tmp/h/f");
+  EXPECT_EQ(daemon.Stop(SIGTERM), 0);
+}
+
 // A read-only /usr holding only the etc configuration directory, as seen
 // by the daemon alone: the daemon serves the queues that exist and says
 // which directories it cannot have, and which file looks like a backup.
