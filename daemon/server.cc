@@ -34,6 +34,11 @@ constexpr size_t kMaxRequest = 64 * 1024;
 // leaves room for members the daemon ignores.
 constexpr int kMaxRequestDepth = 8;
 
+// What the subscriptions of one client may hold: far more than a real
+// client needs, and a bound on the memory a client makes the daemon keep.
+constexpr size_t kMaxSubscriptions = 1024;
+constexpr size_t kMaxSubscriptionBytes = 1024 * 1024;  // of queue and file names
+
 // {"error":MESSAGE}
 std::string ErrorLine(const std::string& message) {
   std::string line = "{";
@@ -80,6 +85,9 @@ struct Server::Client {
   uint32_t interest = 0;  // what epoll waits for on it
   bool dirty = false;     // in dirty_: Deliver looks at it
   std::list<Client>::iterator self;
+  // The bytes of the queue and file names in |subscriptions|, which are
+  // all different.
+  size_t subscription_bytes = 0;
 };
 
 Server::Server(ServerOptions options, QueueLogs& logs, std::string run_id,
@@ -323,6 +331,26 @@ void Server::Request(Client& client, const std::string& line) {
   subscription.has_type = !type.isNull();
   subscription.has_file = !file.isNull();
   if (subscription.has_file) subscription.file = file.asString();
+  // The same subscription again adds nothing; a new one must fit the
+  // client's bounds.
+  const bool known = std::any_of(
+      client.subscriptions.begin(), client.subscriptions.end(), [&](const Subscription& held) {
+        return held.name == subscription.name && held.has_type == subscription.has_type &&
+               (!held.has_type || held.type == subscription.type) &&
+               held.has_file == subscription.has_file && held.file == subscription.file;
+      });
+  const size_t bytes = subscription.name.size() + subscription.file.size();
+  if (!known) {
+    if (client.subscriptions.size() >= kMaxSubscriptions ||
+        bytes > kMaxSubscriptionBytes - client.subscription_bytes) {
+      client.out += ErrorLine("a client may hold at most " + std::to_string(kMaxSubscriptions) +
+                              " subscriptions and " + std::to_string(kMaxSubscriptionBytes) +
+                              " bytes of names");
+      return;
+    }
+    client.subscriptions.push_back(subscription);
+    client.subscription_bytes += bytes;
+  }
   std::string reply;
   Subscribe(client, subscription, !since.isNull(), since.isNull() ? 0 : since.asUInt64(), &reply);
   client.out += reply;
@@ -330,7 +358,6 @@ void Server::Request(Client& client, const std::string& line) {
 
 void Server::Subscribe(Client& client, const Subscription& subscription, bool has_since,
                        uint64_t since, std::string* reply) {
-  client.subscriptions.push_back(subscription);
   *reply = "{\"reply\":\"subscribe\",";
   AppendJsonField(reply, "run", run_id_);
   *reply += ',';

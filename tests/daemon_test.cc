@@ -583,8 +583,9 @@ TEST_F(DaemonTest, DeliversEachQueueItsEventsToItsSubscribers) {
   EXPECT_EQ(daemon.Stop(SIGTERM), 0);
 }
 
-// A request nested deeper than a parser's stack is refused with an error
-// line, and the daemon goes on serving.
+// Clients that nest a request deeper than a parser's stack, or hold ever
+// more subscriptions: each is refused with an error line, and the daemon
+// goes on serving.
 TEST_F(DaemonTest, OutlivesHostileClients) {
   ASSERT_EQ(std::system("rm -rf /tmp/h && mkdir /tmp/h"), 0);
   Register("h", "/tmp/h", kCreate);
@@ -604,8 +605,27 @@ TEST_F(DaemonTest, OutlivesHostileClients) {
   const Json::Value status = nested.Next();
   EXPECT_EQ(status["reply"], "status");
 
+  // At most 1024 subscriptions (the same one again counts once) and 1 MiB
+  // of names: those held go on, and the connection answers.
+  Client many, big;
+  EXPECT_EQ(Subscribe(many, "h")["reply"], "subscribe");
+  for (int i = 1; i < 1024; ++i) {
+    ASSERT_EQ(Subscribe(many, "s" + std::to_string(i))["reply"], "subscribe") << i;
+  }
+  EXPECT_EQ(Subscribe(many, "s1024")["error"],
+            "a client may hold at most 1024 subscriptions and 1048576 bytes of names");
+  EXPECT_EQ(Subscribe(many, "h")["reply"], "subscribe");
+  const std::string name(60 * 1024, 'n');
+  for (int i = 0; i < 17; ++i) {
+    ASSERT_EQ(Subscribe(big, name + std::to_string(i))["reply"], "subscribe") << i;
+  }
+  EXPECT_EQ(Subscribe(big, name + "17")["error"],
+            "a client may hold at most 1024 subscriptions and 1048576 bytes of names");
+  EXPECT_EQ(Subscribe(big, name + "0")["reply"], "subscribe");
+
   ASSERT_TRUE(Put("/tmp/h/f", "x"));
   EXPECT_EQ(subscriber.Line(), "h 1 /tmp/h/f");
+  EXPECT_EQ(many.Line(), "h 1 /tmp/h/f");
   EXPECT_EQ(daemon.Stop(SIGTERM), 0);
 }
 
