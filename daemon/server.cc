@@ -98,6 +98,7 @@ Server::Server(ServerOptions options, QueueLogs& logs, std::string run_id,
       status_(std::move(status)) {}
 
 Server::~Server() {
+  full_ = false;  // not "accepting again" while every client is let go
   while (!clients_.empty()) Drop(clients_.front());
   struct stat st;
   if (listener_.get() >= 0 && lstat(options_.socket_path.c_str(), &st) == 0 &&
@@ -177,6 +178,28 @@ void Server::Touch(Client& client) {
   dirty_.push_back(&client);
 }
 
+void Server::StopAccepting(int error) {
+  if (accepting_ && epoll_ctl(epoll_.get(), EPOLL_CTL_DEL, listener_.get(), nullptr) == 0) {
+    accepting_ = false;
+  }
+  if (starved_) return;
+  starved_ = true;
+  syslog(LOG_ERR,
+         "cannot accept clients: %s (%zu connected); waiting until one leaves, and trying "
+         "again periodically",
+         strerror(error), clients_.size());
+}
+
+void Server::ResumeAccepting() {
+  if (accepting_) return;
+  struct epoll_event event = {};
+  event.events = EPOLLIN;
+  event.data.ptr = nullptr;  // the listener
+  accepting_ = epoll_ctl(epoll_.get(), EPOLL_CTL_ADD, listener_.get(), &event) == 0;
+}
+
+void Server::Tick() { ResumeAccepting(); }
+
 void Server::Handle() {
   struct epoll_event events[64];
   const int n = epoll_wait(epoll_.get(), events, 64, 0);
@@ -201,7 +224,15 @@ void Server::Handle() {
 void Server::Accept() {
   for (;;) {
     UniqueFd fd(accept4(listener_.get(), nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC));
-    if (fd.get() < 0) return;  // EAGAIN: none left (other errors: try at the next poll)
+    if (fd.get() < 0) {
+      // EAGAIN: none left.  Any other failure but a connection that went
+      // away or a signal (no descriptor or memory left) would leave the
+      // listener readable, and the loop busy, while it lasts.
+      if (errno == ECONNABORTED || errno == EINTR) continue;
+      if (errno != EAGAIN && errno != EWOULDBLOCK) StopAccepting(errno);
+      return;
+    }
+    starved_ = false;
     std::string who;
     if (!Allowed(fd.get(), &who)) {
       const std::string refusal = ErrorLine(
@@ -209,6 +240,21 @@ void Server::Accept() {
           (options_.group_allowed ? "root and the daemon's group only" : "root only") + ")");
       (void)!send(fd.get(), refusal.data(), refusal.size(), MSG_NOSIGNAL | MSG_DONTWAIT);
       syslog(LOG_WARNING, "refused a client: %s", who.c_str());
+      continue;
+    }
+    // Beyond the cap the descriptor limit would be reached, which leaves
+    // none for the directories of a walk: a client is told, and let go.
+    if (clients_.size() >= options_.max_clients) {
+      const std::string refusal =
+          ErrorLine("too many clients: the daemon serves at most " +
+                    std::to_string(options_.max_clients) + " at once; try again later");
+      (void)!send(fd.get(), refusal.data(), refusal.size(), MSG_NOSIGNAL | MSG_DONTWAIT);
+      ++refused_;
+      if (!full_) {
+        full_ = true;
+        syslog(LOG_WARNING, "at the client limit: serving %zu clients, refusing others",
+               clients_.size());
+      }
       continue;
     }
     clients_.emplace_back();
@@ -300,6 +346,8 @@ void Server::Request(Client& client, const std::string& line) {
     AppendJsonField(&client.out, "run", run_id_);
     client.out += ',';
     AppendJsonNumber(&client.out, "clients", clients_.size());
+    client.out += ',';
+    AppendJsonNumber(&client.out, "max_clients", options_.max_clients);
     client.out += "," + status_() + "}\n";
     return;
   }
@@ -530,6 +578,13 @@ void Server::Drop(Client& client) {
   }
   if (client.dirty) dirty_.erase(std::find(dirty_.begin(), dirty_.end(), &client));
   clients_.erase(client.self);  // closing the descriptor takes it out of epoll
+  // Its descriptor is free again.
+  ResumeAccepting();
+  if (full_ && clients_.size() < options_.max_clients) {
+    full_ = false;
+    syslog(LOG_NOTICE, "accepting clients again: %zu were refused at the client limit", refused_);
+    refused_ = 0;
+  }
 }
 
 }  // namespace zorvnotifyd
