@@ -30,11 +30,43 @@ using zorvcommon::Quoted;
 // A request line longer than this is refused and the client let go.
 constexpr size_t kMaxRequest = 64 * 1024;
 
+// How deep a request line may nest.  A request is a flat object; this
+// leaves room for members the daemon ignores.
+constexpr int kMaxRequestDepth = 8;
+
+// What the subscriptions of one client may hold: far more than a real
+// client needs, and a bound on the memory a client makes the daemon keep.
+constexpr size_t kMaxSubscriptions = 1024;
+constexpr size_t kMaxSubscriptionBytes = 1024 * 1024;  // of queue and file names
+
 // {"error":MESSAGE}
 std::string ErrorLine(const std::string& message) {
   std::string line = "{";
   AppendJsonField(&line, "error", message);
   return line + "}\n";
+}
+
+// Parses |line| into |request|; false when it is not one JSON object
+// nested at most kMaxRequestDepth levels.  jsoncpp's reader, which the
+// tool and the library use too, recurses once per level and throws past
+// its stack limit: here the strict reader gets a small limit, and whatever
+// it throws (that, or memory running out) makes a bad request, never the
+// end of the daemon.  A parser of its own for one flat object would be
+// more code to get right for no gain.  The line's length (kMaxRequest)
+// bounds the memory the parsed value takes.
+bool ParseRequest(const std::string& line, Json::Value* request) noexcept {
+  try {
+    Json::CharReaderBuilder builder;
+    Json::CharReaderBuilder::strictMode(&builder.settings_);
+    builder["failIfExtra"] = true;
+    builder["stackLimit"] = kMaxRequestDepth;
+    const std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
+    std::string errors;
+    return reader->parse(line.data(), line.data() + line.size(), request, &errors) &&
+           request->isObject();
+  } catch (const std::exception&) {
+    return false;
+  }
 }
 
 }  // namespace
@@ -53,6 +85,9 @@ struct Server::Client {
   uint32_t interest = 0;  // what epoll waits for on it
   bool dirty = false;     // in dirty_: Deliver looks at it
   std::list<Client>::iterator self;
+  // The bytes of the queue and file names in |subscriptions|, which are
+  // all different.
+  size_t subscription_bytes = 0;
 };
 
 Server::Server(ServerOptions options, QueueLogs& logs, std::string run_id,
@@ -63,6 +98,7 @@ Server::Server(ServerOptions options, QueueLogs& logs, std::string run_id,
       status_(std::move(status)) {}
 
 Server::~Server() {
+  full_ = false;  // not "accepting again" while every client is let go
   while (!clients_.empty()) Drop(clients_.front());
   struct stat st;
   if (listener_.get() >= 0 && lstat(options_.socket_path.c_str(), &st) == 0 &&
@@ -142,6 +178,28 @@ void Server::Touch(Client& client) {
   dirty_.push_back(&client);
 }
 
+void Server::StopAccepting(int error) {
+  if (accepting_ && epoll_ctl(epoll_.get(), EPOLL_CTL_DEL, listener_.get(), nullptr) == 0) {
+    accepting_ = false;
+  }
+  if (starved_) return;
+  starved_ = true;
+  syslog(LOG_ERR,
+         "cannot accept clients: %s (%zu connected); waiting until one leaves, and trying "
+         "again periodically",
+         strerror(error), clients_.size());
+}
+
+void Server::ResumeAccepting() {
+  if (accepting_) return;
+  struct epoll_event event = {};
+  event.events = EPOLLIN;
+  event.data.ptr = nullptr;  // the listener
+  accepting_ = epoll_ctl(epoll_.get(), EPOLL_CTL_ADD, listener_.get(), &event) == 0;
+}
+
+void Server::Tick() { ResumeAccepting(); }
+
 void Server::Handle() {
   struct epoll_event events[64];
   const int n = epoll_wait(epoll_.get(), events, 64, 0);
@@ -166,7 +224,15 @@ void Server::Handle() {
 void Server::Accept() {
   for (;;) {
     UniqueFd fd(accept4(listener_.get(), nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC));
-    if (fd.get() < 0) return;  // EAGAIN: none left (other errors: try at the next poll)
+    if (fd.get() < 0) {
+      // EAGAIN: none left.  Any other failure but a connection that went
+      // away or a signal (no descriptor or memory left) would leave the
+      // listener readable, and the loop busy, while it lasts.
+      if (errno == ECONNABORTED || errno == EINTR) continue;
+      if (errno != EAGAIN && errno != EWOULDBLOCK) StopAccepting(errno);
+      return;
+    }
+    starved_ = false;
     std::string who;
     if (!Allowed(fd.get(), &who)) {
       const std::string refusal = ErrorLine(
@@ -174,6 +240,21 @@ void Server::Accept() {
           (options_.group_allowed ? "root and the daemon's group only" : "root only") + ")");
       (void)!send(fd.get(), refusal.data(), refusal.size(), MSG_NOSIGNAL | MSG_DONTWAIT);
       syslog(LOG_WARNING, "refused a client: %s", who.c_str());
+      continue;
+    }
+    // Beyond the cap the descriptor limit would be reached, which leaves
+    // none for the directories of a walk: a client is told, and let go.
+    if (clients_.size() >= options_.max_clients) {
+      const std::string refusal =
+          ErrorLine("too many clients: the daemon serves at most " +
+                    std::to_string(options_.max_clients) + " at once; try again later");
+      (void)!send(fd.get(), refusal.data(), refusal.size(), MSG_NOSIGNAL | MSG_DONTWAIT);
+      ++refused_;
+      if (!full_) {
+        full_ = true;
+        syslog(LOG_WARNING, "at the client limit: serving %zu clients, refusing others",
+               clients_.size());
+      }
       continue;
     }
     clients_.emplace_back();
@@ -254,14 +335,8 @@ bool Server::Room(const Client& client) const {
 }
 
 void Server::Request(Client& client, const std::string& line) {
-  Json::CharReaderBuilder builder;
-  Json::CharReaderBuilder::strictMode(&builder.settings_);
-  builder["failIfExtra"] = true;
-  const std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
   Json::Value request;
-  std::string errors;
-  if (!reader->parse(line.data(), line.data() + line.size(), &request, &errors) ||
-      !request.isObject()) {
+  if (!ParseRequest(line, &request)) {
     client.out += ErrorLine("a request is one JSON object on one line");
     return;
   }
@@ -271,6 +346,8 @@ void Server::Request(Client& client, const std::string& line) {
     AppendJsonField(&client.out, "run", run_id_);
     client.out += ',';
     AppendJsonNumber(&client.out, "clients", clients_.size());
+    client.out += ',';
+    AppendJsonNumber(&client.out, "max_clients", options_.max_clients);
     client.out += "," + status_() + "}\n";
     return;
   }
@@ -302,6 +379,26 @@ void Server::Request(Client& client, const std::string& line) {
   subscription.has_type = !type.isNull();
   subscription.has_file = !file.isNull();
   if (subscription.has_file) subscription.file = file.asString();
+  // The same subscription again adds nothing; a new one must fit the
+  // client's bounds.
+  const bool known = std::any_of(
+      client.subscriptions.begin(), client.subscriptions.end(), [&](const Subscription& held) {
+        return held.name == subscription.name && held.has_type == subscription.has_type &&
+               (!held.has_type || held.type == subscription.type) &&
+               held.has_file == subscription.has_file && held.file == subscription.file;
+      });
+  const size_t bytes = subscription.name.size() + subscription.file.size();
+  if (!known) {
+    if (client.subscriptions.size() >= kMaxSubscriptions ||
+        bytes > kMaxSubscriptionBytes - client.subscription_bytes) {
+      client.out += ErrorLine("a client may hold at most " + std::to_string(kMaxSubscriptions) +
+                              " subscriptions and " + std::to_string(kMaxSubscriptionBytes) +
+                              " bytes of names");
+      return;
+    }
+    client.subscriptions.push_back(subscription);
+    client.subscription_bytes += bytes;
+  }
   std::string reply;
   Subscribe(client, subscription, !since.isNull(), since.isNull() ? 0 : since.asUInt64(), &reply);
   client.out += reply;
@@ -309,7 +406,6 @@ void Server::Request(Client& client, const std::string& line) {
 
 void Server::Subscribe(Client& client, const Subscription& subscription, bool has_since,
                        uint64_t since, std::string* reply) {
-  client.subscriptions.push_back(subscription);
   *reply = "{\"reply\":\"subscribe\",";
   AppendJsonField(reply, "run", run_id_);
   *reply += ',';
@@ -482,6 +578,13 @@ void Server::Drop(Client& client) {
   }
   if (client.dirty) dirty_.erase(std::find(dirty_.begin(), dirty_.end(), &client));
   clients_.erase(client.self);  // closing the descriptor takes it out of epoll
+  // Its descriptor is free again.
+  ResumeAccepting();
+  if (full_ && clients_.size() < options_.max_clients) {
+    full_ = false;
+    syslog(LOG_NOTICE, "accepting clients again: %zu were refused at the client limit", refused_);
+    refused_ = 0;
+  }
 }
 
 }  // namespace zorvnotifyd

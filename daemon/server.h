@@ -24,6 +24,7 @@ struct ServerOptions {
   bool group_allowed = false;  // members of |group| may connect too
   gid_t group = 0;
   size_t client_buffer = 256 * 1024;  // bytes of output a client may have waiting
+  size_t max_clients = 1000;          // clients served at once; others get a refusal line
 };
 
 class Server {
@@ -57,6 +58,10 @@ class Server {
   // Moves new records into the clients' buffers (as far as each has room)
   // and writes what the sockets take now.
   void Deliver();
+  // The periodic check: waits for new clients again after accepting one
+  // failed (descriptors or memory ran out), should no client leave to
+  // free what it holds.
+  void Tick();
 
   size_t clients() const { return clients_.size(); }
 
@@ -72,6 +77,12 @@ class Server {
   };
 
   void Accept();
+  // Takes the listener out of epoll after accept() failed with |error|, so
+  // that a condition that lasts cannot keep the event loop busy; logged
+  // once until a client is accepted again.
+  void StopAccepting(int error);
+  // Puts the listener back into epoll.
+  void ResumeAccepting();
   // True when the peer of |fd| may connect; |who| describes it.
   bool Allowed(int fd, std::string* who) const;
   void Read(Client& client);
@@ -106,6 +117,10 @@ class Server {
   std::list<Client> clients_;
   std::vector<Client*> dirty_;  // clients with output or records to move
   std::multimap<QueueLog*, Client*> followers_;
+  bool accepting_ = true;  // the listener is in epoll
+  bool starved_ = false;   // accept() failed, logged; cleared by the next client accepted
+  bool full_ = false;      // at max_clients, logged; cleared when a client leaves
+  size_t refused_ = 0;     // clients refused at max_clients since full_ was set
 };
 
 }  // namespace zorvnotifyd

@@ -11,6 +11,7 @@
 #include <signal.h>
 #include <string.h>
 #include <sys/random.h>
+#include <sys/resource.h>
 #include <sys/signalfd.h>
 #include <syslog.h>
 #include <unistd.h>
@@ -47,6 +48,7 @@ const char kUsage[] =
     "  --keep N              events kept per queue for clients that reconnect\n"
     "                        (default 100)\n"
     "  --client-buffer BYTES output a client may have waiting (default 262144)\n"
+    "  --max-clients N       clients served at once (default 1000)\n"
     "  --stdout              also write one line per queue and event on standard output\n"
     "  --json                ... as JSON objects (implies --stdout)\n"
     "  --retry SECONDS       how often trees that are missing, replaced or over the\n"
@@ -59,6 +61,39 @@ const char kUsage[] =
     "and stops on SIGTERM or SIGINT (status 0).  Log lines go to syslog and to standard error.\n";
 
 constexpr double kDefaultRetrySeconds = 5;
+
+// Descriptors kept from the clients for everything else: about 16 that the
+// daemon holds or opens for a moment (standard streams, syslog, the
+// signalfd, two inotify instances, home, the listener, epoll, a queue
+// file, the name service for --group, a refused client), and the rest for
+// a directory walk, which holds one descriptor per level of the directory
+// it is in: a tree about 100 levels deep is walked whole with every client
+// connected.
+constexpr size_t kReservedDescriptors = 128;
+
+// Makes the descriptor limit cover |max_clients| clients and the reserve,
+// raising the soft limit toward the hard one if need be.  Returns how many
+// clients fit: |max_clients|, or fewer (logged) when the limit stays lower.
+size_t FitDescriptorLimit(size_t max_clients) {
+  const rlim_t wanted = rlim_t(max_clients + kReservedDescriptors);
+  struct rlimit limit;
+  if (getrlimit(RLIMIT_NOFILE, &limit) != 0) return max_clients;  // cannot happen
+  if (limit.rlim_cur != RLIM_INFINITY && limit.rlim_cur < wanted) {
+    struct rlimit raised = limit;
+    raised.rlim_cur = limit.rlim_max == RLIM_INFINITY ? wanted : std::min(wanted, limit.rlim_max);
+    if (raised.rlim_cur > limit.rlim_cur && setrlimit(RLIMIT_NOFILE, &raised) == 0) limit = raised;
+  }
+  if (limit.rlim_cur == RLIM_INFINITY || limit.rlim_cur >= wanted) return max_clients;
+  const size_t fit =
+      limit.rlim_cur > kReservedDescriptors ? size_t(limit.rlim_cur - kReservedDescriptors) : 1;
+  syslog(LOG_WARNING,
+         "the descriptor limit (%llu) leaves room for %zu clients, not the %zu of --max-clients "
+         "(%zu more are kept for the trees and the daemon): serving at most %zu; raise the "
+         "limit (LimitNOFILE=) to %zu",
+         (unsigned long long)limit.rlim_cur, fit, max_clients, kReservedDescriptors, fit,
+         max_clients + kReservedDescriptors);
+  return fit;
+}
 
 // Milliseconds of CLOCK_MONOTONIC.
 int64_t NowMs() {
@@ -200,6 +235,7 @@ int Serve(const Options& options) {
     if (ready > 0 && (fds[3].revents & POLLIN)) server.Handle();
     if (tick) {
       tree.Tick(reporter);
+      server.Tick();
       next_tick = NowMs() + retry_ms;
     }
     server.Deliver();
@@ -256,6 +292,10 @@ int ParseOptions(int argc, char** argv, Options* options) {
                ParseCount(value, 1024, 1ull << 30, &number)) {
       options->server.client_buffer = size_t(number);
       ++i;
+    } else if (arg == "--max-clients" && value != nullptr &&
+               ParseCount(value, 1, 1000000, &number)) {
+      options->server.max_clients = size_t(number);
+      ++i;
     } else if (arg == "--retry" && value != nullptr) {
       char* end = nullptr;
       options->retry_seconds = strtod(argv[++i], &end);
@@ -289,6 +329,7 @@ int main(int argc, char** argv) {
     syslog(LOG_ERR, "must run as root: the catalogue and the watched trees are root's");
     return 1;
   }
+  options.server.max_clients = zorvnotifyd::FitDescriptorLimit(options.server.max_clients);
   const int status = zorvnotifyd::Serve(options);
   closelog();
   return status;

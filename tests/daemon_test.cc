@@ -9,6 +9,7 @@
 #include <signal.h>
 #include <sys/inotify.h>
 #include <sys/mount.h>
+#include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
@@ -19,7 +20,9 @@
 #include <filesystem>
 #include <fstream>
 #include <functional>
+#include <iterator>
 #include <map>
+#include <memory>
 #include <set>
 #include <sstream>
 #include <string>
@@ -580,6 +583,97 @@ TEST_F(DaemonTest, DeliversEachQueueItsEventsToItsSubscribers) {
   const Json::Value v = status.Next();
   EXPECT_EQ(std::vector<Json::Value>({v["queues"], v["clients"], v["directories"]}),
             std::vector<Json::Value>({2, 4, 2}));
+  EXPECT_EQ(daemon.Stop(SIGTERM), 0);
+}
+
+// The daemon's CPU time so far, in clock ticks (-1 when unknown).
+long CpuTicks(pid_t pid) {
+  std::ifstream in("/proc/" + std::to_string(pid) + "/stat");
+  std::string text((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+  std::istringstream fields(text.substr(text.rfind(')') + 2));
+  std::string field;
+  long user = -1, system = -1;
+  for (int i = 3; i <= 15 && fields >> field; ++i) {
+    if (i == 14) user = std::stol(field);
+    if (i == 15) system = std::stol(field);
+  }
+  return user < 0 || system < 0 ? -1 : user + system;
+}
+
+// Clients that nest a request deeper than a parser's stack, hold ever more
+// subscriptions, or come in greater numbers than the descriptor limit
+// allows: each is refused with an error line, and the daemon goes on
+// serving, watching new directories, and waiting without spinning.
+TEST_F(DaemonTest, OutlivesHostileClients) {
+  ASSERT_EQ(std::system("rm -rf /tmp/h && mkdir /tmp/h"), 0);
+  Register("h", "/tmp/h", kCreate);
+  // 160 descriptors leave room for 32 clients besides the daemon's reserve.
+  constexpr size_t kCap = 32;
+  Daemon daemon({"--max-clients", "100"}, [] {
+    const struct rlimit limit = {160, 160};
+    return setrlimit(RLIMIT_NOFILE, &limit) == 0;
+  });
+  EXPECT_TRUE(daemon.Logged("the descriptor limit (160) leaves room for 32 clients"));
+  ASSERT_TRUE(daemon.Logged("ready: watching 1 directories"));
+  Client subscriber;
+  EXPECT_EQ(Subscribe(subscriber, "h")["reply"], "subscribe");
+
+  // Nested far deeper than a request needs: refused, and the connection
+  // still answers.
+  Client nested;
+  ASSERT_TRUE(nested.Send(std::string(1001, '[') + std::string(1001, ']')));
+  ASSERT_EQ(nested.Next()["error"], "a request is one JSON object on one line");
+  ASSERT_TRUE(nested.Send("{\"request\":\"status\",\"x\":[[[[[[[[[[[[[[[[[[[]]]]]]]]]]]]]]]]]]]}"));
+  EXPECT_EQ(nested.Next()["error"], "a request is one JSON object on one line");
+  ASSERT_TRUE(nested.Send("{\"request\":\"status\"}"));
+  const Json::Value status = nested.Next();
+  EXPECT_EQ(status["reply"], "status");
+  EXPECT_EQ(status["max_clients"].asUInt64(), kCap);
+
+  // At most 1024 subscriptions (the same one again counts once) and 1 MiB
+  // of names: those held go on, and the connection answers.
+  Client many, big;
+  EXPECT_EQ(Subscribe(many, "h")["reply"], "subscribe");
+  for (int i = 1; i < 1024; ++i) {
+    ASSERT_EQ(Subscribe(many, "s" + std::to_string(i))["reply"], "subscribe") << i;
+  }
+  EXPECT_EQ(Subscribe(many, "s1024")["error"],
+            "a client may hold at most 1024 subscriptions and 1048576 bytes of names");
+  EXPECT_EQ(Subscribe(many, "h")["reply"], "subscribe");
+  const std::string name(60 * 1024, 'n');
+  for (int i = 0; i < 17; ++i) {
+    ASSERT_EQ(Subscribe(big, name + std::to_string(i))["reply"], "subscribe") << i;
+  }
+  EXPECT_EQ(Subscribe(big, name + "17")["error"],
+            "a client may hold at most 1024 subscriptions and 1048576 bytes of names");
+  EXPECT_EQ(Subscribe(big, name + "0")["reply"], "subscribe");
+
+  // Idle clients up to the cap, then more than the descriptors allow.
+  std::vector<std::unique_ptr<Client>> idle, beyond;
+  for (size_t i = 4; i < kCap; ++i) idle.push_back(std::make_unique<Client>());
+  for (int i = 0; i < 150; ++i) beyond.push_back(std::make_unique<Client>());
+  // A directory made now is watched, and the daemon waits without spinning.
+  ASSERT_EQ(mkdir("/tmp/h/new", 0755), 0);
+  ASSERT_TRUE(Put("/tmp/h/new/f", "x"));
+  EXPECT_EQ(subscriber.Line(), "h 1 /tmp/h/new");
+  EXPECT_EQ(subscriber.Line(), "h 2 /tmp/h/new/f");
+  EXPECT_EQ(many.Line(), "h 1 /tmp/h/new");
+  const long before = CpuTicks(daemon.pid());
+  usleep(1000 * 1000);
+  EXPECT_LT(CpuTicks(daemon.pid()) - before, sysconf(_SC_CLK_TCK) / 4);
+  for (const auto& client : beyond) {
+    const Json::Value refusal = client->Next();
+    ASSERT_EQ(refusal["error"],
+              "too many clients: the daemon serves at most 32 at once; try again later");
+    EXPECT_EQ(client->Next(), Json::Value()) << "not closed";
+  }
+  EXPECT_TRUE(daemon.Logged("at the client limit"));
+  idle.clear();
+  beyond.clear();
+  EXPECT_TRUE(daemon.Logged("accepting clients again: 150 were refused at the client limit"));
+  Client again;
+  ASSERT_TRUE(again.Send("{\"request\":\"status\"}"));
+  EXPECT_EQ(again.Next()["reply"], "status");
   EXPECT_EQ(daemon.Stop(SIGTERM), 0);
 }
 
