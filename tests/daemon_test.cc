@@ -54,7 +54,9 @@ Json::Value ParseJson(const std::string& text, bool* ok = nullptr) {
   return parsed ? v : Json::Value();
 }
 
-constexpr const char* kSocket = "/tmp/zorvnotifyd.sock";
+// In a directory of root's that only root may write, as a socket's must be.
+constexpr const char* kSocketDir = "/tmp/zorvrun";
+constexpr const char* kSocket = "/tmp/zorvrun/zorvnotifyd.sock";
 
 // The daemon as a child process, listening on kSocket.
 class Daemon : public zorv_test::ChildProcess {
@@ -170,6 +172,8 @@ class DaemonTest : public ::testing::Test {
   void SetUp() override {
     ZORV_REQUIRE_SANDBOX();
     zorv_test::ResetStore();
+    mkdir(kSocketDir, 0755);
+    ASSERT_EQ(chmod(kSocketDir, 0755), 0);
   }
 };
 

@@ -249,10 +249,13 @@ TEST(ZorvnotifyctlTest, RefusesSetUserIdAndReportsABusyStore) {
 TEST(ZorvnotifyctlTest, WatchAndStatusAskTheDaemon) {
   ZORV_REQUIRE_SANDBOX();
   zorv_test::ResetStore();
-  const std::string socket = "/tmp/ctl.sock";
+  // A socket's directory must be root's and writable by root alone.
+  mkdir("/tmp/zorvrun", 0755);
+  ASSERT_EQ(chmod("/tmp/zorvrun", 0755), 0);
+  const std::string socket = "/tmp/zorvrun/ctl.sock";
   std::string out, err;
   EXPECT_EQ(RunTool("--socket " + socket + " watch backup", "", &out, &err), 1);
-  EXPECT_THAT(err, ::testing::HasSubstr("zorvnotifyd is not running (no socket at /tmp/ctl.sock)"));
+  EXPECT_THAT(err, ::testing::HasSubstr("zorvnotifyd is not running (no socket at " + socket));
 
   ASSERT_EQ(std::system("rm -rf /tmp/wd && mkdir /tmp/wd"), 0);
   const Json::Value queue = Parse(R"({"queue": "backup", "config": [{"path": "/tmp/wd", "mask": )" +
