@@ -5,6 +5,7 @@
 #ifndef ZORVNOTIFYD_DAEMON_SERVER_H_
 #define ZORVNOTIFYD_DAEMON_SERVER_H_
 
+#include <sys/stat.h>
 #include <sys/types.h>
 
 #include <cstdint>
@@ -19,8 +20,11 @@
 
 namespace zorvnotifyd {
 
+// The socket when none is named; its directory is made when missing.
+constexpr char kDefaultSocketPath[] = "/run/zorvnotifyd/zorvnotifyd.sock";
+
 struct ServerOptions {
-  std::string socket_path = "/run/zorvnotifyd/zorvnotifyd.sock";
+  std::string socket_path = kDefaultSocketPath;
   bool group_allowed = false;  // members of |group| may connect too
   gid_t group = 0;
   size_t client_buffer = 256 * 1024;  // bytes of output a client may have waiting
@@ -37,9 +41,17 @@ class Server {
   Server& operator=(const Server&) = delete;
 
   // Listens on the socket path, replacing a socket left there (never
-  // another kind of file); mode 0600, or 0660 with the group.  False when
-  // that failed (logged).
+  // another kind of file, nor a socket that another daemon listens on);
+  // mode 0600, or 0660 with the group.  The path's directory must be root's
+  // and writable by root alone, or anyone could plant a file or a socket of
+  // their own there; the default directory is made when missing.  False
+  // when that failed (logged).
   bool Listen();
+  // When the socket file at the path is no longer the one bound (removed or
+  // replaced), listens on a new one as Listen does, keeping the clients;
+  // when that fails, says so once per reason and tries again at the next
+  // call (every |retry_seconds|).
+  void Relisten(double retry_seconds);
 
   // The descriptor to poll (for input) in the event loop.
   int fd() const { return epoll_.get(); }
@@ -71,6 +83,14 @@ class Server {
     std::string file;
   };
 
+  // Checks the socket's directory and binds a listening socket at the
+  // path; its file's identity goes to |bound|.  An empty descriptor when
+  // that failed, with |reason|.
+  UniqueFd Bind(struct stat* bound, std::string* reason);
+  // Serves |listener| in place of the current listener, whose waiting
+  // connections are accepted first; false with |reason| when it cannot be
+  // polled.
+  bool Use(UniqueFd listener, std::string* reason);
   void Accept();
   // True when the peer of |fd| may connect; |who| describes it.
   bool Allowed(int fd, std::string* who) const;
@@ -102,6 +122,8 @@ class Server {
   std::string run_id_;
   std::function<std::string()> status_;
   UniqueFd listener_;
+  struct stat bound_ = {};        // the socket file of listener_
+  std::string relisten_failure_;  // the last reason Relisten logged
   UniqueFd epoll_;
   std::list<Client> clients_;
   std::vector<Client*> dirty_;  // clients with output or records to move
