@@ -42,6 +42,7 @@
 #include <sys/inotify.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
+#include <sys/stat.h>
 #include <sys/un.h>
 #include <sys/wait.h>
 #include <time.h>
@@ -96,7 +97,9 @@ constexpr uint32_t kTreeKeeping =
 const std::string kRoot = "/tmp/bench";
 const std::string kShare = kRoot + "/share";
 const std::string kHotDir = kShare + "/hot";
-const std::string kSocket = kRoot + "/zorvnotifyd.sock";
+// A socket's directory must be root's and writable by root alone.
+const std::string kSocketDir = "/tmp/zorvrun";
+const std::string kSocket = kSocketDir + "/zorvnotifyd.sock";
 const std::string kRootsFile = kRoot + "/roots";
 
 // The configurations on the hot directory, one per hot queue.
@@ -160,7 +163,8 @@ std::string QueueDir(int i) { return kShare + "/q" + std::to_string(i); }
 int HotQueue(int queues, int k) { return k * queues / kHotQueues; }
 
 // Creates every directory of the largest catalogue: q<i>/d0..d7, two
-// subdirectories of each d0, and seven of the hot directory.
+// subdirectories of each d0, and seven of the hot directory; and the
+// socket's directory.
 bool MakeTrees() {
   std::error_code error;
   for (int i = 0; i < kMaxQueues && !error; ++i) {
@@ -174,7 +178,8 @@ bool MakeTrees() {
   for (int h = 0; h < 7; ++h) {
     std::filesystem::create_directories(kHotDir + "/h" + std::to_string(h), error);
   }
-  return !error;
+  mkdir(kSocketDir.c_str(), 0755);
+  return !error && chmod(kSocketDir.c_str(), 0755) == 0;
 }
 
 // The burst's files.

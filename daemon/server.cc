@@ -14,6 +14,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <cstdio>
 #include <memory>
 #include <sstream>
 
@@ -100,34 +101,105 @@ Server::Server(ServerOptions options, QueueLogs& logs, std::string run_id,
 Server::~Server() {
   full_ = false;  // not "accepting again" while every client is let go
   while (!clients_.empty()) Drop(clients_.front());
+  // Only the socket file this daemon bound: one that replaced it belongs to
+  // someone else.
   struct stat st;
   if (listener_.get() >= 0 && lstat(options_.socket_path.c_str(), &st) == 0 &&
-      S_ISSOCK(st.st_mode)) {
+      st.st_dev == bound_.st_dev && st.st_ino == bound_.st_ino) {
     unlink(options_.socket_path.c_str());
   }
 }
 
 bool Server::Listen() {
+  std::string reason;
+  UniqueFd fd = Bind(&bound_, &reason);
+  if (fd.get() < 0 || !Use(std::move(fd), &reason)) {
+    syslog(LOG_ERR, "cannot listen on %s: %s", Quoted(options_.socket_path).c_str(),
+           reason.c_str());
+    return false;
+  }
+  return true;
+}
+
+void Server::Relisten(double retry_seconds) {
+  const std::string& path = options_.socket_path;
+  struct stat st;
+  if (lstat(path.c_str(), &st) == 0 && st.st_dev == bound_.st_dev && st.st_ino == bound_.st_ino) {
+    return;
+  }
+  // Until a new socket is bound, the old one still serves the clients it
+  // has, and the check repeats at the next call.
+  std::string reason;
+  struct stat bound;
+  UniqueFd fd = Bind(&bound, &reason);
+  if (fd.get() < 0 || !Use(std::move(fd), &reason)) {
+    if (reason != relisten_failure_) {
+      syslog(LOG_ERR,
+             "the socket file %s was removed or replaced, and a new one cannot be made: %s; "
+             "trying again every %g s",
+             Quoted(path).c_str(), reason.c_str(), retry_seconds);
+    }
+    relisten_failure_ = reason;
+    return;
+  }
+  bound_ = bound;
+  relisten_failure_.clear();
+  syslog(LOG_WARNING, "the socket file %s was removed or replaced: listening on a new one",
+         Quoted(path).c_str());
+}
+
+UniqueFd Server::Bind(struct stat* bound, std::string* reason) {
   const std::string& path = options_.socket_path;
   struct sockaddr_un address = {};
   address.sun_family = AF_UNIX;
   if (path.empty() || path.size() >= sizeof(address.sun_path)) {
-    syslog(LOG_ERR, "cannot listen on %s: the path is empty or too long", Quoted(path).c_str());
-    return false;
+    *reason = "the path is empty or too long";
+    return UniqueFd();
   }
   path.copy(address.sun_path, path.size());
-  // A socket left by an earlier run is replaced; nothing else ever is.
+  const size_t slash = path.rfind('/');
+  const std::string dir = slash == std::string::npos ? "."
+                          : slash == 0               ? "/"
+                                                     : path.substr(0, slash);
+  // The service manager makes the default directory; started by hand, the
+  // daemon makes it itself: that directory alone, never its parents, and
+  // mkdir never follows a link there.
+  if (path == kDefaultSocketPath) {
+    const mode_t old_mask = umask(0);
+    if (mkdir(dir.c_str(), 0755) == 0) {
+      syslog(LOG_NOTICE, "made the socket's directory %s", Quoted(dir).c_str());
+    }
+    umask(old_mask);
+  }
+  // A directory that someone else may write lets them plant a file where
+  // the socket goes, or a socket of their own that clients would trust.
   struct stat st;
+  if (lstat(dir.c_str(), &st) != 0) {
+    *reason = "its directory " + Quoted(dir) + " cannot be used: " + strerror(errno);
+    return UniqueFd();
+  }
+  if (!S_ISDIR(st.st_mode)) {
+    *reason = "its directory " + Quoted(dir) + " is not a directory (a link is not followed)";
+    return UniqueFd();
+  }
+  if (st.st_uid != 0 || (st.st_mode & (S_IWGRP | S_IWOTH)) != 0) {
+    char mode[8];
+    snprintf(mode, sizeof(mode), "%04o", unsigned(st.st_mode & 07777));
+    *reason = "its directory " + Quoted(dir) + " is owned by uid " + std::to_string(st.st_uid) +
+              " with mode " + mode + "; it must be root's and writable by root alone";
+    return UniqueFd();
+  }
+  // A socket left by an earlier run is replaced; nothing else ever is.
   if (lstat(path.c_str(), &st) == 0) {
     if (!S_ISSOCK(st.st_mode)) {
-      syslog(LOG_ERR, "cannot listen on %s: another kind of file is there", Quoted(path).c_str());
-      return false;
+      *reason = "another kind of file is there";
+      return UniqueFd();
     }
     UniqueFd probe(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
     if (probe.get() >= 0 &&
         connect(probe.get(), reinterpret_cast<struct sockaddr*>(&address), sizeof(address)) == 0) {
-      syslog(LOG_ERR, "cannot listen on %s: another daemon listens there", Quoted(path).c_str());
-      return false;
+      *reason = "another daemon listens there";
+      return UniqueFd();
     }
     unlink(path.c_str());
   }
@@ -135,26 +207,33 @@ bool Server::Listen() {
   // The socket is made with its final mode: no moment when others could
   // connect.
   const mode_t old_mask = umask(options_.group_allowed ? 0117 : 0177);
-  const bool bound = fd.get() >= 0 && bind(fd.get(), reinterpret_cast<struct sockaddr*>(&address),
-                                           sizeof(address)) == 0;
+  const bool made = fd.get() >= 0 && bind(fd.get(), reinterpret_cast<struct sockaddr*>(&address),
+                                          sizeof(address)) == 0;
   const int error = errno;
   umask(old_mask);
-  if (!bound || listen(fd.get(), 64) != 0 ||
-      (options_.group_allowed && lchown(path.c_str(), -1, options_.group) != 0)) {
-    syslog(LOG_ERR, "cannot listen on %s: %s", Quoted(path).c_str(),
-           strerror(bound ? errno : error));
-    return false;
+  if (!made || listen(fd.get(), 64) != 0 ||
+      (options_.group_allowed && lchown(path.c_str(), -1, options_.group) != 0) ||
+      lstat(path.c_str(), bound) != 0) {
+    *reason = strerror(made ? errno : error);
+    if (made) unlink(path.c_str());
+    return UniqueFd();
   }
-  UniqueFd epoll(epoll_create1(EPOLL_CLOEXEC));
+  return fd;
+}
+
+bool Server::Use(UniqueFd listener, std::string* reason) {
+  if (epoll_.get() < 0) epoll_ = UniqueFd(epoll_create1(EPOLL_CLOEXEC));
   struct epoll_event event = {};
   event.events = EPOLLIN;
   event.data.ptr = nullptr;  // the listener
-  if (epoll.get() < 0 || epoll_ctl(epoll.get(), EPOLL_CTL_ADD, fd.get(), &event) != 0) {
-    syslog(LOG_ERR, "cannot wait for clients: %s", strerror(errno));
+  if (epoll_.get() < 0 || epoll_ctl(epoll_.get(), EPOLL_CTL_ADD, listener.get(), &event) != 0) {
+    *reason = std::string("cannot wait for clients: ") + strerror(errno);
+    unlink(options_.socket_path.c_str());  // the file |listener| was just bound to
     return false;
   }
-  listener_ = std::move(fd);
-  epoll_ = std::move(epoll);
+  if (listener_.get() >= 0) Accept();  // connected before the old socket file went
+  listener_ = std::move(listener);     // closing the old one takes it out of epoll
+  accepting_ = true;
   return true;
 }
 
@@ -198,7 +277,10 @@ void Server::ResumeAccepting() {
   accepting_ = epoll_ctl(epoll_.get(), EPOLL_CTL_ADD, listener_.get(), &event) == 0;
 }
 
-void Server::Tick() { ResumeAccepting(); }
+void Server::Tick(double retry_seconds) {
+  ResumeAccepting();
+  Relisten(retry_seconds);
+}
 
 void Server::Handle() {
   struct epoll_event events[64];

@@ -5,6 +5,7 @@
 #ifndef ZORVNOTIFYD_DAEMON_SERVER_H_
 #define ZORVNOTIFYD_DAEMON_SERVER_H_
 
+#include <sys/stat.h>
 #include <sys/types.h>
 
 #include <cstdint>
@@ -19,8 +20,11 @@
 
 namespace zorvnotifyd {
 
+// The socket when none is named; its directory is made when missing.
+constexpr char kDefaultSocketPath[] = "/run/zorvnotifyd/zorvnotifyd.sock";
+
 struct ServerOptions {
-  std::string socket_path = "/run/zorvnotifyd/zorvnotifyd.sock";
+  std::string socket_path = kDefaultSocketPath;
   bool group_allowed = false;  // members of |group| may connect too
   gid_t group = 0;
   size_t client_buffer = 256 * 1024;  // bytes of output a client may have waiting
@@ -38,8 +42,11 @@ class Server {
   Server& operator=(const Server&) = delete;
 
   // Listens on the socket path, replacing a socket left there (never
-  // another kind of file); mode 0600, or 0660 with the group.  False when
-  // that failed (logged).
+  // another kind of file, nor a socket that another daemon listens on);
+  // mode 0600, or 0660 with the group.  The path's directory must be root's
+  // and writable by root alone, or anyone could plant a file or a socket of
+  // their own there; the default directory is made when missing.  False
+  // when that failed (logged).
   bool Listen();
 
   // The descriptor to poll (for input) in the event loop.
@@ -58,10 +65,11 @@ class Server {
   // Moves new records into the clients' buffers (as far as each has room)
   // and writes what the sockets take now.
   void Deliver();
-  // The periodic check: waits for new clients again after accepting one
-  // failed (descriptors or memory ran out), should no client leave to
-  // free what it holds.
-  void Tick();
+  // The periodic check, every |retry_seconds|: waits for new clients again
+  // after accepting one failed (descriptors or memory ran out), should no
+  // client leave to free what it holds; and listens again when the socket
+  // file is no longer the one bound.
+  void Tick(double retry_seconds);
 
   size_t clients() const { return clients_.size(); }
 
@@ -76,7 +84,20 @@ class Server {
     std::string file;
   };
 
+  // Checks the socket's directory and binds a listening socket at the
+  // path; its file's identity goes to |bound|.  An empty descriptor when
+  // that failed, with |reason|.
+  UniqueFd Bind(struct stat* bound, std::string* reason);
+  // Serves |listener| in place of the current listener, whose waiting
+  // connections are accepted first; false with |reason| when it cannot be
+  // polled.
+  bool Use(UniqueFd listener, std::string* reason);
   void Accept();
+  // When the socket file at the path is no longer the one bound (removed or
+  // replaced), listens on a new one as Listen does, keeping the clients;
+  // when that fails, says so once per reason and tries again at the next
+  // call (every |retry_seconds|).
+  void Relisten(double retry_seconds);
   // Takes the listener out of epoll after accept() failed with |error|, so
   // that a condition that lasts cannot keep the event loop busy; logged
   // once until a client is accepted again.
@@ -113,6 +134,8 @@ class Server {
   std::string run_id_;
   std::function<std::string()> status_;
   UniqueFd listener_;
+  struct stat bound_ = {};        // the socket file of listener_
+  std::string relisten_failure_;  // the last reason Relisten logged
   UniqueFd epoll_;
   std::list<Client> clients_;
   std::vector<Client*> dirty_;  // clients with output or records to move

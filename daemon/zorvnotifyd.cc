@@ -43,7 +43,8 @@ const char kUsage[] =
     "names, and delivers each queue's events to the programs that subscribe to it on\n"
     "the daemon's Unix socket, as JSON lines (see zorvnotifyd(8) for the protocol).\n"
     "\n"
-    "  --socket PATH         the socket (default /run/zorvnotifyd/zorvnotifyd.sock)\n"
+    "  --socket PATH         the socket (default /run/zorvnotifyd/zorvnotifyd.sock), in\n"
+    "                        a directory of root's that only root may write\n"
     "  --group GROUP         members of GROUP may connect too (default: root only)\n"
     "  --keep N              events kept per queue for clients that reconnect\n"
     "                        (default 100)\n"
@@ -235,7 +236,7 @@ int Serve(const Options& options) {
     if (ready > 0 && (fds[3].revents & POLLIN)) server.Handle();
     if (tick) {
       tree.Tick(reporter);
-      server.Tick();
+      server.Tick(options.retry_seconds);
       next_tick = NowMs() + retry_ms;
     }
     server.Deliver();

@@ -57,13 +57,17 @@ Json::Value ParseJson(const std::string& text, bool* ok = nullptr) {
   return parsed ? v : Json::Value();
 }
 
-constexpr const char* kSocket = "/tmp/zorvnotifyd.sock";
+// In a directory of root's that only root may write, as a socket's must be.
+constexpr const char* kSocketDir = "/tmp/zorvrun";
+constexpr const char* kSocket = "/tmp/zorvrun/zorvnotifyd.sock";
 
-// The daemon as a child process, listening on kSocket.
+// The daemon as a child process, listening on |socket| (nullptr: its
+// default).
 class Daemon : public zorv_test::ChildProcess {
  public:
-  explicit Daemon(Lines args = {"--json"}, const std::function<bool()>& in_child = nullptr)
-      : ChildProcess(WithSocket(std::move(args)), in_child) {}
+  explicit Daemon(Lines args = {"--json"}, const std::function<bool()>& in_child = nullptr,
+                  const char* socket = kSocket)
+      : ChildProcess(WithSocket(std::move(args), socket), in_child) {}
   // True once a line of standard error holds |text|.
   bool Logged(const std::string& text) { return !WaitFor(text, true).empty(); }
   // True while the daemon's working directory is this test's: watches are
@@ -109,8 +113,9 @@ class Daemon : public zorv_test::ChildProcess {
   }
 
  private:
-  static Lines WithSocket(Lines args) {
-    args.insert(args.begin(), {ZORVNOTIFYD_PATH, "--socket", kSocket});
+  static Lines WithSocket(Lines args, const char* socket) {
+    if (socket != nullptr) args.insert(args.begin(), {"--socket", socket});
+    args.insert(args.begin(), ZORVNOTIFYD_PATH);
     return args;
   }
 };
@@ -173,6 +178,8 @@ class DaemonTest : public ::testing::Test {
   void SetUp() override {
     ZORV_REQUIRE_SANDBOX();
     zorv_test::ResetStore();
+    mkdir(kSocketDir, 0755);
+    ASSERT_EQ(chmod(kSocketDir, 0755), 0);
   }
 };
 
@@ -675,6 +682,98 @@ TEST_F(DaemonTest, OutlivesHostileClients) {
   ASSERT_TRUE(again.Send("{\"request\":\"status\"}"));
   EXPECT_EQ(again.Next()["reply"], "status");
   EXPECT_EQ(daemon.Stop(SIGTERM), 0);
+}
+
+// A socket listening at |path|, as another daemon's would; closed with it.
+class OtherDaemon {
+ public:
+  explicit OtherDaemon(const char* path) : fd_(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0)) {
+    struct sockaddr_un address = {};
+    address.sun_family = AF_UNIX;
+    strcpy(address.sun_path, path);
+    EXPECT_EQ(bind(fd_, reinterpret_cast<struct sockaddr*>(&address), sizeof(address)), 0);
+    EXPECT_EQ(listen(fd_, 8), 0);
+  }
+  ~OtherDaemon() { close(fd_); }
+
+ private:
+  int fd_;
+};
+
+// In a mount namespace of its own, an empty /run, as on a machine where the
+// service never ran; the host's stays as it is.  For a pre-exec hook.
+bool PrivateRun() {
+  return unshare(CLONE_NEWNS) == 0 &&
+         mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == 0 &&
+         mount("zorv-test", "/run", "tmpfs", 0, "mode=0755") == 0;
+}
+
+// The socket file removed or replaced while the daemon runs, a socket
+// directory that others may write, and the default runtime directory
+// missing, as when the daemon is started by hand.
+TEST_F(DaemonTest, ListensOnItsOwnSocketInARootOnlyDirectory) {
+  ASSERT_EQ(std::system("rm -rf /tmp/k && mkdir /tmp/k"), 0);
+  Register("k", "/tmp/k", kCreate);
+  Daemon daemon({"--json", "--retry", "0.05"});
+  ASSERT_TRUE(daemon.Logged("ready: watching 1 directories for 1 queues"));
+  Client before;
+  ASSERT_TRUE(before.connected());
+  Subscribe(before, "k");
+  const std::string replaced =
+      "the socket file \"/tmp/zorvrun/zorvnotifyd.sock\" was removed or replaced";
+  ASSERT_EQ(unlink(kSocket), 0);
+  ASSERT_TRUE(daemon.Logged(replaced + ": listening on a new one"));
+  // New clients reach it again, and the old ones are still served.
+  Client after;
+  ASSERT_TRUE(after.connected());
+  Subscribe(after, "k");
+  ASSERT_TRUE(Put("/tmp/k/a", "x"));
+  EXPECT_EQ(before.Line(), "k 1 /tmp/k/a");
+  EXPECT_EQ(after.Line(), "k 1 /tmp/k/a");
+  // Another daemon's live socket in its place is never taken, nor removed
+  // when this daemon stops; once it is stale, it is replaced.
+  ASSERT_EQ(unlink(kSocket), 0);
+  const std::string taken = replaced + ", and a new one cannot be made: another daemon listens";
+  {
+    const OtherDaemon other(kSocket);
+    ASSERT_TRUE(daemon.Logged(taken));
+  }
+  ASSERT_TRUE(daemon.Logged(replaced + ": listening on a new one"));
+  ASSERT_EQ(unlink(kSocket), 0);
+  const OtherDaemon other(kSocket);
+  ASSERT_TRUE(daemon.Logged(taken));
+  struct stat planted, left;
+  ASSERT_EQ(lstat(kSocket, &planted), 0);
+  EXPECT_EQ(daemon.Stop(SIGTERM), 0);
+  ASSERT_EQ(lstat(kSocket, &left), 0);
+  EXPECT_EQ(left.st_ino, planted.st_ino);
+
+  // A directory anyone may write, or one that is not root's, would let a
+  // user block the start or serve a socket of their own.
+  MakeDirs({"/tmp/open", "/tmp/theirs"});
+  ASSERT_TRUE(chmod("/tmp/open", 01777) == 0 && chown("/tmp/theirs", 65534, 0) == 0);
+  for (const std::string dir : {"/tmp/open", "/tmp/theirs"}) {
+    Daemon refused({}, nullptr, (dir + "/zorvnotifyd.sock").c_str());
+    EXPECT_TRUE(refused.Logged("its directory \"" + dir + "\" is owned by uid " +
+                               (dir == "/tmp/open" ? "0 with mode 1777" : "65534 with mode 0755") +
+                               "; it must be root's and writable by root alone"));
+    EXPECT_EQ(refused.Stop(0), 1);
+    EXPECT_NE(access((dir + "/zorvnotifyd.sock").c_str(), F_OK), 0);
+  }
+
+  // Started by hand, without the runtime directory its service makes: the
+  // daemon makes it.
+  Daemon by_hand({}, PrivateRun, nullptr);
+  EXPECT_TRUE(by_hand.Logged("made the socket's directory \"/run/zorvnotifyd\""));
+  ASSERT_TRUE(by_hand.Logged("ready:"));
+  const std::string run = "/proc/" + std::to_string(by_hand.pid()) + "/root/run/zorvnotifyd";
+  struct stat st;
+  ASSERT_EQ(lstat(run.c_str(), &st), 0);
+  EXPECT_TRUE(S_ISDIR(st.st_mode) && st.st_uid == 0 && (st.st_mode & 07777) == 0755)
+      << std::oct << st.st_mode;
+  ASSERT_EQ(lstat((run + "/zorvnotifyd.sock").c_str(), &st), 0);
+  EXPECT_TRUE(S_ISSOCK(st.st_mode));
+  EXPECT_EQ(by_hand.Stop(SIGTERM), 0);
 }
 
 // A read-only /usr holding only the etc configuration directory, as seen

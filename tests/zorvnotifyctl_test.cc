@@ -8,10 +8,14 @@
 #include <stdlib.h>
 #include <sys/file.h>
 #include <sys/inotify.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/un.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <cerrno>
+#include <cstring>
 #include <fstream>
 #include <functional>
 #include <sstream>
@@ -249,10 +253,46 @@ TEST(ZorvnotifyctlTest, RefusesSetUserIdAndReportsABusyStore) {
 TEST(ZorvnotifyctlTest, WatchAndStatusAskTheDaemon) {
   ZORV_REQUIRE_SANDBOX();
   zorv_test::ResetStore();
-  const std::string socket = "/tmp/ctl.sock";
+  // A socket's directory must be root's and writable by root alone.
+  mkdir("/tmp/zorvrun", 0755);
+  ASSERT_EQ(chmod("/tmp/zorvrun", 0755), 0);
+  const std::string socket = "/tmp/zorvrun/ctl.sock";
   std::string out, err;
   EXPECT_EQ(RunTool("--socket " + socket + " watch backup", "", &out, &err), 1);
-  EXPECT_THAT(err, ::testing::HasSubstr("zorvnotifyd is not running (no socket at /tmp/ctl.sock)"));
+  EXPECT_THAT(err, ::testing::HasSubstr("zorvnotifyd is not running (no socket at " + socket));
+
+  // A socket whose listener is not root is not the daemon's, whatever it
+  // answers: bound by root, then listened on by uid 65534.
+  const char* fake = "/tmp/zorvrun/fake.sock";
+  int ready[2];
+  ASSERT_EQ(pipe2(ready, O_CLOEXEC), 0);
+  const pid_t impostor = fork();
+  if (impostor == 0) {
+    const int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    struct sockaddr_un address = {};
+    address.sun_family = AF_UNIX;
+    strcpy(address.sun_path, fake);
+    const char answer[] = "{\"reply\":\"status\",\"queues\":4242}\n";
+    if (bind(fd, reinterpret_cast<struct sockaddr*>(&address), sizeof(address)) != 0 ||
+        setresgid(65534, 65534, 65534) != 0 || setresuid(65534, 65534, 65534) != 0 ||
+        listen(fd, 8) != 0 || write(ready[1], "x", 1) != 1) {
+      _exit(1);
+    }
+    for (int client; (client = accept(fd, nullptr, nullptr)) >= 0; close(client)) {
+      (void)!write(client, answer, sizeof(answer) - 1);
+    }
+    _exit(0);
+  }
+  close(ready[1]);
+  char byte;
+  ASSERT_EQ(read(ready[0], &byte, 1), 1);
+  close(ready[0]);
+  EXPECT_EQ(RunTool(std::string("--socket ") + fake + " status", "", &out, &err), 1);
+  EXPECT_THAT(err, ::testing::HasSubstr("is served by uid 65534 (pid " + std::to_string(impostor) +
+                                        "), not by root"));
+  EXPECT_EQ(out.find("4242"), std::string::npos) << out;
+  kill(impostor, SIGKILL);
+  waitpid(impostor, nullptr, 0);
 
   ASSERT_EQ(std::system("rm -rf /tmp/wd && mkdir /tmp/wd"), 0);
   const Json::Value queue = Parse(R"({"queue": "backup", "config": [{"path": "/tmp/wd", "mask": )" +

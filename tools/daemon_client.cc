@@ -32,13 +32,28 @@ bool DaemonClient::Connect(const std::string& path, std::string* error) {
     *error = std::string("cannot create a socket: ") + strerror(errno);
     return false;
   }
+  const std::string shown = zorvcommon::Printable(path);
   if (connect(fd_, reinterpret_cast<struct sockaddr*>(&address), sizeof(address)) == 0) {
-    return true;
+    // Whoever could make the socket file answers here: only root's socket
+    // is the daemon's, and nothing it says is trusted before that is known.
+    struct ucred peer = {};
+    socklen_t size = sizeof(peer);
+    if (getsockopt(fd_, SOL_SOCKET, SO_PEERCRED, &peer, &size) != 0) {
+      *error = "cannot tell who serves the socket at " + shown + ": " + strerror(errno);
+    } else if (peer.uid != 0) {
+      *error = "refusing the socket at " + shown + ": it is served by uid " +
+               std::to_string(peer.uid) + " (pid " + std::to_string(peer.pid) +
+               "), not by root, so it is not zorvnotifyd's";
+    } else {
+      return true;
+    }
+    close(fd_);
+    fd_ = -1;
+    return false;
   }
   const int failure = errno;
   close(fd_);
   fd_ = -1;
-  const std::string shown = zorvcommon::Printable(path);
   if (failure == ENOENT || failure == ENOTDIR) {
     *error = "zorvnotifyd is not running (no socket at " + shown + ")";
   } else if (failure == ECONNREFUSED) {

@@ -27,9 +27,11 @@ class DaemonClient {
   DaemonClient(const DaemonClient&) = delete;
   DaemonClient& operator=(const DaemonClient&) = delete;
 
-  // Connects to the socket at |path|.  On failure returns false with
-  // |error| a message for the user; it starts with "zorvnotifyd is not
-  // running" when no daemon listens there (no socket, or a stale one).
+  // Connects to the socket at |path| and checks that root serves it (the
+  // daemon runs as root; anyone else's socket is an impostor's).  On
+  // failure returns false with |error| a message for the user; it starts
+  // with "zorvnotifyd is not running" when no daemon listens there (no
+  // socket, or a stale one).
   bool Connect(const std::string& path, std::string* error);
 
   // Sends |line| and a newline, all of it (never raises SIGPIPE).
