@@ -269,8 +269,9 @@ TEST(ZorvnotifyctlTest, WatchAndStatusAskTheDaemon) {
   EXPECT_EQ(watch.Read(), "watching backup: etc/nas (last #0)");
   std::ofstream("/tmp/wd/new").flush();
   EXPECT_EQ(watch.Read(), "backup [etc/nas] #1 IN_CREATE /tmp/wd/new");
+  std::ofstream("/tmp/wd/b\xff").flush();  // named by its escape, as valid UTF-8
+  EXPECT_EQ(watch.Read(), "backup [etc/nas] #2 IN_CREATE /tmp/wd/b\\udcff");
   EXPECT_EQ(watch.Stop(SIGINT), 0);
-  std::ofstream("/tmp/wd/b\xff").flush();
 
   // Kept records come first with --since; the daemon's going away ends
   // the watch with status 1.

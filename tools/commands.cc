@@ -21,6 +21,7 @@
 #include "catalogue_view.h"
 #include "daemon_client.h"
 #include "event_names.h"
+#include "json_bytes.h"
 #include "json_output.h"
 #include "library_log.h"
 #include "lock_holder.h"
@@ -243,6 +244,13 @@ std::string JsonLine(const Json::Value& value) {
   return Json::writeString(builder, value);
 }
 
+// A string of the daemon's JSON as text: each "\udcXY" escape, which the
+// JSON reader turns into the UTF-8 form of a lone surrogate, becomes its
+// byte again, which Printable writes as "\udcXY" (valid UTF-8 naming it).
+std::string Shown(const Json::Value& value) {
+  return Printable(zorvcommon::DecodeRawBytes(value.asString()));
+}
+
 // Parses one line from the daemon; false when it is not a JSON object.
 bool ParseLine(const std::string& line, Json::Value* value) {
   static const std::unique_ptr<Json::CharReader> reader(Json::CharReaderBuilder().newCharReader());
@@ -286,7 +294,7 @@ bool Ask(DaemonClient* client, const Invocation& invocation, const Json::Value& 
   const Json::Value& answer = *reply;  // read only: no member is added
   const Json::Value& refusal = answer["error"];
   if (refusal.isString()) {
-    *status = Fail(kExitRefused, "zorvnotifyd refused: " + Printable(refusal.asString()));
+    *status = Fail(kExitRefused, "zorvnotifyd refused: " + Shown(refusal));
     return false;
   }
   if (answer["reply"] != kind) {
@@ -303,8 +311,7 @@ bool QueueLabel(const Json::Value& value, std::string* label) {
   const Json::Value& type = value["type"];
   const Json::Value& file = value["file"];
   if (!queue.isString() || !type.isString() || !file.isString()) return false;
-  *label = Printable(queue.asString()) + " [" + Printable(type.asString()) + "/" +
-           Printable(file.asString()) + "]";
+  *label = Shown(queue) + " [" + Shown(type) + "/" + Shown(file) + "]";
   return true;
 }
 
@@ -325,7 +332,7 @@ std::string ReadableRecord(const std::string& line) {
   const Json::Value& path = value["path"];
   const Json::Value& mask = value["mask"];
   if (path.isString() && mask.isUInt()) {
-    return label + zorvcommon::MaskNames(mask.asUInt()) + " " + Printable(path.asString());
+    return label + zorvcommon::MaskNames(mask.asUInt()) + " " + Shown(path);
   }
   if (value["lost"] == true) {
     return label + "LOST events may have been lost (inotify queue overflow)";
@@ -344,8 +351,7 @@ std::string ReadableSubscription(const Json::Value& reply, const std::string& na
     const Json::Value& seq = queue["seq"];
     if (!type.isString() || !file.isString() || !seq.isUInt64()) continue;
     if (!queues.empty()) queues += ", ";
-    queues += Printable(type.asString()) + "/" + Printable(file.asString()) + " (last #" +
-              std::to_string(seq.asUInt64()) + ")";
+    queues += Shown(type) + "/" + Shown(file) + " (last #" + std::to_string(seq.asUInt64()) + ")";
   }
   return "watching " + Printable(name) + ": " +
          (queues.empty() ? "not in the catalogue now; its events follow once it is registered"
@@ -637,7 +643,7 @@ int RunStatus(const Invocation& invocation) {
     const Json::Value& value = answer[key];
     std::cout << label << std::string(kValueColumn - strlen(label), ' ')
               << (value.isUInt64()   ? std::to_string(value.asUInt64())
-                  : value.isString() ? Printable(value.asString())
+                  : value.isString() ? Shown(value)
                                      : "-")
               << '\n';
   }
