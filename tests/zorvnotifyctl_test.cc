@@ -120,6 +120,8 @@ TEST(ZorvnotifyctlTest, RefusalsExitStatusesAndJsonOutput) {
        "\n}",
        2, "line 1: comments are not allowed"},
       {"upsert q", std::string(5000, '['), 2, "invalid JSON: nested too deeply"},
+      {"upsert q /dev/zero", "", 2, "cannot read /dev/zero: it holds more than 16 MiB"},
+      {"upsert q - </dev/zero", "", 2, "cannot read standard input: it holds more than 16 MiB"},
       {"upsert q", obj + R"("mask": 1, "ignore": ["a\u0000|b"]}]})", 2,
        R"(ignore[0] "a\x00|b" holds a NUL)"},
       {"upsert ''", ok, 2, "the queue file name is empty"},

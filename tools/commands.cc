@@ -2,6 +2,7 @@
 
 #include "commands.h"
 
+#include <fcntl.h>
 #include <signal.h>
 #include <sys/signalfd.h>
 #include <sys/stat.h>
@@ -11,13 +12,12 @@
 #include <cerrno>
 #include <chrono>
 #include <cstring>
-#include <fstream>
 #include <functional>
 #include <iostream>
 #include <memory>
 #include <set>
-#include <sstream>
 
+#include "bounded_read.h"
 #include "catalogue_view.h"
 #include "daemon_client.h"
 #include "event_names.h"
@@ -170,34 +170,35 @@ bool StoreWithRetry(const Invocation& invocation, const std::function<bool()>& s
   return false;
 }
 
-// Reads the whole of |source| ("-" is standard input) into |text|.
+// Reads the whole of |source| ("-" is standard input) into |text|, within
+// the size of the largest queue file: a source that holds more (a device
+// such as /dev/zero included) is refused once that much has been read.
+// A fifo named as |source| is read as the user asked, until its writer ends.
 bool ReadSource(const std::string& source, std::string* text, std::string* error) {
-  std::ostringstream content;
-  if (source == "-") {
-    content << std::cin.rdbuf();
-    if (std::cin.bad()) {
-      *error = "cannot read the queue object from standard input";
-      return false;
-    }
-  } else {
-    struct stat st;
-    if (stat(source.c_str(), &st) == 0 && S_ISDIR(st.st_mode)) {
-      *error = "cannot read " + source + ": it is a directory";
-      return false;
-    }
-    std::ifstream in(source, std::ios::binary);
-    if (!in) {
-      *error = "cannot open " + source + ": " + strerror(errno);
-      return false;
-    }
-    content << in.rdbuf();
-    if (in.bad()) {
-      *error = "cannot read " + source;
-      return false;
-    }
+  const bool stdin_source = source == "-";
+  const std::string name = stdin_source ? "standard input" : zorvcommon::Printable(source);
+  const zorvcommon::ScopedFd opened(stdin_source ? -1 : open(source.c_str(), O_RDONLY | O_CLOEXEC));
+  const int fd = stdin_source ? STDIN_FILENO : opened.get();
+  struct stat st;
+  if (fd < 0 || fstat(fd, &st) != 0) {
+    *error = "cannot open " + name + ": " + strerror(errno);
+    return false;
   }
-  *text = content.str();
-  return true;
+  if (S_ISDIR(st.st_mode)) {
+    *error = "cannot read " + name + ": it is a directory";
+    return false;
+  }
+  switch (zorvcommon::ReadAtMost(fd, zorvcommon::kMaxQueueFileSize, text)) {
+    case zorvcommon::BoundedRead::kWhole:
+      return true;
+    case zorvcommon::BoundedRead::kTooLarge:
+      *error =
+          "cannot read " + name + ": it holds more than 16 MiB, the most a queue file may hold";
+      return false;
+    default:
+      *error = "cannot read " + name + ": " + strerror(errno);
+      return false;
+  }
 }
 
 // The index over the queues of |queues|, in the same order.
