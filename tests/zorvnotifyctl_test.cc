@@ -246,6 +246,22 @@ TEST(ZorvnotifyctlTest, RefusesSetUserIdAndReportsABusyStore) {
   EXPECT_EQ(RunTool("upsert q", queue, &out, &err), 0) << err;
   EXPECT_THAT(err, ::testing::HasSubstr("the change is stored, but the service manager could not "
                                         "be asked to start or stop zorvnotifyd"));
+
+  // Something other than a file planted at the lock's fixed path: nobody
+  // holds the lock, so the writer says what is there at once, without retrying.
+  const char* lock_path = "/tmp/zorvnotifyd_monitor_q.lock";
+  ASSERT_EQ(unlink(lock_path), 0);
+  ASSERT_EQ(symlink("/nowhere", lock_path), 0);
+  ASSERT_EQ(lchown(lock_path, 1000, 1000), 0);
+  EXPECT_EQ(RunTool("upsert q", queue, &out, &err), 1);
+  EXPECT_THAT(err, ::testing::HasSubstr("/tmp/zorvnotifyd_monitor_q.lock is a symbolic link "
+                                        "(owner uid 1000"));
+  EXPECT_THAT(err, ::testing::HasSubstr("nobody holds the store lock; root should remove it"));
+  ASSERT_EQ(unlink(lock_path), 0);
+  ASSERT_EQ(mkdir(lock_path, 0755), 0);
+  EXPECT_EQ(RunTool("delete q q", "", &out, &err), 1);
+  EXPECT_THAT(err, ::testing::HasSubstr("lock is a directory (owner uid 0, user root)"));
+  ASSERT_EQ(rmdir(lock_path), 0);
 }
 
 TEST(ZorvnotifyctlTest, WatchAndStatusAskTheDaemon) {

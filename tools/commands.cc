@@ -134,7 +134,8 @@ std::string WhyNotWritten(QueueType type) {
 // stored; otherwise |status| is set: kExitBusy, with the lock's holder
 // named, when the lock stayed held (the library's own "Lock failed" lines
 // are then left out), else kExitRefused with |failure| (the library's
-// message precedes it).
+// message precedes it), also at once, with what stands there, when
+// something other than a regular file was planted at the lock's path.
 bool StoreWithRetry(const Invocation& invocation, const std::function<bool()>& store,
                     const std::string& failure, int* status) {
   using Clock = std::chrono::steady_clock;
@@ -157,6 +158,17 @@ bool StoreWithRetry(const Invocation& invocation, const std::function<bool()>& s
     }
     if (!busy) {
       *status = Fail(kExitRefused, failure + WhyNotWritten(invocation.type));
+      return false;
+    }
+    // Something planted at the lock's fixed path is never locked by anyone:
+    // waiting would not help, so the writer says what is there at once.
+    const std::string planted = PlantedLockFile(kStoreLockFile);
+    if (!planted.empty()) {
+      *status =
+          Fail(kExitRefused, failure + ": the store lock " + kStoreLockFile + " is " + planted +
+                                 ", which the library never opens: nobody holds the store "
+                                 "lock; root should remove it (rm -r " +
+                                 kStoreLockFile + ") and try again");
       return false;
     }
     if (Clock::now() >= deadline) break;
