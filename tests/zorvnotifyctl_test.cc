@@ -313,14 +313,28 @@ TEST(ZorvnotifyctlTest, ReadsFilesInNameOrderAndAReadOnlyUsrWithWarnings) {
   ZORV_REQUIRE_SANDBOX();
   zorv_test::ResetStore();
   ASSERT_EQ(std::system("mkdir -p -m 0700 /usr/zorv/etc/zorvnotifyd"), 0);
-  const std::vector<std::string> names = {"a", "m", "nas.bak", "z"};
-  for (const char* file : {"m", "z", "a", "nas.bak"}) {
+  const std::vector<std::string> names = {"a", "m", "nas.bak", "p", "z"};
+  for (const char* file : {"m", "z", "a", "nas.bak", "w"}) {
     std::ofstream(std::string("/usr/zorv/etc/zorvnotifyd/") + file)
         << R"([{"queue": ")" << file << R"(", "config": [{"path": "/s/t", "mask": 1}]}])";
   }
+  // Files read in part or not at all are named, and the status says so;
+  // a file others can write is refused whole.
+  std::ofstream("/usr/zorv/etc/zorvnotifyd/p") << R"([{"queue": "p"}, {"queue": ["x"]}])";
+  std::ofstream("/usr/zorv/etc/zorvnotifyd/t") << R"([{"queue": "t"}, )";
+  ASSERT_EQ(chmod("/usr/zorv/etc/zorvnotifyd/w", 0666), 0);
+  Check({{"list w", "", 1,
+          "queue file /usr/zorv/etc/zorvnotifyd/w is refused: it is writable by group or others"},
+         {"get w w", "", 1, "/usr/zorv/etc/zorvnotifyd/w is refused"}});
   // Every catalogue command loads through the same reader; one stands for all.
   std::string out, err;
-  EXPECT_EQ(RunTool("catalogue --json", "", &out, &err, zorv_test::PrivateReadOnlyUsr), 0) << err;
+  EXPECT_EQ(RunTool("catalogue --json", "", &out, &err, zorv_test::PrivateReadOnlyUsr), 1) << err;
+  EXPECT_THAT(err, ::testing::HasSubstr("queue file etc/p could not be read completely: a queue in "
+                                        "it has a value of the wrong type"));
+  EXPECT_THAT(err, ::testing::HasSubstr("queue file etc/t could not be read completely: not valid "
+                                        "JSON"));
+  EXPECT_THAT(err, ::testing::HasSubstr("queue file /usr/zorv/etc/zorvnotifyd/w is refused: it is "
+                                        "writable by group or others"));
   EXPECT_THAT(err, ::testing::HasSubstr(
                        "warning: the configuration directory /usr/local/etc/zorvnotifyd is "
                        "missing and could not be created; the local-etc type counts as empty"));

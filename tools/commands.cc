@@ -29,6 +29,7 @@
 #include "monitor_queue.h"
 #include "monitor_queue_index.h"
 #include "queue_file_name.h"
+#include "queue_files.h"
 #include "queue_object.h"
 #include "table.h"
 
@@ -222,9 +223,28 @@ MonitorQueueIndex CatalogueIndex(const std::vector<TypedQueue>& queues) {
 }
 
 // Loads the catalogue with types, or reports the failure (exit status 1).
+// When a queue file was refused or read only in part (each said on
+// standard error), returns true with |status| set to kExitRefused: what
+// loaded is still shown, and the status tells that it is not all.
 bool LoadCatalogueOrFail(std::vector<TypedQueue>* queues, int* status) {
-  if (LoadCatalogue(queues)) return true;
+  bool complete = true;
+  if (LoadCatalogue(queues, &complete)) {
+    if (!complete) *status = kExitRefused;
+    return true;
+  }
   *status = Fail(kExitRefused, "cannot read the catalogue (see the message above)");
+  return false;
+}
+
+// Refuses the queue file |file| of |invocation.type| when root alone does
+// not control it (exit status 1).  A missing file passes: it holds no queues.
+bool CheckTrusted(const Invocation& invocation, const std::string& file, int* status) {
+  const std::string dir = MonitorQueue::GetConfDir(invocation.type);
+  struct stat st;
+  if (lstat((dir + "/" + file).c_str(), &st) != 0 && errno == ENOENT) return true;
+  const std::string why = zorvcommon::UntrustedQueueFile(dir, file);
+  if (why.empty()) return true;
+  *status = Fail(kExitRefused, RefusedQueueFile(dir + "/" + file, why));
   return false;
 }
 
@@ -383,7 +403,7 @@ int Fail(int status, const std::string& message) {
 int RunList(const Invocation& invocation) {
   const std::string& file = invocation.args[0];
   int status = kExitOk;
-  if (!CheckFileName(file, &status)) return status;
+  if (!CheckFileName(file, &status) || !CheckTrusted(invocation, file, &status)) return status;
   std::vector<MonitorQueue> queues;
   if (!MonitorQueue::List(queues, file, invocation.type)) {
     return Fail(kExitRefused, "cannot read " + FileLabel(invocation, file) +
@@ -398,7 +418,7 @@ int RunGet(const Invocation& invocation) {
   const std::string& name = invocation.args[0];
   const std::string& file = invocation.args[1];
   int status = kExitOk;
-  if (!CheckFileName(file, &status)) return status;
+  if (!CheckFileName(file, &status) || !CheckTrusted(invocation, file, &status)) return status;
   MonitorQueue queue{Json::Value()};
   if (!MonitorQueue::Get(queue, name, file, invocation.type)) {
     return Fail(kExitRefused,
@@ -491,14 +511,14 @@ int RunCatalogue(const Invocation& invocation) {
       array.append(object);
     }
     WriteJson(std::cout, array);
-    return kExitOk;
+    return status;
   }
   Table table({"TYPE", "QUEUE", "PATH", "MASK", "IGNORE"});
   for (const TypedQueue& entry : queues) {
     AddQueueRows(&table, {QueueTypeName(entry.type)}, entry.queue);
   }
   PrintTableOrNone(table, "(no queues)");
-  return kExitOk;
+  return status;
 }
 
 int RunMatch(const Invocation& invocation) {
@@ -532,7 +552,7 @@ int RunMatch(const Invocation& invocation) {
   } else {
     PrintTableOrNone(table, "(no queue wants this event)");
   }
-  return kExitOk;
+  return status;
 }
 
 int RunDirs(const Invocation& invocation) {
@@ -560,11 +580,11 @@ int RunDirs(const Invocation& invocation) {
     result["mask"] = all;
     result["queues"] = watchers;
     WriteJson(std::cout, result);
-    return kExitOk;
+    return status;
   }
   PrintTableOrNone(table, "(no queue watches this directory or below it)");
   std::cout << "union mask: " << FormatMask(all) << '\n';
-  return kExitOk;
+  return status;
 }
 
 int RunShares(const Invocation& invocation) {
@@ -577,12 +597,12 @@ int RunShares(const Invocation& invocation) {
     Json::Value array(Json::arrayValue);
     for (const std::string& share : shares) array.append(share);
     WriteJson(std::cout, array);
-    return kExitOk;
+    return status;
   }
   Table table({"SHARE"});
   for (const std::string& share : shares) table.AddRow({Printable(share)});
   PrintTableOrNone(table, "(no shares)");
-  return kExitOk;
+  return status;
 }
 
 int RunWatch(const Invocation& invocation) {
