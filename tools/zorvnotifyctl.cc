@@ -88,7 +88,7 @@ constexpr CommandInfo kCommands[] = {
      "With --json: an array of queue objects, each with an added \"type\".  A queue\n"
      "file that cannot be read completely, or that root alone does not control\n"
      "(refused whole), is named on standard error with why; what loaded is shown\n"
-     "and the exit status is 1.  So do match, dirs and shares.\n"},
+     "and the exit status is 1.  Likewise for match, dirs and shares.\n"},
     {"match", 2, 2, kNoOption, RunMatch, "PATH MASK",
      "Shows the queues of the catalogue that want an event of the kinds MASK on\n"
      "PATH: some configuration shares a bit with MASK, PATH is its directory or\n"
