@@ -325,7 +325,15 @@ TEST(ZorvnotifyctlTest, ReadsFilesInNameOrderAndAReadOnlyUsrWithWarnings) {
   ASSERT_EQ(chmod("/usr/zorv/etc/zorvnotifyd/w", 0666), 0);
   Check({{"list w", "", 1,
           "queue file /usr/zorv/etc/zorvnotifyd/w is refused: it is writable by group or others"},
-         {"get w w", "", 1, "/usr/zorv/etc/zorvnotifyd/w is refused"}});
+         {"get w w", "", 1, "/usr/zorv/etc/zorvnotifyd/w is refused"},
+         {"list a", "", 0, ""}});
+  ASSERT_EQ(chown("/usr/zorv/etc/zorvnotifyd/a", 1000, 0), 0);
+  ASSERT_EQ(chmod("/usr/zorv", 0775), 0);
+  Check(
+      {{"list a", "", 1, "zorvnotifyd/a is refused: it belongs to uid 1000"},
+       {"list m", "", 1, "m is refused: its directory /usr/zorv is writable by group or others"}});
+  ASSERT_EQ(chown("/usr/zorv/etc/zorvnotifyd/a", 0, 0), 0);
+  ASSERT_EQ(chmod("/usr/zorv", 0755), 0);
   // Every catalogue command loads through the same reader; one stands for all.
   std::string out, err;
   EXPECT_EQ(RunTool("catalogue --json", "", &out, &err, zorv_test::PrivateReadOnlyUsr), 1) << err;
