@@ -5,7 +5,6 @@
 #include <dirent.h>
 #include <fcntl.h>
 #include <json/json.h>
-#include <limits.h>
 #include <pwd.h>
 #include <stdlib.h>
 #include <sys/stat.h>
@@ -84,8 +83,13 @@ std::string WhyUnloadable(const std::string& path) {
     case BoundedRead::kWhole:
       break;
     case BoundedRead::kTooLarge:
-      return "too large (" + std::to_string(std::max<off_t>(st.st_size, kMaxQueueFileSize + 1)) +
-             " bytes; at most 16 MiB are read)";
+      // The size is that of the fstat; a file that grew since then is only
+      // said to be over the bound.
+      return std::string("too large (") +
+             (st.st_size > static_cast<off_t>(kMaxQueueFileSize)
+                  ? std::to_string(st.st_size) + " bytes, "
+                  : std::string()) +
+             "more than the 16 MiB a queue file may hold)";
     default:
       return strerror(errno);
   }

@@ -322,6 +322,7 @@ TEST(ZorvnotifyctlTest, ReadsFilesInNameOrderAndAReadOnlyUsrWithWarnings) {
   // a file others can write is refused whole.
   std::ofstream("/usr/zorv/etc/zorvnotifyd/p") << R"([{"queue": "p"}, {"queue": ["x"]}])";
   std::ofstream("/usr/zorv/etc/zorvnotifyd/t") << R"([{"queue": "t"}, )";
+  std::ofstream("/usr/zorv/etc/zorvnotifyd/o") << "[" << std::string(16 << 20, ' ') << "]";
   ASSERT_EQ(chmod("/usr/zorv/etc/zorvnotifyd/w", 0666), 0);
   Check({{"list w", "", 1,
           "queue file /usr/zorv/etc/zorvnotifyd/w is refused: it is writable by group or others"},
@@ -341,6 +342,8 @@ TEST(ZorvnotifyctlTest, ReadsFilesInNameOrderAndAReadOnlyUsrWithWarnings) {
                                         "it has a value of the wrong type"));
   EXPECT_THAT(err, ::testing::HasSubstr("queue file etc/t could not be read completely: not valid "
                                         "JSON"));
+  EXPECT_THAT(err, ::testing::HasSubstr("etc/o could not be read completely: too large (16777218 "
+                                        "bytes, more than the 16 MiB a queue file may hold)"));
   EXPECT_THAT(err, ::testing::HasSubstr("queue file /usr/zorv/etc/zorvnotifyd/w is refused: it is "
                                         "writable by group or others"));
   EXPECT_THAT(err, ::testing::HasSubstr(
