@@ -10,11 +10,12 @@ namespace {
 
 bool Continuation(unsigned char byte) { return (byte & 0xC0) == 0x80; }
 
-// The length of the valid UTF-8 sequence at the start of |text| (1 for an
-// ASCII byte), or 0 when its first byte does not begin one.  The ranges of
-// the second byte exclude overlong forms, surrogates and code points above
-// U+10FFFF.
-size_t Utf8Length(std::string_view text) {
+}  // namespace
+
+// The ranges of the second byte exclude overlong forms, surrogates and code
+// points above U+10FFFF.
+size_t Utf8SequenceLength(std::string_view text) {
+  if (text.empty()) return 0;
   const auto at = [&text](size_t i) { return static_cast<unsigned char>(text[i]); };
   const unsigned char lead = at(0);
   if (lead < 0x80) return 1;
@@ -40,13 +41,11 @@ size_t Utf8Length(std::string_view text) {
   return length;
 }
 
-}  // namespace
-
 void AppendJsonString(std::string* out, std::string_view text) {
   out->push_back('"');
   for (size_t i = 0; i < text.size();) {
     const auto byte = static_cast<unsigned char>(text[i]);
-    const size_t length = Utf8Length(text.substr(i));
+    const size_t length = Utf8SequenceLength(text.substr(i));
     if (length > 1 || (length == 1 && byte >= 0x20 && byte != '"' && byte != '\\')) {
       out->append(text.substr(i, length));
       i += length;

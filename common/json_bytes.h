@@ -20,6 +20,11 @@
 
 namespace zorvcommon {
 
+// The length of the valid UTF-8 sequence at the start of |text| (1 for an
+// ASCII byte), or 0 when |text| is empty or its first byte does not begin
+// one (overlong forms, surrogates and code points above U+10FFFF do not).
+size_t Utf8SequenceLength(std::string_view text);
+
 // Appends |text| to |out| as a JSON string, quotes included: '"', '\' and
 // control bytes escaped (\n, \t, ... or \u00XX), each byte that is not part
 // of valid UTF-8 as \udcXY, valid UTF-8 as it is.

@@ -3,13 +3,52 @@
 #include "queue_files.h"
 
 #include <dirent.h>
+#include <fcntl.h>
+#include <json/json.h>
+#include <pwd.h>
+#include <stdlib.h>
 #include <sys/stat.h>
 
 #include <algorithm>
+#include <cerrno>
 #include <cstring>
+#include <exception>
 #include <memory>
+#include <string>
+
+#include "bounded_read.h"
+#include "text.h"
 
 namespace zorvcommon {
+namespace {
+
+// Why |st|, the status of |what|, is not root's alone, or "".
+std::string NotRootsAlone(const struct stat& st, const std::string& what) {
+  if (st.st_uid != 0) {
+    const struct passwd* user = getpwuid(st.st_uid);
+    return what + " belongs to uid " + std::to_string(st.st_uid) +
+           (user != nullptr ? " (user " + Printable(user->pw_name) + ")" : "") + ", not root";
+  }
+  if ((st.st_mode & (S_IWGRP | S_IWOTH)) != 0) return what + " is writable by group or others";
+  return std::string();
+}
+
+// Why |dir| (absolute) or a directory above it is not root's alone, or "".
+std::string UntrustedDirectories(std::string dir) {
+  for (;;) {
+    struct stat st;
+    if (stat(dir.c_str(), &st) != 0) {
+      return "its directory " + Printable(dir) + " cannot be checked: " + strerror(errno);
+    }
+    std::string why = NotRootsAlone(st, "its directory " + Printable(dir));
+    if (!why.empty()) return why;
+    const std::string::size_type slash = dir.rfind('/');
+    if (dir == "/" || slash == std::string::npos) return std::string();
+    dir = slash == 0 ? "/" : dir.substr(0, slash);
+  }
+}
+
+}  // namespace
 
 bool QueueFileNames(const std::string& dir, std::vector<std::string>* names) {
   std::unique_ptr<DIR, int (*)(DIR*)> handle(opendir(dir.c_str()), closedir);
@@ -32,6 +71,61 @@ bool LooksLikeBackupCopy(const std::string& file) {
     if (file.size() > n && file.compare(file.size() - n, n, suffix) == 0) return true;
   }
   return false;
+}
+
+std::string WhyUnloadable(const std::string& path) {
+  const ScopedFd fd(open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
+  struct stat st;
+  if (fd.get() < 0 || fstat(fd.get(), &st) != 0) return strerror(errno);
+  if (!S_ISREG(st.st_mode)) return "not a regular file";
+  std::string text;
+  switch (ReadAtMost(fd.get(), kMaxQueueFileSize, &text)) {
+    case BoundedRead::kWhole:
+      break;
+    case BoundedRead::kTooLarge:
+      // The size is that of the fstat; a file that grew since then is only
+      // said to be over the bound.
+      return std::string("too large (") +
+             (st.st_size > static_cast<off_t>(kMaxQueueFileSize)
+                  ? std::to_string(st.st_size) + " bytes, "
+                  : std::string()) +
+             "more than the 16 MiB a queue file may hold)";
+    default:
+      return strerror(errno);
+  }
+  Json::CharReaderBuilder builder;
+  Json::CharReaderBuilder::strictMode(&builder.settings_);
+  builder["failIfExtra"] = true;
+  const std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
+  Json::Value root;
+  std::string errors;
+  bool parsed = false;
+  try {
+    parsed = reader->parse(text.data(), text.data() + text.size(), &root, &errors);
+  } catch (const std::exception&) {
+    errors = "nested too deeply";
+  }
+  if (!parsed) {
+    errors = errors.substr(0, errors.find('\n'));
+    return "not valid JSON (" + Printable(errors) + ")";
+  }
+  if (!root.isArray()) return "not a JSON array of queues";
+  return "a queue in it has a value of the wrong type";
+}
+
+std::string UntrustedQueueFile(const std::string& dir, const std::string& file) {
+  const std::string path = dir + "/" + file;
+  struct stat st;
+  if (stat(path.c_str(), &st) != 0) return std::string("it cannot be checked: ") + strerror(errno);
+  std::string why = NotRootsAlone(st, "it");
+  if (why.empty()) why = UntrustedDirectories(dir);
+  if (!why.empty()) return why;
+  // A link may lead elsewhere: the directories above its target count too.
+  const std::unique_ptr<char, void (*)(void*)> real(realpath(path.c_str(), nullptr), free);
+  if (real == nullptr) return std::string("it cannot be checked: ") + strerror(errno);
+  const std::string target(real.get());
+  const std::string::size_type slash = target.rfind('/');
+  return UntrustedDirectories(slash == 0 ? "/" : target.substr(0, slash));
 }
 
 }  // namespace zorvcommon

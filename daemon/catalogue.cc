@@ -4,17 +4,13 @@
 
 #include <dirent.h>
 #include <errno.h>
-#include <fcntl.h>
 #include <string.h>
 #include <sys/inotify.h>
 #include <sys/stat.h>
 #include <syslog.h>
 
-#include <json/json.h>
-
 #include <algorithm>
 #include <cstdio>
-#include <memory>
 
 #include "queue_files.h"
 #include "text.h"
@@ -47,36 +43,6 @@ constexpr uint32_t kDeliverable = IN_ALL_EVENTS | IN_ISDIR;
 constexpr uint32_t kDirEvents =
     IN_CREATE | IN_CLOSE_WRITE | IN_MOVED_TO | IN_DELETE | IN_MOVED_FROM | IN_ONLYDIR;
 
-// Queue files larger than this are not read to say why they failed.
-constexpr off_t kMaxExplainedSize = 16 << 20;
-
-// Why the library could not load the queue file |path|, in words: read
-// without blocking and within a bound, and parsed as strictly as the
-// library does.
-std::string WhyUnloadable(const std::string& path) {
-  UniqueFd fd(open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
-  struct stat st;
-  if (fd.get() < 0 || fstat(fd.get(), &st) != 0) return strerror(errno);
-  if (!S_ISREG(st.st_mode)) return "not a regular file";
-  if (st.st_size > kMaxExplainedSize) return "too large (" + std::to_string(st.st_size) + " bytes)";
-  std::string text(static_cast<size_t>(st.st_size), '\0');
-  const ssize_t n = read(fd.get(), &text[0], text.size());
-  if (n < 0) return strerror(errno);
-  text.resize(static_cast<size_t>(n));
-  Json::CharReaderBuilder builder;
-  Json::CharReaderBuilder::strictMode(&builder.settings_);
-  builder["failIfExtra"] = true;
-  std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
-  Json::Value root;
-  std::string errors;
-  if (!reader->parse(text.data(), text.data() + text.size(), &root, &errors)) {
-    errors = errors.substr(0, errors.find('\n'));
-    return "not valid JSON (" + Printable(errors) + ")";
-  }
-  if (!root.isArray()) return "not a JSON array of queues";
-  return "a queue in it has a value of the wrong type";
-}
-
 }  // namespace
 
 Catalogue CatalogueLoader::Load() {
@@ -99,6 +65,22 @@ Catalogue CatalogueLoader::Load() {
         }
         backups.insert(key);
       }
+      // A file root alone does not control could have been planted or
+      // changed by anyone: none of its queues is served, not even its last
+      // good content.
+      const std::string untrusted = zorvcommon::UntrustedQueueFile(dir, file);
+      if (!untrusted.empty()) {
+        const std::string why = "refused: " + untrusted;
+        const auto known = failing_.find(key);
+        if (known == failing_.end() || known->second != why) {
+          syslog(LOG_ERR,
+                 "queue file %s is refused: %s; none of its queues is loaded (root alone must be "
+                 "able to change it and its directories)",
+                 Printable(dir + "/" + file).c_str(), untrusted.c_str());
+        }
+        failing[key] = why;
+        continue;
+      }
       std::vector<MonitorQueue> queues;
       if (MonitorQueue::List(queues, file, type)) {
         good[key] = queues;
@@ -106,7 +88,7 @@ Catalogue CatalogueLoader::Load() {
           syslog(LOG_NOTICE, "queue file %s loads again: %zu queues", label.c_str(), queues.size());
         }
       } else {
-        const std::string why = WhyUnloadable(dir + "/" + file);
+        const std::string why = zorvcommon::WhyUnloadable(dir + "/" + file);
         const auto last = last_good_.find(key);
         queues.clear();
         if (last != last_good_.end()) {

@@ -37,7 +37,10 @@ class CatalogueLoader {
   // name order; within a file the queues in file order.  A file that fails
   // to load contributes the queues of its last good load (none if it never
   // loaded); its name and why it failed are logged once, and again when it
-  // loads once more.
+  // loads once more.  A file that root alone does not control
+  // (zorvcommon::UntrustedQueueFile) contributes no queue at all, not even
+  // its last good content; its path and why are logged once, and again
+  // when the reason changes.
   Catalogue Load();
 
   // Keeps in |catalogue| only the configurations the watcher can honour

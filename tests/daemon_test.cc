@@ -253,6 +253,16 @@ TEST_F(DaemonTest, ReportsToEachQueueExactlyItsEventsAndFollowsTheCatalogue) {
   ASSERT_TRUE(Put("/usr/local/etc/zorvnotifyd/fc",
                   "[{\"queue\": \"c\", \"config\": [{\"path\": \"/tmp/w2\", \"mask\": 256}]}]"));
   ASSERT_TRUE(daemon.Logged("queue file local-etc/fc loads again: 1 queues"));
+  // A queue file others can write is refused whole: its queue gets nothing.
+  ASSERT_TRUE(Put("/usr/local/etc/zorvnotifyd/.fp",
+                  "[{\"queue\": \"p\", \"config\": [{\"path\": \"/tmp/w2\", \"mask\": 256}]}]"));
+  ASSERT_EQ(chmod("/usr/local/etc/zorvnotifyd/.fp", 0666), 0);
+  ASSERT_EQ(rename("/usr/local/etc/zorvnotifyd/.fp", "/usr/local/etc/zorvnotifyd/fp"), 0);
+  ASSERT_TRUE(
+      daemon.Logged("queue file /usr/local/etc/zorvnotifyd/fp is refused: it is writable "
+                    "by group or others"));
+  Put("/tmp/w2/r", "x");
+  daemon.Expect({E('c', "w2/r", kCreate)});
 
   // SIGHUP reloads, as the service manager's reload asks; it never ends the
   // daemon.

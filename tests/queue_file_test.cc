@@ -130,6 +130,20 @@ TEST(QueueFileTest, LoadRefusesAtOnceFilesNotRegularOrTooLarge) {
   EXPECT_TRUE(MonitorQueue::LoadFromFile(queues, kFile));
   std::ofstream(kFile) << text << ' ';
   EXPECT_FALSE(MonitorQueue::LoadFromFile(queues, kFile));
+
+  // A save whose text would exceed what a load reads fails before writing:
+  // the file keeps its content and no temporary file is left.
+  std::ofstream(kFile, std::ios::trunc) << "[]";
+  Json::Value big;
+  big["queue"] = "big";
+  for (int i = 0; i < 3; ++i)
+    big["config"][0]["ignore"].append(std::string(platform::kMaxJsonFileSize / 3, 'x'));
+  zorv_test::ClearLogs();
+  EXPECT_FALSE(MonitorQueue::SaveToFile({MonitorQueue(big)}, kFile));
+  EXPECT_THAT(zorv_test::DumpLogs(),
+              testing::MatchesRegex("3 monitor_queue:[0-9]+ Failed to save json\n"));
+  EXPECT_EQ(fs::file_size(kFile), 2u);
+  EXPECT_EQ(std::distance(fs::directory_iterator(kDir), fs::directory_iterator()), 2);  // q, etc
 }
 
 }  // namespace ZORV::ZORVNOTIFYD

@@ -124,6 +124,8 @@ TEST(ZorvnotifyctlTest, RefusalsExitStatusesAndJsonOutput) {
        "\n}",
        2, "line 1: comments are not allowed"},
       {"upsert q", std::string(5000, '['), 2, "invalid JSON: nested too deeply"},
+      {"upsert q /dev/zero", "", 2, "cannot read /dev/zero: it holds more than 16 MiB"},
+      {"upsert q - </dev/zero", "", 2, "cannot read standard input: it holds more than 16 MiB"},
       {"upsert q", obj + R"("mask": 1, "ignore": ["a\u0000|b"]}]})", 2,
        R"(ignore[0] "a\x00|b" holds a NUL)"},
       {"upsert ''", ok, 2, "the queue file name is empty"},
@@ -248,6 +250,22 @@ TEST(ZorvnotifyctlTest, RefusesSetUserIdAndReportsABusyStore) {
   EXPECT_EQ(RunTool("upsert q", queue, &out, &err), 0) << err;
   EXPECT_THAT(err, ::testing::HasSubstr("the change is stored, but the service manager could not "
                                         "be asked to start or stop zorvnotifyd"));
+
+  // Something other than a file planted at the lock's fixed path: nobody
+  // holds the lock, so the writer says what is there at once, without retrying.
+  const char* lock_path = "/tmp/zorvnotifyd_monitor_q.lock";
+  ASSERT_EQ(unlink(lock_path), 0);
+  ASSERT_EQ(symlink("/nowhere", lock_path), 0);
+  ASSERT_EQ(lchown(lock_path, 1000, 1000), 0);
+  EXPECT_EQ(RunTool("upsert q", queue, &out, &err), 1);
+  EXPECT_THAT(err, ::testing::HasSubstr("/tmp/zorvnotifyd_monitor_q.lock is a symbolic link "
+                                        "(owner uid 1000"));
+  EXPECT_THAT(err, ::testing::HasSubstr("nobody holds the store lock; root should remove it"));
+  ASSERT_EQ(unlink(lock_path), 0);
+  ASSERT_EQ(mkdir(lock_path, 0755), 0);
+  EXPECT_EQ(RunTool("delete q q", "", &out, &err), 1);
+  EXPECT_THAT(err, ::testing::HasSubstr("lock is a directory (owner uid 0, user root)"));
+  ASSERT_EQ(rmdir(lock_path), 0);
 }
 
 TEST(ZorvnotifyctlTest, WatchAndStatusAskTheDaemon) {
@@ -309,8 +327,9 @@ TEST(ZorvnotifyctlTest, WatchAndStatusAskTheDaemon) {
   EXPECT_EQ(watch.Read(), "watching backup: etc/nas (last #0)");
   std::ofstream("/tmp/wd/new").flush();
   EXPECT_EQ(watch.Read(), "backup [etc/nas] #1 IN_CREATE /tmp/wd/new");
+  std::ofstream("/tmp/wd/b\xff").flush();  // named by its escape, as valid UTF-8
+  EXPECT_EQ(watch.Read(), "backup [etc/nas] #2 IN_CREATE /tmp/wd/b\\udcff");
   EXPECT_EQ(watch.Stop(SIGINT), 0);
-  std::ofstream("/tmp/wd/b\xff").flush();
 
   // Kept records come first with --since; the daemon's going away ends
   // the watch with status 1.
@@ -334,14 +353,39 @@ TEST(ZorvnotifyctlTest, ReadsFilesInNameOrderAndAReadOnlyUsrWithWarnings) {
   ZORV_REQUIRE_SANDBOX();
   zorv_test::ResetStore();
   ASSERT_EQ(std::system("mkdir -p -m 0700 /usr/zorv/etc/zorvnotifyd"), 0);
-  const std::vector<std::string> names = {"a", "m", "nas.bak", "z"};
-  for (const char* file : {"m", "z", "a", "nas.bak"}) {
+  const std::vector<std::string> names = {"a", "m", "nas.bak", "p", "z"};
+  for (const char* file : {"m", "z", "a", "nas.bak", "w"}) {
     std::ofstream(std::string("/usr/zorv/etc/zorvnotifyd/") + file)
         << R"([{"queue": ")" << file << R"(", "config": [{"path": "/s/t", "mask": 1}]}])";
   }
+  // Files read in part or not at all are named, and the status says so;
+  // a file others can write is refused whole.
+  std::ofstream("/usr/zorv/etc/zorvnotifyd/p") << R"([{"queue": "p"}, {"queue": ["x"]}])";
+  std::ofstream("/usr/zorv/etc/zorvnotifyd/t") << R"([{"queue": "t"}, )";
+  std::ofstream("/usr/zorv/etc/zorvnotifyd/o") << "[" << std::string(16 << 20, ' ') << "]";
+  ASSERT_EQ(chmod("/usr/zorv/etc/zorvnotifyd/w", 0666), 0);
+  Check({{"list w", "", 1,
+          "queue file /usr/zorv/etc/zorvnotifyd/w is refused: it is writable by group or others"},
+         {"get w w", "", 1, "/usr/zorv/etc/zorvnotifyd/w is refused"},
+         {"list a", "", 0, ""}});
+  ASSERT_EQ(chown("/usr/zorv/etc/zorvnotifyd/a", 1000, 0), 0);
+  ASSERT_EQ(chmod("/usr/zorv", 0775), 0);
+  Check(
+      {{"list a", "", 1, "zorvnotifyd/a is refused: it belongs to uid 1000"},
+       {"list m", "", 1, "m is refused: its directory /usr/zorv is writable by group or others"}});
+  ASSERT_EQ(chown("/usr/zorv/etc/zorvnotifyd/a", 0, 0), 0);
+  ASSERT_EQ(chmod("/usr/zorv", 0755), 0);
   // Every catalogue command loads through the same reader; one stands for all.
   std::string out, err;
-  EXPECT_EQ(RunTool("catalogue --json", "", &out, &err, zorv_test::PrivateReadOnlyUsr), 0) << err;
+  EXPECT_EQ(RunTool("catalogue --json", "", &out, &err, zorv_test::PrivateReadOnlyUsr), 1) << err;
+  EXPECT_THAT(err, ::testing::HasSubstr("queue file etc/p could not be read completely: a queue in "
+                                        "it has a value of the wrong type"));
+  EXPECT_THAT(err, ::testing::HasSubstr("queue file etc/t could not be read completely: not valid "
+                                        "JSON"));
+  EXPECT_THAT(err, ::testing::HasSubstr("etc/o could not be read completely: too large (16777218 "
+                                        "bytes, more than the 16 MiB a queue file may hold)"));
+  EXPECT_THAT(err, ::testing::HasSubstr("queue file /usr/zorv/etc/zorvnotifyd/w is refused: it is "
+                                        "writable by group or others"));
   EXPECT_THAT(err, ::testing::HasSubstr(
                        "warning: the configuration directory /usr/local/etc/zorvnotifyd is "
                        "missing and could not be created; the local-etc type counts as empty"));

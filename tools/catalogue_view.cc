@@ -13,8 +13,15 @@ namespace zorvnotifyctl {
 
 using ZORV::ZORVNOTIFYD::MonitorQueue;
 
-bool LoadCatalogue(std::vector<TypedQueue>* queues) {
+std::string RefusedQueueFile(const std::string& path, const std::string& why) {
+  return "queue file " + zorvcommon::Printable(path) + " is refused: " + why +
+         "; none of its queues is loaded (root alone must be able to change it and its "
+         "directories)";
+}
+
+bool LoadCatalogue(std::vector<TypedQueue>* queues, bool* complete) {
   queues->clear();
+  *complete = true;
   for (QueueType type : kAllQueueTypes) {
     // The library creates the directory when it is missing and it can.
     const std::string dir = MonitorQueue::GetConfDir(type);
@@ -40,8 +47,22 @@ bool LoadCatalogue(std::vector<TypedQueue>* queues) {
                   << " looks like a backup copy, and is loaded like any queue file: remove it or "
                      "move it out of the directory\n";
       }
+      const std::string untrusted = zorvcommon::UntrustedQueueFile(dir, file);
+      if (!untrusted.empty()) {
+        std::cerr << "zorvnotifyctl: " << RefusedQueueFile(dir + "/" + file, untrusted) << '\n';
+        *complete = false;
+        continue;
+      }
       std::vector<MonitorQueue> loaded;
-      MonitorQueue::List(loaded, file, type);  // a failing file keeps what it appended
+      if (!MonitorQueue::List(loaded, file, type)) {  // a failing file keeps what it appended
+        std::cerr << "zorvnotifyctl: queue file " << label << " could not be read completely: "
+                  << zorvcommon::WhyUnloadable(dir + "/" + file) << "; "
+                  << (loaded.empty()
+                          ? std::string("none of its queues is shown")
+                          : "only its first " + std::to_string(loaded.size()) + " queues are shown")
+                  << '\n';
+        *complete = false;
+      }
       for (const MonitorQueue& queue : loaded) queues->push_back(TypedQueue{type, queue});
     }
   }

@@ -21,6 +21,10 @@ struct TypedQueue {
   ZORV::ZORVNOTIFYD::MonitorQueue queue;
 };
 
+// "queue file PATH is refused: WHY; ..." for a queue file at |path| that
+// zorvcommon::UntrustedQueueFile refused with |why|.
+std::string RefusedQueueFile(const std::string& path, const std::string& why);
+
 // Replaces |queues| with every queue of every type: types in the order
 // share, etc, local-etc; within a type the files the library's catalogue
 // reads (regular, links followed, name not beginning with ".") in byte-wise
@@ -30,9 +34,12 @@ struct TypedQueue {
 // error about a configuration directory that is missing (and could not be
 // created), which then counts as empty, and about each file whose name
 // looks like a backup copy, since the library loads it like any queue file.
+// A file that root alone does not control (zorvcommon::UntrustedQueueFile)
+// is refused whole and one that fails to load is named with why: each on
+// standard error, and then |complete| is set to false (else true).
 // False when a directory exists but cannot be read (said on standard
 // error); then |queues| is empty.
-bool LoadCatalogue(std::vector<TypedQueue>* queues);
+bool LoadCatalogue(std::vector<TypedQueue>* queues, bool* complete);
 
 }  // namespace zorvnotifyctl
 

@@ -2,6 +2,7 @@
 
 #include "commands.h"
 
+#include <fcntl.h>
 #include <signal.h>
 #include <sys/signalfd.h>
 #include <sys/stat.h>
@@ -11,16 +12,16 @@
 #include <cerrno>
 #include <chrono>
 #include <cstring>
-#include <fstream>
 #include <functional>
 #include <iostream>
 #include <memory>
 #include <set>
-#include <sstream>
 
+#include "bounded_read.h"
 #include "catalogue_view.h"
 #include "daemon_client.h"
 #include "event_names.h"
+#include "json_bytes.h"
 #include "json_output.h"
 #include "library_log.h"
 #include "lock_holder.h"
@@ -28,6 +29,7 @@
 #include "monitor_queue.h"
 #include "monitor_queue_index.h"
 #include "queue_file_name.h"
+#include "queue_files.h"
 #include "queue_object.h"
 #include "table.h"
 
@@ -133,7 +135,8 @@ std::string WhyNotWritten(QueueType type) {
 // stored; otherwise |status| is set: kExitBusy, with the lock's holder
 // named, when the lock stayed held (the library's own "Lock failed" lines
 // are then left out), else kExitRefused with |failure| (the library's
-// message precedes it).
+// message precedes it), also at once, with what stands there, when
+// something other than a regular file was planted at the lock's path.
 bool StoreWithRetry(const Invocation& invocation, const std::function<bool()>& store,
                     const std::string& failure, int* status) {
   using Clock = std::chrono::steady_clock;
@@ -158,6 +161,17 @@ bool StoreWithRetry(const Invocation& invocation, const std::function<bool()>& s
       *status = Fail(kExitRefused, failure + WhyNotWritten(invocation.type));
       return false;
     }
+    // Something planted at the lock's fixed path is never locked by anyone:
+    // waiting would not help, so the writer says what is there at once.
+    const std::string planted = PlantedLockFile(kStoreLockFile);
+    if (!planted.empty()) {
+      *status =
+          Fail(kExitRefused, failure + ": the store lock " + kStoreLockFile + " is " + planted +
+                                 ", which the library never opens: nobody holds the store "
+                                 "lock; root should remove it (rm -r " +
+                                 kStoreLockFile + ") and try again");
+      return false;
+    }
     if (Clock::now() >= deadline) break;
     usleep(100000);
   }
@@ -169,34 +183,35 @@ bool StoreWithRetry(const Invocation& invocation, const std::function<bool()>& s
   return false;
 }
 
-// Reads the whole of |source| ("-" is standard input) into |text|.
+// Reads the whole of |source| ("-" is standard input) into |text|, within
+// the size of the largest queue file: a source that holds more (a device
+// such as /dev/zero included) is refused once that much has been read.
+// A fifo named as |source| is read as the user asked, until its writer ends.
 bool ReadSource(const std::string& source, std::string* text, std::string* error) {
-  std::ostringstream content;
-  if (source == "-") {
-    content << std::cin.rdbuf();
-    if (std::cin.bad()) {
-      *error = "cannot read the queue object from standard input";
-      return false;
-    }
-  } else {
-    struct stat st;
-    if (stat(source.c_str(), &st) == 0 && S_ISDIR(st.st_mode)) {
-      *error = "cannot read " + source + ": it is a directory";
-      return false;
-    }
-    std::ifstream in(source, std::ios::binary);
-    if (!in) {
-      *error = "cannot open " + source + ": " + strerror(errno);
-      return false;
-    }
-    content << in.rdbuf();
-    if (in.bad()) {
-      *error = "cannot read " + source;
-      return false;
-    }
+  const bool stdin_source = source == "-";
+  const std::string name = stdin_source ? "standard input" : zorvcommon::Printable(source);
+  const zorvcommon::ScopedFd opened(stdin_source ? -1 : open(source.c_str(), O_RDONLY | O_CLOEXEC));
+  const int fd = stdin_source ? STDIN_FILENO : opened.get();
+  struct stat st;
+  if (fd < 0 || fstat(fd, &st) != 0) {
+    *error = "cannot open " + name + ": " + strerror(errno);
+    return false;
   }
-  *text = content.str();
-  return true;
+  if (S_ISDIR(st.st_mode)) {
+    *error = "cannot read " + name + ": it is a directory";
+    return false;
+  }
+  switch (zorvcommon::ReadAtMost(fd, zorvcommon::kMaxQueueFileSize, text)) {
+    case zorvcommon::BoundedRead::kWhole:
+      return true;
+    case zorvcommon::BoundedRead::kTooLarge:
+      *error =
+          "cannot read " + name + ": it holds more than 16 MiB, the most a queue file may hold";
+      return false;
+    default:
+      *error = "cannot read " + name + ": " + strerror(errno);
+      return false;
+  }
 }
 
 // The index over the queues of |queues|, in the same order.
@@ -208,9 +223,28 @@ MonitorQueueIndex CatalogueIndex(const std::vector<TypedQueue>& queues) {
 }
 
 // Loads the catalogue with types, or reports the failure (exit status 1).
+// When a queue file was refused or read only in part (each said on
+// standard error), returns true with |status| set to kExitRefused: what
+// loaded is still shown, and the status tells that it is not all.
 bool LoadCatalogueOrFail(std::vector<TypedQueue>* queues, int* status) {
-  if (LoadCatalogue(queues)) return true;
+  bool complete = true;
+  if (LoadCatalogue(queues, &complete)) {
+    if (!complete) *status = kExitRefused;
+    return true;
+  }
   *status = Fail(kExitRefused, "cannot read the catalogue (see the message above)");
+  return false;
+}
+
+// Refuses the queue file |file| of |invocation.type| when root alone does
+// not control it (exit status 1).  A missing file passes: it holds no queues.
+bool CheckTrusted(const Invocation& invocation, const std::string& file, int* status) {
+  const std::string dir = MonitorQueue::GetConfDir(invocation.type);
+  struct stat st;
+  if (lstat((dir + "/" + file).c_str(), &st) != 0 && errno == ENOENT) return true;
+  const std::string why = zorvcommon::UntrustedQueueFile(dir, file);
+  if (why.empty()) return true;
+  *status = Fail(kExitRefused, RefusedQueueFile(dir + "/" + file, why));
   return false;
 }
 
@@ -241,6 +275,13 @@ std::string JsonLine(const Json::Value& value) {
   builder["indentation"] = "";
   builder["emitUTF8"] = true;
   return Json::writeString(builder, value);
+}
+
+// A string of the daemon's JSON as text: each "\udcXY" escape, which the
+// JSON reader turns into the UTF-8 form of a lone surrogate, becomes its
+// byte again, which Printable writes as "\udcXY" (valid UTF-8 naming it).
+std::string Shown(const Json::Value& value) {
+  return Printable(zorvcommon::DecodeRawBytes(value.asString()));
 }
 
 // Parses one line from the daemon; false when it is not a JSON object.
@@ -286,7 +327,7 @@ bool Ask(DaemonClient* client, const Invocation& invocation, const Json::Value& 
   const Json::Value& answer = *reply;  // read only: no member is added
   const Json::Value& refusal = answer["error"];
   if (refusal.isString()) {
-    *status = Fail(kExitRefused, "zorvnotifyd refused: " + Printable(refusal.asString()));
+    *status = Fail(kExitRefused, "zorvnotifyd refused: " + Shown(refusal));
     return false;
   }
   if (answer["reply"] != kind) {
@@ -303,8 +344,7 @@ bool QueueLabel(const Json::Value& value, std::string* label) {
   const Json::Value& type = value["type"];
   const Json::Value& file = value["file"];
   if (!queue.isString() || !type.isString() || !file.isString()) return false;
-  *label = Printable(queue.asString()) + " [" + Printable(type.asString()) + "/" +
-           Printable(file.asString()) + "]";
+  *label = Shown(queue) + " [" + Shown(type) + "/" + Shown(file) + "]";
   return true;
 }
 
@@ -325,7 +365,7 @@ std::string ReadableRecord(const std::string& line) {
   const Json::Value& path = value["path"];
   const Json::Value& mask = value["mask"];
   if (path.isString() && mask.isUInt()) {
-    return label + zorvcommon::MaskNames(mask.asUInt()) + " " + Printable(path.asString());
+    return label + zorvcommon::MaskNames(mask.asUInt()) + " " + Shown(path);
   }
   if (value["lost"] == true) {
     return label + "LOST events may have been lost (inotify queue overflow)";
@@ -344,8 +384,7 @@ std::string ReadableSubscription(const Json::Value& reply, const std::string& na
     const Json::Value& seq = queue["seq"];
     if (!type.isString() || !file.isString() || !seq.isUInt64()) continue;
     if (!queues.empty()) queues += ", ";
-    queues += Printable(type.asString()) + "/" + Printable(file.asString()) + " (last #" +
-              std::to_string(seq.asUInt64()) + ")";
+    queues += Shown(type) + "/" + Shown(file) + " (last #" + std::to_string(seq.asUInt64()) + ")";
   }
   return "watching " + Printable(name) + ": " +
          (queues.empty() ? "not in the catalogue now; its events follow once it is registered"
@@ -364,7 +403,7 @@ int Fail(int status, const std::string& message) {
 int RunList(const Invocation& invocation) {
   const std::string& file = invocation.args[0];
   int status = kExitOk;
-  if (!CheckFileName(file, &status)) return status;
+  if (!CheckFileName(file, &status) || !CheckTrusted(invocation, file, &status)) return status;
   std::vector<MonitorQueue> queues;
   if (!MonitorQueue::List(queues, file, invocation.type)) {
     return Fail(kExitRefused, "cannot read " + FileLabel(invocation, file) +
@@ -379,7 +418,7 @@ int RunGet(const Invocation& invocation) {
   const std::string& name = invocation.args[0];
   const std::string& file = invocation.args[1];
   int status = kExitOk;
-  if (!CheckFileName(file, &status)) return status;
+  if (!CheckFileName(file, &status) || !CheckTrusted(invocation, file, &status)) return status;
   MonitorQueue queue{Json::Value()};
   if (!MonitorQueue::Get(queue, name, file, invocation.type)) {
     return Fail(kExitRefused,
@@ -472,14 +511,14 @@ int RunCatalogue(const Invocation& invocation) {
       array.append(object);
     }
     WriteJson(std::cout, array);
-    return kExitOk;
+    return status;
   }
   Table table({"TYPE", "QUEUE", "PATH", "MASK", "IGNORE"});
   for (const TypedQueue& entry : queues) {
     AddQueueRows(&table, {QueueTypeName(entry.type)}, entry.queue);
   }
   PrintTableOrNone(table, "(no queues)");
-  return kExitOk;
+  return status;
 }
 
 int RunMatch(const Invocation& invocation) {
@@ -513,7 +552,7 @@ int RunMatch(const Invocation& invocation) {
   } else {
     PrintTableOrNone(table, "(no queue wants this event)");
   }
-  return kExitOk;
+  return status;
 }
 
 int RunDirs(const Invocation& invocation) {
@@ -541,11 +580,11 @@ int RunDirs(const Invocation& invocation) {
     result["mask"] = all;
     result["queues"] = watchers;
     WriteJson(std::cout, result);
-    return kExitOk;
+    return status;
   }
   PrintTableOrNone(table, "(no queue watches this directory or below it)");
   std::cout << "union mask: " << FormatMask(all) << '\n';
-  return kExitOk;
+  return status;
 }
 
 int RunShares(const Invocation& invocation) {
@@ -558,12 +597,12 @@ int RunShares(const Invocation& invocation) {
     Json::Value array(Json::arrayValue);
     for (const std::string& share : shares) array.append(share);
     WriteJson(std::cout, array);
-    return kExitOk;
+    return status;
   }
   Table table({"SHARE"});
   for (const std::string& share : shares) table.AddRow({Printable(share)});
   PrintTableOrNone(table, "(no shares)");
-  return kExitOk;
+  return status;
 }
 
 int RunWatch(const Invocation& invocation) {
@@ -637,7 +676,7 @@ int RunStatus(const Invocation& invocation) {
     const Json::Value& value = answer[key];
     std::cout << label << std::string(kValueColumn - strlen(label), ' ')
               << (value.isUInt64()   ? std::to_string(value.asUInt64())
-                  : value.isString() ? Printable(value.asString())
+                  : value.isString() ? Shown(value)
                                      : "-")
               << '\n';
   }

@@ -10,6 +10,8 @@
 #include <fstream>
 #include <sstream>
 
+#include "text.h"
+
 namespace zorvnotifyctl {
 namespace {
 
@@ -27,7 +29,28 @@ bool RealUid(const std::string& pid, uid_t* uid) {
   return false;
 }
 
+// "user NAME" of |uid|, or "" when it has no user name.
+std::string UserName(uid_t uid) {
+  const struct passwd* user = getpwuid(uid);
+  return user != nullptr ? "user " + std::string(user->pw_name) : std::string();
+}
+
 }  // namespace
+
+std::string PlantedLockFile(const std::string& lock_file) {
+  struct stat st;
+  if (lstat(lock_file.c_str(), &st) != 0 || S_ISREG(st.st_mode)) return std::string();
+  const char* kind = S_ISLNK(st.st_mode)    ? "a symbolic link"
+                     : S_ISDIR(st.st_mode)  ? "a directory"
+                     : S_ISFIFO(st.st_mode) ? "a fifo"
+                     : S_ISSOCK(st.st_mode) ? "a socket"
+                     : S_ISCHR(st.st_mode)  ? "a character device"
+                     : S_ISBLK(st.st_mode)  ? "a block device"
+                                            : "not a regular file";
+  const std::string name = UserName(st.st_uid);
+  return std::string(kind) + " (owner uid " + std::to_string(st.st_uid) +
+         (name.empty() ? "" : ", " + zorvcommon::Printable(name)) + ")";
+}
 
 std::string LockHolder(const std::string& lock_file) {
   struct stat st;

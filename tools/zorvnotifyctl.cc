@@ -3,10 +3,12 @@
 // running daemon for events and counters over its Unix socket.
 //
 // Exit status: 0 done (for watch: stopped by SIGINT or SIGTERM), 1 the
-// library or the daemon refused or failed, or the daemon is not running, 2
-// bad command line or invalid input (nothing was changed), 75 the store
-// lock stayed held by another writer (try again), 77 not run by root.  The library's
-// own log lines go to standard error as well as to syslog.
+// library or the daemon refused or failed, the daemon is not running, a
+// queue file was refused or not read completely, or something other than a
+// file stands at the store lock's path, 2 bad command line or invalid input
+// (nothing was changed), 75 the store lock stayed held by another writer
+// (try again), 77 not run by root.  The library's own log lines go to
+// standard error as well as to syslog.
 
 #include <syslog.h>
 #include <unistd.h>
@@ -53,7 +55,9 @@ constexpr CommandInfo kCommands[] = {
     {"list", 1, 1, kFileType, RunList, "FILE",
      "Shows the queues of queue file FILE of the chosen type, in file order.  A file\n"
      "that does not exist holds no queues.  With --json: the queues as a JSON array\n"
-     "in the file's own form.\n"},
+     "in the file's own form.  A file that root alone does not control (its owner,\n"
+     "or write permission for group or others on it or a directory above it) is\n"
+     "refused with exit status 1, as it is by get.\n"},
     {"get", 2, 2, kFileType, RunGet, "NAME FILE",
      "Shows the first queue named NAME (exactly, case included) of queue file FILE.\n"
      "Exit status 1 when the file holds no such queue.  With --json: the queue\n"
@@ -73,14 +77,18 @@ constexpr CommandInfo kCommands[] = {
      "path, a relative or empty one, or \"/\" alone could never match an event.\n"
      "Unknown keys, wrong types, missing keys, such paths and patterns that do not\n"
      "compile are refused with exit status 2, before anything is written; for a\n"
-     "path the message says how to write it.\n"},
+     "path the message says how to write it.  At most 16 MiB of SOURCE are read; a\n"
+     "larger source is refused with exit status 2.\n"},
     {"delete", 2, 2, kFileType | kWait, RunDelete, "NAME FILE",
      "Removes the first queue named NAME from queue file FILE.  A name the file does\n"
      "not hold changes nothing and is not an error.  When no queue is left in the\n"
      "whole catalogue, the library asks for the service zorvnotifyd to be stopped.\n"},
     {"catalogue", 0, 0, kNoOption, RunCatalogue, "",
      "Shows every queue of every type (share, etc, local-etc), with its type.\n"
-     "With --json: an array of queue objects, each with an added \"type\".\n"},
+     "With --json: an array of queue objects, each with an added \"type\".  A queue\n"
+     "file that cannot be read completely, or that root alone does not control\n"
+     "(refused whole), is named on standard error with why; what loaded is shown\n"
+     "and the exit status is 1.  Likewise for match, dirs and shares.\n"},
     {"match", 2, 2, kNoOption, RunMatch, "PATH MASK",
      "Shows the queues of the catalogue that want an event of the kinds MASK on\n"
      "PATH: some configuration shares a bit with MASK, PATH is its directory or\n"
@@ -153,9 +161,10 @@ const char kOverview[] =
     "FILE is a plain name inside the configuration directory of the type, not\n"
     "beginning with \".\".  The store operations and the daemon's socket need root;\n"
     "the tool refuses to run set-user-ID.\n"
-    "Exit status: 0 done, 1 the library or the daemon refused or failed, or the\n"
-    "daemon is not running, 2 bad usage or input, 75 the store lock stayed busy\n"
-    "(try again), 77 not run by root.\n"
+    "Exit status: 0 done, 1 the library or the daemon refused or failed, the\n"
+    "daemon is not running, a queue file was refused or not read completely, or\n"
+    "something other than a file stands at the store lock's path, 2 bad usage or\n"
+    "input, 75 the store lock stayed busy (try again), 77 not run by root.\n"
     "See zorvnotifyctl(1).\n";
 
 const CommandInfo* FindCommand(const std::string& name) {

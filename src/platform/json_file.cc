@@ -147,6 +147,9 @@ bool JsonToFile(const Json::Value& value, const std::string& path, ScopedFd& wri
   builder["emitUTF8"] = true;
   std::string text = Json::writeString(builder, value);
   text.push_back('\n');
+  // A file JsonFromFile would refuse is never written: saving it would make
+  // every other queue of the file unreadable until it is replaced.
+  if (text.size() > kMaxJsonFileSize) return false;
 
   std::string dir;
   std::string name;

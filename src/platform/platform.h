@@ -20,8 +20,8 @@ int ZORBCFileCheckDir(const char* path);
 // parent directories are created with the same mode first.  |reserved|,
 // |owner_uid| and |owner_gid| are accepted for compatibility and unused.
 // Returns 0 on success (also when the directory exists), non-zero otherwise.
-int ZORVFSMkdirP(const char* path, const void* reserved, int parents, int owner_uid,
-                 int owner_gid, mode_t mode);
+int ZORVFSMkdirP(const char* path, const void* reserved, int parents, int owner_uid, int owner_gid,
+                 mode_t mode);
 
 // 1 when stat() succeeds on |path|, whatever the file's type; 0 otherwise.
 int ZORBCFileExist(const char* path);
@@ -49,11 +49,11 @@ namespace platform {
 // Codes of the platform errors recorded by this layer.
 enum ErrorCode : unsigned int {
   kErrNone = 0,
-  kErrSpawn = 0x0101,         // fork or pidfd setup failed
-  kErrWait = 0x0102,          // waiting for the child failed
-  kErrTimeout = 0x0103,       // the child ran too long and was killed
-  kErrExitStatus = 0x0200,    // ORed with the child's exit status (0..255)
-  kErrKilled = 0x0400,        // ORed with the signal that ended the child
+  kErrSpawn = 0x0101,       // fork or pidfd setup failed
+  kErrWait = 0x0102,        // waiting for the child failed
+  kErrTimeout = 0x0103,     // the child ran too long and was killed
+  kErrExitStatus = 0x0200,  // ORed with the child's exit status (0..255)
+  kErrKilled = 0x0400,      // ORed with the signal that ended the child
 };
 
 // Records a platform error; used through ZORB_SET_ERROR.
@@ -85,7 +85,8 @@ bool JsonFromFile(Json::Value& value, const std::string& path);
 // same path.  On success |written| holds a descriptor of the file that was
 // renamed into place, so that the caller can act on that very file whatever
 // |path| names by then.  False on failure, with the target untouched and
-// |written| unchanged.
+// |written| unchanged; in particular, without writing anything, when the
+// text is longer than kMaxJsonFileSize bytes (JsonFromFile would refuse it).
 bool JsonToFile(const Json::Value& value, const std::string& path, ScopedFd& written);
 
 }  // namespace platform
