@@ -49,12 +49,19 @@ LogRecord& QueueLog::Next(uint64_t order) {
   return records_.back();
 }
 
-void QueueLog::AddEvent(const std::string& path, uint32_t mask, uint64_t order) {
+void QueueLog::AddEvent(const std::string& path, uint32_t mask, uint64_t order, bool offline) {
   std::string& line = Next(order).line;
   line += ',';
   AppendJsonField(&line, "path", path);
   line += ',';
   AppendJsonNumber(&line, "mask", mask);
+  line += offline ? ",\"offline\":true}\n" : "}\n";
+}
+
+void QueueLog::AddRescan(const std::string& path, uint64_t order) {
+  std::string& line = Next(order).line;
+  line += ',';
+  AppendJsonField(&line, "rescan", path);
   line += "}\n";
 }
 

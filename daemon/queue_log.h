@@ -46,8 +46,13 @@ class QueueLog {
   // The record numbered |seq|, first_seq() <= seq <= last_seq().
   const LogRecord& at(uint64_t seq) const { return records_[seq - first_seq()]; }
 
-  // Appends an event: {..,"seq":N,"path":..,"mask":M}.
-  void AddEvent(const std::string& path, uint32_t mask, uint64_t order);
+  // Appends an event: {..,"seq":N,"path":..,"mask":M}, with
+  // ,"offline":true before the brace for a change made while the daemon was
+  // not watching.
+  void AddEvent(const std::string& path, uint32_t mask, uint64_t order, bool offline = false);
+  // Appends a rescan record: {..,"seq":N,"rescan":PATH}: what happened at
+  // or below PATH is not known.
+  void AddRescan(const std::string& path, uint64_t order);
   // Appends a notice: {..,"seq":N,"KEY":true} ("lost", "removed",
   // "registered").
   void AddNotice(const char* key, uint64_t order);

@@ -35,6 +35,13 @@ void Head(const CatalogueQueue& entry, bool json, std::string* line) {
   *line += ',';
 }
 
+// True when the tree at |root| holds |path|: the same path, or one below
+// it.
+bool Holds(const std::string& root, const std::string& path) {
+  return path.compare(0, root.size(), root) == 0 &&
+         (path.size() == root.size() || path[root.size()] == '/' || root == "/");
+}
+
 }  // namespace
 
 void Reporter::Use(Catalogue catalogue, std::vector<QueueLog*>* created) {
@@ -47,12 +54,13 @@ void Reporter::Use(Catalogue catalogue, std::vector<QueueLog*>* created) {
   found_wanted_.assign(catalogue_.size(), 0);
 }
 
-void Reporter::Record(size_t i, const std::string& path, uint32_t mask, uint64_t order) {
+void Reporter::Record(size_t i, const std::string& path, uint32_t mask, uint64_t order,
+                      bool offline) {
   // Two queues of one name in one file share a log: one record each event.
   QueueLog* log = logs_by_position_[i];
   if (log->last_order != order) {
     log->last_order = order;
-    log->AddEvent(path, mask, order);
+    log->AddEvent(path, mask, order, offline);
     if (recorded_) recorded_(log);
   }
   if (stdout_ == Stdout::kNone) return;
@@ -61,9 +69,10 @@ void Reporter::Record(size_t i, const std::string& path, uint32_t mask, uint64_t
     AppendJsonField(&line_, "path", path);
     line_ += ',';
     AppendJsonNumber(&line_, "mask", mask);
-    line_ += "}\n";
+    line_ += offline ? ",\"offline\":true}\n" : "}\n";
   } else {
-    line_ += zorvcommon::MaskNames(mask) + " " + Printable(path) + "\n";
+    line_ +=
+        zorvcommon::MaskNames(mask) + " " + Printable(path) + (offline ? " (offline)\n" : "\n");
   }
   fwrite(line_.data(), 1, line_.size(), stdout);
 }
@@ -77,12 +86,20 @@ void Reporter::Event(const std::string& path, uint32_t mask) {
 }
 
 void Reporter::Found(const std::string& path, bool is_dir) {
+  const uint32_t found = is_dir ? kFoundDirMask : kFoundFileMask;
+  RecordWanted(path, found, found & IN_ISDIR, false);
+}
+
+void Reporter::Offline(const std::string& path, uint32_t mask) {
+  RecordWanted(path, mask & ~IN_ISDIR, mask & IN_ISDIR, true);
+}
+
+void Reporter::RecordWanted(const std::string& path, uint32_t kinds, uint32_t extra, bool offline) {
   // Each kind on its own: a queue gets the kinds that some configuration
   // of it wants at |path|.
-  const uint32_t found = is_dir ? kFoundDirMask : kFoundFileMask;
   std::vector<size_t> wanting;
   for (uint32_t bit = 1; bit != 0; bit <<= 1) {
-    if ((found & bit) == 0) continue;
+    if ((kinds & bit) == 0) continue;
     index_.Match(path, bit, matches_);
     for (size_t i : matches_) {
       if (found_wanted_[i] == 0) wanting.push_back(i);
@@ -94,7 +111,7 @@ void Reporter::Found(const std::string& path, bool is_dir) {
   std::sort(wanting.begin(), wanting.end());
   const uint64_t order = logs_.NextOrder();
   for (size_t i : wanting) {
-    Record(i, path, found_wanted_[i] | (found & IN_ISDIR), order);
+    Record(i, path, found_wanted_[i] | extra, order, offline);
     found_wanted_[i] = 0;
   }
 }
@@ -113,6 +130,38 @@ void Reporter::Lost() {
     Head(catalogue_[i], stdout_ == Stdout::kJson, &line_);
     line_ += stdout_ == Stdout::kJson ? "\"lost\":true}\n"
                                       : "LOST events may have been lost (inotify queue overflow)\n";
+    fwrite(line_.data(), 1, line_.size(), stdout);
+  }
+}
+
+void Reporter::Rescan(const std::string& path) {
+  const uint64_t order = logs_.NextOrder();
+  for (size_t i = 0; i < catalogue_.size(); ++i) {
+    // The narrower of |path| and the queue's tree: the queue hears of
+    // nothing outside its trees.
+    const std::string* what = nullptr;
+    for (const auto& config : catalogue_[i].queue._configs) {
+      if (Holds(config._path, path)) {
+        what = &path;
+        break;
+      }
+      if (what == nullptr && Holds(path, config._path)) what = &config._path;
+    }
+    if (what == nullptr) continue;
+    QueueLog* log = logs_by_position_[i];
+    if (log->last_order != order) {
+      log->last_order = order;
+      log->AddRescan(*what, order);
+      if (recorded_) recorded_(log);
+    }
+    if (stdout_ == Stdout::kNone) continue;
+    Head(catalogue_[i], stdout_ == Stdout::kJson, &line_);
+    if (stdout_ == Stdout::kJson) {
+      AppendJsonField(&line_, "rescan", *what);
+      line_ += "}\n";
+    } else {
+      line_ += "RESCAN " + Printable(*what) + "\n";
+    }
     fwrite(line_.data(), 1, line_.size(), stdout);
   }
 }

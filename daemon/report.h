@@ -58,10 +58,20 @@ class Reporter : public EventSink {
   void Found(const std::string& path, bool is_dir) override;
   // A "lost" record for every queue of the catalogue.
   void Lost() override;
+  // A record with "offline":true for each queue that wants some kind of
+  // |mask| on |path|, with the kinds it wants (and IN_ISDIR as given).
+  void Offline(const std::string& path, uint32_t mask) override;
+  // A rescan record for each queue with a configuration whose tree holds
+  // |path| (naming |path|) or lies below it (naming that tree).
+  void Rescan(const std::string& path) override;
 
  private:
   // Records the event for queue |i| (once per log and event).
-  void Record(size_t i, const std::string& path, uint32_t mask, uint64_t order);
+  void Record(size_t i, const std::string& path, uint32_t mask, uint64_t order,
+              bool offline = false);
+  // A record for each queue that wants some kind of |kinds| on |path|, with
+  // the kinds it wants and |extra| (IN_ISDIR).
+  void RecordWanted(const std::string& path, uint32_t kinds, uint32_t extra, bool offline);
 
   QueueLogs& logs_;
   Stdout stdout_;

@@ -40,6 +40,14 @@ class EventSink {
   virtual void Found(const std::string& path, bool is_dir) = 0;
   // Events were lost: the kernel's event queue overflowed.
   virtual void Lost() = 0;
+  // A change made while the daemon was not watching, found by comparing
+  // what it last saw of |path| with what is there now: |mask| holds one
+  // kind of IN_CREATE, IN_CLOSE_WRITE|IN_MODIFY, IN_DELETE, IN_MOVED_FROM or
+  // IN_MOVED_TO, with IN_ISDIR for a directory.
+  virtual void Offline(const std::string& path, uint32_t mask) = 0;
+  // What happened at or below |path| cannot be known: whoever follows it
+  // must look at that tree again.
+  virtual void Rescan(const std::string& path) = 0;
 };
 
 // The watches of one inotify instance over a set of trees.  Paths are byte
