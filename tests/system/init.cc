@@ -127,6 +127,8 @@ int main() {
   Mount("proc", "/proc", "proc");
   Mount("sysfs", "/sys", "sysfs");
   Mount("tmpfs", "/tmp", "tmpfs");
+  // As on a booted system: the daemon's runtime directory belongs there.
+  Mount("tmpfs", "/run", "tmpfs");
   setenv("PATH", "/usr/sbin:/usr/bin:/sbin:/bin", 1);
   setenv("HOME", "/root", 1);
   setenv("GTEST_COLOR", "no", 1);
