@@ -87,7 +87,7 @@ class QueueLog {
   // Appends a rescan record: {..,"seq":N,"rescan":PATH}: what happened at
   // or below PATH is not known.
   void AddRescan(const std::string& path, uint64_t order);
-  // Appends a notice: {..,"seq":N,"KEY":true} ("lost", "removed",
+  // Appends a notice: {..,"seq":N,"KEY":true} ("removed",
   // "registered").
   void AddNotice(const char* key, uint64_t order);
   // Appends a rescan record for each of |trees|.

@@ -77,16 +77,18 @@ class Daemon : public zorv_test::ChildProcess {
            std::filesystem::current_path();
   }
   // Reads JSON lines, each as "queue path mask" ("queue lost" for a lost
-  // notice), until one equal to |last|; every line read, |last| included.
-  // Stops early (the result then lacks |last|) on a timeout.
+  // notice, "queue rescan PATH" for a rescan record), until one equal to |last|; every line read,
+  // |last| included. Stops early (the result then lacks |last|) on a timeout.
   Lines ReadUntil(const std::string& last) {
     Lines lines;
     for (std::string text; (lines.empty() || lines.back() != last) && !(text = Read()).empty();) {
       const Json::Value v = ParseJson(text);
       lines.push_back(!v.isObject()        ? text
                       : v.isMember("lost") ? v["queue"].asString() + " lost"
-                                           : v["queue"].asString() + " " + v["path"].asString() +
-                                                 " " + std::to_string(v["mask"].asUInt()));
+                      : v.isMember("rescan")
+                          ? v["queue"].asString() + " rescan " + v["rescan"].asString()
+                          : v["queue"].asString() + " " + v["path"].asString() + " " +
+                                std::to_string(v["mask"].asUInt()));
     }
     return lines;
   }
@@ -465,7 +467,8 @@ TEST_F(DaemonTest, ServesWhatFitsUnderTheWatchLimitAndSaysWhenEventsWereLost) {
     close(open(("/tmp/big/10/n" + std::to_string(i)).c_str(), O_CREAT | O_WRONLY, 0644));
   }
   ASSERT_EQ(kill(daemon.pid(), SIGCONT), 0);
-  EXPECT_TRUE(daemon.Heard("big lost"));
+  // The queue is told which tree to rescan, in place of a bare "lost".
+  EXPECT_TRUE(daemon.Heard("big rescan /tmp/big"));
   EXPECT_TRUE(daemon.Logged("inotify event queue overflowed, events were lost"));
   ASSERT_TRUE(Put("/tmp/big/10/after", "x"));
   EXPECT_TRUE(daemon.Heard("big /tmp/big/10/after 256"));
