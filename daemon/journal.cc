@@ -286,6 +286,7 @@ bool Journal::Create(int i, uint64_t first) {
   s.fd = std::move(fd);
   s.first = first;
   s.size = head.size();
+  unsynced_ = true;
   return true;
 }
 
@@ -339,6 +340,7 @@ bool Journal::WriteOut() {
   if (n == ssize_t(buffer_.size())) {
     s.size += uint64_t(n);
     buffer_.clear();
+    unsynced_ = true;
     if (!healthy_) {
       healthy_ = true;
       syslog(LOG_NOTICE, "the journal of %s is written again", shown_.c_str());
@@ -356,6 +358,8 @@ bool Journal::WriteOut() {
 }
 
 bool Journal::Sync() {
+  // A journal with nothing written since its last sync costs nothing.
+  if (!unsynced_ && buffer_.empty()) return true;
   if (healthy_ && reserve_ < last_seq_ + kReserveAhead / 2) {
     reserve_ = last_seq_ + kReserveAhead;
     Frame('R', reserve_, 0, nullptr, 0);
@@ -368,6 +372,7 @@ bool Journal::Sync() {
     }
   }
   durable_reserve_ = reserve_;
+  unsynced_ = false;
   return true;
 }
 

@@ -120,7 +120,8 @@ class Journal {
   uint64_t reserve_ = 0;          // the highest number reserved in the buffer or file
   uint64_t durable_reserve_ = 0;  // ... synced
   bool healthy_ = true;
-  bool rotate_ = false;  // the active segment is full: the next record starts the other
+  bool unsynced_ = false;  // written since the last sync
+  bool rotate_ = false;    // the active segment is full: the next record starts the other
 };
 
 }  // namespace zorvnotifyd
