@@ -15,10 +15,12 @@
 #include <string.h>
 #include <sys/stat.h>
 #include <syslog.h>
+#include <time.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <cstdio>
+#include <cstdlib>
 #include <string_view>
 
 #include "checksum.h"
@@ -112,6 +114,24 @@ class Reader {
 };
 
 }  // namespace
+
+std::string BootId() {
+  char text[64] = {};
+  UniqueFd fd(open("/proc/sys/kernel/random/boot_id", O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
+  const ssize_t n = fd.get() >= 0 ? read(fd.get(), text, sizeof(text) - 1) : -1;
+  if (n > 30) return std::string(text, size_t(n) - (text[n - 1] == '\n' ? 1 : 0));
+  struct timespec real, boot;
+  clock_gettime(CLOCK_REALTIME, &real);
+  clock_gettime(CLOCK_BOOTTIME, &boot);
+  return "t:" + std::to_string(int64_t(real.tv_sec) - int64_t(boot.tv_sec));
+}
+
+bool SameBoot(const std::string& a, const std::string& b) {
+  if (a.compare(0, 2, "t:") != 0 || b.compare(0, 2, "t:") != 0) return a == b;
+  const long long x = std::strtoll(a.c_str() + 2, nullptr, 10);
+  const long long y = std::strtoll(b.c_str() + 2, nullptr, 10);
+  return x - y <= 2 && y - x <= 2;
+}
 
 Journal::Journal(int dir, std::string key, std::string shown, uint64_t size, std::string boot)
     : dir_(dir),
@@ -250,7 +270,7 @@ JournalStart Journal::Open() {
   // Records written in this boot are all in the files (the page cache
   // outlives the daemon); after a reboot without a clean stop, those not
   // yet synced may be gone.
-  if (any && !closed && boot != boot_) start.damaged = true;
+  if (any && !closed && !SameBoot(boot, boot_)) start.damaged = true;
   // Past every number a client may have been given.
   start.last_record = start.last_seq;
   if (start.damaged) start.last_seq = std::max(start.last_seq, reserve);

@@ -22,6 +22,14 @@
 
 namespace zorvnotifyd {
 
+// The id of the running boot: the kernel's boot_id, or, where /proc/sys is
+// hidden (the unit's ProcSubset=pid), "t:" and the boot time in seconds.
+std::string BootId();
+
+// True when boot ids |a| and |b| name the same boot (boot times within two
+// seconds: the clock's steps blur them a little).
+bool SameBoot(const std::string& a, const std::string& b);
+
 // One record read back from a journal.
 struct JournalRecord {
   uint64_t seq;
