@@ -247,24 +247,17 @@ JournalStart Journal::Open() {
     return start;
   }
   start.damaged = bad;
-  // The older segment first.
-  if (segments_[0].fd.get() >= 0 && segments_[1].fd.get() >= 0 &&
-      segments_[1].first < segments_[0].first) {
-    std::swap(segments_[0], segments_[1]);
-    const std::string a = name_ + ".0", b = name_ + ".1", t = name_ + ".t";
-    // The names follow: .0 the older.  A failure here is harmless: the
-    // next start orders them by their headers again.
-    renameat(dir_, a.c_str(), dir_, t.c_str());
-    renameat(dir_, b.c_str(), dir_, a.c_str());
-    renameat(dir_, t.c_str(), dir_, b.c_str());
-  }
+  // The newer segment (the greater first number in its header) is the one
+  // written; the other is read first.
+  const bool both = segments_[0].fd.get() >= 0 && segments_[1].fd.get() >= 0;
+  active_ = both ? (segments_[1].first > segments_[0].first ? 1 : 0)
+                 : (segments_[1].fd.get() >= 0 ? 1 : 0);
   bool closed = false;
   std::string boot;
   uint64_t reserve = 0;
-  for (Segment& s : segments_) {
-    if (s.fd.get() >= 0) Scan(s, &start, &closed, &boot, &reserve);
+  for (int i : {1 - active_, active_}) {
+    if (segments_[i].fd.get() >= 0) Scan(segments_[i], &start, &closed, &boot, &reserve);
   }
-  active_ = segments_[1].fd.get() >= 0 ? 1 : 0;
   const bool any = segments_[active_].fd.get() >= 0;
   start.lost = bad && !any;
   // Records written in this boot are all in the files (the page cache
