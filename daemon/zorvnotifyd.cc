@@ -261,7 +261,8 @@ int Serve(const Options& options) {
     // The journals' records of this turn, one write each, synced in groups;
     // a journal written again after a failure gives its queue rescan
     // records.
-    if (logs.WriteOut()) sync.Wrote(NowMs());
+    logs.WriteOut();
+    if (logs.unsynced()) sync.Wrote(NowMs());
     if (logs.Settle()) server.Deliver();
     sync.RunIfDue(NowMs());
     if (options.out != Stdout::kNone && (fflush(stdout) != 0 || ferror(stdout))) {
