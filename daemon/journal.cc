@@ -318,8 +318,9 @@ void Journal::Frame(char kind, uint64_t seq, uint64_t order, const char* data, s
 }
 
 void Journal::Append(uint64_t seq, uint64_t order, const std::string& line) {
-  if (rotate_) {
-    // The newer segment is full: the older is emptied and written next.
+  if (rotate_ && healthy_) {
+    // The newer segment is full: the older is emptied and written next
+    // (not while writes fail: the full one takes the records meanwhile).
     rotate_ = false;
     WriteOut();
     if (Create(1 - active_, seq)) active_ = 1 - active_;
@@ -342,6 +343,9 @@ void Journal::Append(uint64_t seq, uint64_t order, const std::string& line) {
 bool Journal::WriteOut() {
   if (buffer_.empty()) return true;
   Segment& s = segments_[active_];
+  // A segment that could not be made (a full disk at the turn) is made
+  // again, so that the journal recovers once there is room.
+  if (s.fd.get() < 0 && !name_.empty()) Create(active_, last_seq_);
   ssize_t n = -1;
   int error = EBADF;
   if (s.fd.get() >= 0) {
