@@ -449,6 +449,9 @@ int RunUpsert(const Invocation& invocation) {
                                 (source == "-" ? std::string("standard input") : source) + ": " +
                                 problem);
   }
+  // A write keeps the file's other queues, in a file of root's alone: one
+  // that others control would have theirs trusted from then on.
+  if (!CheckTrusted(invocation, file, &status)) return status;
   const MonitorQueue queue(object);
   if (!StoreWithRetry(
           invocation, [&] { return MonitorQueue::Upsert(queue, file, invocation.type); },
@@ -471,7 +474,7 @@ int RunDelete(const Invocation& invocation) {
   const std::string& name = invocation.args[0];
   const std::string& file = invocation.args[1];
   int status = kExitOk;
-  if (!CheckFileName(file, &status)) return status;
+  if (!CheckFileName(file, &status) || !CheckTrusted(invocation, file, &status)) return status;
   // Whether the queue is there only shapes the report: the library treats
   // a missing name as success and so does the exit status.
   std::vector<MonitorQueue> before;
