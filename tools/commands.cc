@@ -445,9 +445,10 @@ int RunUpsert(const Invocation& invocation) {
   Json::Value object;
   const std::string problem = ParseQueueObject(text, &object);
   if (!problem.empty()) {
-    return Fail(kExitUsage, "invalid queue object in " +
-                                (source == "-" ? std::string("standard input") : source) + ": " +
-                                problem);
+    return Fail(kExitUsage,
+                "invalid queue object in " +
+                    (source == "-" ? std::string("standard input") : Printable(source)) + ": " +
+                    problem);
   }
   // A write keeps the file's other queues, in a file of root's alone: one
   // that others control would have theirs trusted from then on.
