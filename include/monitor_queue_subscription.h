@@ -92,7 +92,8 @@ class ZORVNOTIFYD_EXPORT MonitorQueueSubscription {
 
   // Fills |event| with the next record of a followed queue, waiting up to
   // |timeout_ms| milliseconds (-1: without end; 0: only what is at hand),
-  // connecting again as often as needed meanwhile.  False on a time-out
+  // connecting again as often as needed meanwhile (a reconnection waits
+  // up to 10 s for the daemon's first reply, whatever |timeout_ms|).  False on a time-out
   // (LastError holds the last failure, or "timed out") or after Close
   // ("closed").  A line that is not a well-formed record is skipped, and
   // LastError names it; an {"error":..} line from the daemon sets LastError

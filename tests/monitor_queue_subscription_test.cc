@@ -131,6 +131,14 @@ TEST_F(SubscriptionTest, FollowsItsQueueInOrderAcrossADaemonRestart) {
   EXPECT_EQ(Next(sub), "EVENT 4 /tmp/sub/q/4" + create);
   EXPECT_EQ(Next(sub), "EVENT 5 /tmp/sub/q/5" + create);
   EXPECT_EQ(sub.Journal(), journal);
+  // Kept records after a number, which come with the reply: read with it,
+  // and the descriptor says so.
+  MonitorQueueSubscription back(kSocket);
+  ASSERT_TRUE(back.Subscribe("q", 3)) << back.LastError();
+  EXPECT_TRUE(Readable(back.Fd(), 0));
+  EXPECT_EQ(Next(back, 0), "EVENT 4 /tmp/sub/q/4" + create);
+  EXPECT_EQ(Next(back, 0), "EVENT 5 /tmp/sub/q/5" + create);
+  EXPECT_FALSE(Readable(back.Fd(), 0));
 
   sub.Close();
   EXPECT_EQ(sub.Fd(), -1);

@@ -452,17 +452,26 @@ MonitorQueueSubscription::MonitorQueueSubscription(std::string socket_path)
 
 MonitorQueueSubscription::~MonitorQueueSubscription() = default;
 
+// Records read with a reply are buffered: Signal tells Fd's watchers.
 bool MonitorQueueSubscription::Subscribe(const std::string& name) {
-  return data_->Subscribe(name, false, MONITOR_QUEUE_TYPE_SHARE_DIR, std::string(), false, 0);
+  const bool ok =
+      data_->Subscribe(name, false, MONITOR_QUEUE_TYPE_SHARE_DIR, std::string(), false, 0);
+  data_->Signal();
+  return ok;
 }
 
 bool MonitorQueueSubscription::Subscribe(const std::string& name, uint64_t since) {
-  return data_->Subscribe(name, false, MONITOR_QUEUE_TYPE_SHARE_DIR, std::string(), true, since);
+  const bool ok =
+      data_->Subscribe(name, false, MONITOR_QUEUE_TYPE_SHARE_DIR, std::string(), true, since);
+  data_->Signal();
+  return ok;
 }
 
 bool MonitorQueueSubscription::Subscribe(const std::string& name, _tag_monitor_queue_type_ type,
                                          const std::string& file, uint64_t since) {
-  return data_->Subscribe(name, true, type, file, true, since);
+  const bool ok = data_->Subscribe(name, true, type, file, true, since);
+  data_->Signal();
+  return ok;
 }
 
 int MonitorQueueSubscription::Fd() const {
