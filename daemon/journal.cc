@@ -15,10 +15,12 @@
 #include <string.h>
 #include <sys/stat.h>
 #include <syslog.h>
+#include <time.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <cstdio>
+#include <cstdlib>
 #include <string_view>
 
 #include "checksum.h"
@@ -112,6 +114,24 @@ class Reader {
 };
 
 }  // namespace
+
+std::string BootId() {
+  char text[64] = {};
+  UniqueFd fd(open("/proc/sys/kernel/random/boot_id", O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
+  const ssize_t n = fd.get() >= 0 ? read(fd.get(), text, sizeof(text) - 1) : -1;
+  if (n > 30) return std::string(text, size_t(n) - (text[n - 1] == '\n' ? 1 : 0));
+  struct timespec real, boot;
+  clock_gettime(CLOCK_REALTIME, &real);
+  clock_gettime(CLOCK_BOOTTIME, &boot);
+  return "t:" + std::to_string(int64_t(real.tv_sec) - int64_t(boot.tv_sec));
+}
+
+bool SameBoot(const std::string& a, const std::string& b) {
+  if (a.compare(0, 2, "t:") != 0 || b.compare(0, 2, "t:") != 0) return a == b;
+  const long long x = std::strtoll(a.c_str() + 2, nullptr, 10);
+  const long long y = std::strtoll(b.c_str() + 2, nullptr, 10);
+  return x - y <= 2 && y - x <= 2;
+}
 
 Journal::Journal(int dir, std::string key, std::string shown, uint64_t size, std::string boot)
     : dir_(dir),
@@ -227,30 +247,23 @@ JournalStart Journal::Open() {
     return start;
   }
   start.damaged = bad;
-  // The older segment first.
-  if (segments_[0].fd.get() >= 0 && segments_[1].fd.get() >= 0 &&
-      segments_[1].first < segments_[0].first) {
-    std::swap(segments_[0], segments_[1]);
-    const std::string a = name_ + ".0", b = name_ + ".1", t = name_ + ".t";
-    // The names follow: .0 the older.  A failure here is harmless: the
-    // next start orders them by their headers again.
-    renameat(dir_, a.c_str(), dir_, t.c_str());
-    renameat(dir_, b.c_str(), dir_, a.c_str());
-    renameat(dir_, t.c_str(), dir_, b.c_str());
-  }
+  // The newer segment (the greater first number in its header) is the one
+  // written; the other is read first.
+  const bool both = segments_[0].fd.get() >= 0 && segments_[1].fd.get() >= 0;
+  active_ = both ? (segments_[1].first > segments_[0].first ? 1 : 0)
+                 : (segments_[1].fd.get() >= 0 ? 1 : 0);
   bool closed = false;
   std::string boot;
   uint64_t reserve = 0;
-  for (Segment& s : segments_) {
-    if (s.fd.get() >= 0) Scan(s, &start, &closed, &boot, &reserve);
+  for (int i : {1 - active_, active_}) {
+    if (segments_[i].fd.get() >= 0) Scan(segments_[i], &start, &closed, &boot, &reserve);
   }
-  active_ = segments_[1].fd.get() >= 0 ? 1 : 0;
   const bool any = segments_[active_].fd.get() >= 0;
   start.lost = bad && !any;
   // Records written in this boot are all in the files (the page cache
   // outlives the daemon); after a reboot without a clean stop, those not
   // yet synced may be gone.
-  if (any && !closed && boot != boot_) start.damaged = true;
+  if (any && !closed && !SameBoot(boot, boot_)) start.damaged = true;
   // Past every number a client may have been given.
   start.last_record = start.last_seq;
   if (start.damaged) start.last_seq = std::max(start.last_seq, reserve);
@@ -286,6 +299,7 @@ bool Journal::Create(int i, uint64_t first) {
   s.fd = std::move(fd);
   s.first = first;
   s.size = head.size();
+  unsynced_ = true;
   return true;
 }
 
@@ -304,8 +318,9 @@ void Journal::Frame(char kind, uint64_t seq, uint64_t order, const char* data, s
 }
 
 void Journal::Append(uint64_t seq, uint64_t order, const std::string& line) {
-  if (rotate_) {
-    // The newer segment is full: the older is emptied and written next.
+  if (rotate_ && healthy_) {
+    // The newer segment is full: the older is emptied and written next
+    // (not while writes fail: the full one takes the records meanwhile).
     rotate_ = false;
     WriteOut();
     if (Create(1 - active_, seq)) active_ = 1 - active_;
@@ -328,6 +343,9 @@ void Journal::Append(uint64_t seq, uint64_t order, const std::string& line) {
 bool Journal::WriteOut() {
   if (buffer_.empty()) return true;
   Segment& s = segments_[active_];
+  // A segment that could not be made (a full disk at the turn) is made
+  // again, so that the journal recovers once there is room.
+  if (s.fd.get() < 0 && !name_.empty()) Create(active_, last_seq_);
   ssize_t n = -1;
   int error = EBADF;
   if (s.fd.get() >= 0) {
@@ -339,6 +357,7 @@ bool Journal::WriteOut() {
   if (n == ssize_t(buffer_.size())) {
     s.size += uint64_t(n);
     buffer_.clear();
+    unsynced_ = true;
     if (!healthy_) {
       healthy_ = true;
       syslog(LOG_NOTICE, "the journal of %s is written again", shown_.c_str());
@@ -356,6 +375,8 @@ bool Journal::WriteOut() {
 }
 
 bool Journal::Sync() {
+  // A journal with nothing written since its last sync costs nothing.
+  if (!unsynced_ && buffer_.empty()) return true;
   if (healthy_ && reserve_ < last_seq_ + kReserveAhead / 2) {
     reserve_ = last_seq_ + kReserveAhead;
     Frame('R', reserve_, 0, nullptr, 0);
@@ -368,6 +389,7 @@ bool Journal::Sync() {
     }
   }
   durable_reserve_ = reserve_;
+  unsynced_ = false;
   return true;
 }
 

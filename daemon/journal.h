@@ -22,6 +22,14 @@
 
 namespace zorvnotifyd {
 
+// The id of the running boot: the kernel's boot_id, or, where /proc/sys is
+// hidden (the unit's ProcSubset=pid), "t:" and the boot time in seconds.
+std::string BootId();
+
+// True when boot ids |a| and |b| name the same boot (boot times within two
+// seconds: the clock's steps blur them a little).
+bool SameBoot(const std::string& a, const std::string& b);
+
 // One record read back from a journal.
 struct JournalRecord {
   uint64_t seq;
@@ -120,7 +128,8 @@ class Journal {
   uint64_t reserve_ = 0;          // the highest number reserved in the buffer or file
   uint64_t durable_reserve_ = 0;  // ... synced
   bool healthy_ = true;
-  bool rotate_ = false;  // the active segment is full: the next record starts the other
+  bool unsynced_ = false;  // written since the last sync
+  bool rotate_ = false;    // the active segment is full: the next record starts the other
 };
 
 }  // namespace zorvnotifyd

@@ -24,8 +24,7 @@ constexpr size_t kIdSize = 32;
 bool ReadSmall(int dir, const char* name, size_t max, std::string* text) {
   UniqueFd fd(openat(dir, name, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
   struct stat st;
-  if (fd.get() < 0 || fstat(fd.get(), &st) != 0 || !S_ISREG(st.st_mode) ||
-      (dir != AT_FDCWD && st.st_uid != 0)) {
+  if (fd.get() < 0 || fstat(fd.get(), &st) != 0 || !S_ISREG(st.st_mode) || st.st_uid != 0) {
     return false;
   }
   text->resize(max);
@@ -62,18 +61,6 @@ std::string RandomId() {
     id += digits;
   }
   return id;
-}
-
-std::string BootId() {
-  std::string text;
-  if (ReadSmall(AT_FDCWD, "/proc/sys/kernel/random/boot_id", 64, &text) && text.size() > 30) {
-    while (!text.empty() && text.back() == '\n') text.pop_back();
-    return text;
-  }
-  struct timespec real, boot;
-  clock_gettime(CLOCK_REALTIME, &real);
-  clock_gettime(CLOCK_BOOTTIME, &boot);
-  return "booted at " + std::to_string(real.tv_sec - boot.tv_sec);
 }
 
 bool JournalDir::Open(const StateDir& state) {

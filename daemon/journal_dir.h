@@ -16,10 +16,6 @@ namespace zorvnotifyd {
 // 32 random hexadecimal digits.
 std::string RandomId();
 
-// The id of the running boot (the kernel's boot_id, or the boot time to
-// the second when /proc/sys is hidden).
-std::string BootId();
-
 class JournalDir {
  public:
   // Opens the journal directory of |state| and its id.  False (logged)

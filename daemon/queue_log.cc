@@ -169,15 +169,15 @@ void QueueLogs::Forget(std::map<std::string, std::unique_ptr<QueueLog>>::iterato
   degraded_.erase(std::remove(degraded_.begin(), degraded_.end(), &log), degraded_.end());
 }
 
-bool QueueLogs::WriteOut() {
-  if (written_.empty()) return false;
+void QueueLogs::WriteOut() {
+  if (written_.empty()) return;
+  unsynced_ = true;
   for (QueueLog* log : written_) {
     log->Written();
     const bool was_healthy = log->journal()->healthy();
     if (!log->journal()->WriteOut() && was_healthy) degraded_.push_back(log);
   }
   written_.clear();
-  return true;
 }
 
 void QueueLogs::BeforeSend() {
@@ -188,6 +188,7 @@ void QueueLogs::BeforeSend() {
 }
 
 void QueueLogs::Sync() {
+  unsynced_ = false;
   for (auto& [key, log] : logs_) {
     if (log->journal() != nullptr) log->journal()->Sync();
   }

@@ -139,9 +139,11 @@ class QueueLogs {
   // records of a journal written again).
   void OnRecord(std::function<void(QueueLog*)> recorded) { recorded_ = std::move(recorded); }
 
-  // Writes every journal's new records (one write each); true when any
-  // was written, for the group sync.
-  bool WriteOut();
+  // Writes every journal's new records (one write each).
+  void WriteOut();
+  // True when records were written since the last Sync: the group sync is
+  // due within its interval.
+  bool unsynced() const { return unsynced_; }
   // Before records go to a client: writes them out, and syncs a journal
   // whose reserve of numbers does not cover them yet (see Journal).
   void BeforeSend();
@@ -193,6 +195,7 @@ class QueueLogs {
   std::vector<QueueLog*> written_;   // logs whose journals have records to write
   std::vector<QueueLog*> degraded_;  // logs whose journals failed to write
   bool closed_ = false;
+  bool unsynced_ = false;
   std::map<std::string, std::unique_ptr<QueueLog>> logs_;  // by type, file and name
   // The last sequence number of each queue forgotten, so that a queue that
   // comes back goes on numbering where it stopped: a client's "since" holds

@@ -53,7 +53,7 @@ const char kUsage[] =
     "  --keep N              records kept in memory per queue (default 100); older\n"
     "                        ones are read back from the queue's journal\n"
     "  --journal-size BYTES  journal kept per queue (default 8388608: the last 4 to\n"
-    "                        8 MiB of records)\n"
+    "                        8 MiB of records; 0: none, records in memory only)\n"
     "  --sync-interval MS    records reach the disk at most this long after they\n"
     "                        are written (default 100)\n"
     "  --client-buffer BYTES output a client may have waiting (default 262144)\n"
@@ -155,10 +155,11 @@ int Serve(const Options& options) {
   StateDir state;
   if (!state.Open(options.state_dir)) return 1;
   JournalDir journals;
-  const bool journaling = journals.Open(state);
+  // --journal-size 0: records in memory only, a new journal id each start.
+  const bool journaling = options.journal_size > 0 ? journals.Open(state) : false;
   CatalogueLoader loader;
   QueueLogs logs(options.keep);
-  logs.set_journal_id(journals.id());
+  logs.set_journal_id(journals.id().empty() ? RandomId() : journals.id());
   if (journaling) {
     logs.UseJournals(journals.fd(), options.journal_size, BootId(),
                      [&journals] { return journals.Renew(); });
@@ -260,7 +261,8 @@ int Serve(const Options& options) {
     // The journals' records of this turn, one write each, synced in groups;
     // a journal written again after a failure gives its queue rescan
     // records.
-    if (logs.WriteOut()) sync.Wrote(NowMs());
+    logs.WriteOut();
+    if (logs.unsynced()) sync.Wrote(NowMs());
     if (logs.Settle()) server.Deliver();
     sync.RunIfDue(NowMs());
     if (options.out != Stdout::kNone && (fflush(stdout) != 0 || ferror(stdout))) {
@@ -315,7 +317,7 @@ int ParseOptions(int argc, char** argv, Options* options) {
       options->keep = size_t(number);
       ++i;
     } else if (arg == "--journal-size" && value != nullptr &&
-               ParseCount(value, 65536, 1ull << 40, &number)) {
+               ParseCount(value, 0, 1ull << 40, &number) && (number == 0 || number >= 65536)) {
       options->journal_size = number;
       ++i;
     } else if (arg == "--sync-interval" && value != nullptr &&

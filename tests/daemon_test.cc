@@ -605,6 +605,19 @@ TEST_F(DaemonTest, DeliversEachQueueItsEventsToItsSubscribers) {
   EXPECT_EQ(std::vector<Json::Value>({v["queues"], v["clients"], v["directories"]}),
             std::vector<Json::Value>({2, 4, 2}));
   EXPECT_EQ(daemon.Stop(SIGTERM), 0);
+
+  // Started again, with nothing in memory: the same records from the
+  // journal's files, which took turns many times, then new ones.
+  Daemon restarted({"--keep", "5", "--journal-size", "65536"});
+  ASSERT_TRUE(restarted.Logged("ready:"));
+  Client back;
+  Subscribe(back, "a", kFiles - 10);
+  for (int seq = kFiles - 9; seq <= kFiles; ++seq) {
+    EXPECT_EQ(back.Line(), "a " + std::to_string(seq) + " " + name + std::to_string(seq));
+  }
+  ASSERT_TRUE(Put("/tmp/s/a/last", "x"));
+  EXPECT_EQ(back.Line(), "a " + std::to_string(kFiles + 1) + " /tmp/s/a/last");
+  EXPECT_EQ(restarted.Stop(SIGTERM), 0);
 }
 
 // The daemon's CPU time so far, in clock ticks (-1 when unknown).
