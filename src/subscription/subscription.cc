@@ -98,6 +98,8 @@ void AppendJsonString(std::string* out, const std::string& text) {
 
 }  // namespace
 
+namespace subscription {
+
 // A subscription the user asked for.
 struct Wanted {
   std::string name;
@@ -112,6 +114,11 @@ struct Followed {
   std::string file, name;
   uint64_t last;
 };
+
+}  // namespace subscription
+
+using subscription::Followed;
+using subscription::Wanted;
 
 struct MonitorQueueSubscriptionData {
   std::string socket_path;
