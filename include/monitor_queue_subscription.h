@@ -102,7 +102,9 @@ class ZORVNOTIFYD_EXPORT MonitorQueueSubscription {
 
   // The daemon's journal id (32 hexadecimal digits) as last seen; empty
   // until the daemon told one.  Store it with the last _seq delivered:
-  // they resume a later subscription only while the id stays the same.
+  // they resume a later subscription only while the id stays the same (a
+  // program that resumes compares it after Subscribe, and rescans the
+  // queue's trees when it differs).
   std::string Journal() const;
 
   // Ends the connection and the subscriptions for good; later calls fail
