@@ -21,6 +21,7 @@
 #include <json/json.h>
 
 #include "json_writer.h"
+#include "request.h"
 #include "text.h"
 
 namespace zorvnotifyd {
@@ -33,12 +34,9 @@ using zorvcommon::Quoted;
 // journal.
 constexpr size_t kJournalRead = 64 * 1024;
 
-// A request line longer than this is refused and the client let go.
+// A request line longer than this is refused and the client let go; it
+// bounds the memory a parsed request takes.
 constexpr size_t kMaxRequest = 64 * 1024;
-
-// How deep a request line may nest.  A request is a flat object; this
-// leaves room for members the daemon ignores.
-constexpr int kMaxRequestDepth = 8;
 
 // What the subscriptions of one client may hold: far more than a real
 // client needs, and a bound on the memory a client makes the daemon keep.
@@ -50,29 +48,6 @@ std::string ErrorLine(const std::string& message) {
   std::string line = "{";
   AppendJsonField(&line, "error", message);
   return line + "}\n";
-}
-
-// Parses |line| into |request|; false when it is not one JSON object
-// nested at most kMaxRequestDepth levels.  jsoncpp's reader, which the
-// tool and the library use too, recurses once per level and throws past
-// its stack limit: here the strict reader gets a small limit, and whatever
-// it throws (that, or memory running out) makes a bad request, never the
-// end of the daemon.  A parser of its own for one flat object would be
-// more code to get right for no gain.  The line's length (kMaxRequest)
-// bounds the memory the parsed value takes.
-bool ParseRequest(const std::string& line, Json::Value* request) noexcept {
-  try {
-    Json::CharReaderBuilder builder;
-    Json::CharReaderBuilder::strictMode(&builder.settings_);
-    builder["failIfExtra"] = true;
-    builder["stackLimit"] = kMaxRequestDepth;
-    const std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
-    std::string errors;
-    return reader->parse(line.data(), line.data() + line.size(), request, &errors) &&
-           request->isObject();
-  } catch (const std::exception&) {
-    return false;
-  }
 }
 
 }  // namespace
