@@ -127,8 +127,11 @@ int main() {
   Mount("proc", "/proc", "proc");
   Mount("sysfs", "/sys", "sysfs");
   Mount("tmpfs", "/tmp", "tmpfs");
-  // As on a booted system: the daemon's runtime directory belongs there.
+  // As on a booted system: the daemon's runtime directory belongs in /run,
+  // its state under /var/lib (where the tests' sandbox mounts a tmpfs).
   Mount("tmpfs", "/run", "tmpfs");
+  mkdir("/var", 0755);
+  mkdir("/var/lib", 0755);
   setenv("PATH", "/usr/sbin:/usr/bin:/sbin:/bin", 1);
   setenv("HOME", "/root", 1);
   setenv("GTEST_COLOR", "no", 1);
