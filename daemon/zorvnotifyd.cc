@@ -10,7 +10,6 @@
 #include <poll.h>
 #include <signal.h>
 #include <string.h>
-#include <sys/random.h>
 #include <sys/resource.h>
 #include <sys/signalfd.h>
 #include <syslog.h>
@@ -24,11 +23,14 @@
 #include <string>
 
 #include "catalogue.h"
+#include "journal_dir.h"
 #include "json_writer.h"
 #include "notify.h"
 #include "queue_log.h"
 #include "report.h"
 #include "server.h"
+#include "state_dir.h"
+#include "sync_timer.h"
 #include "text.h"
 #include "unique_fd.h"
 #include "watch_tree.h"
@@ -45,9 +47,15 @@ const char kUsage[] =
     "\n"
     "  --socket PATH         the socket (default /run/zorvnotifyd/zorvnotifyd.sock), in\n"
     "                        a directory of root's that only root may write\n"
+    "  --state-dir DIR       what is kept across restarts (default /var/lib/zorvnotifyd),\n"
+    "                        a directory of root's that only root may write\n"
     "  --group GROUP         members of GROUP may connect too (default: root only)\n"
-    "  --keep N              events kept per queue for clients that reconnect\n"
-    "                        (default 100)\n"
+    "  --keep N              records kept in memory per queue (default 100); older\n"
+    "                        ones are read back from the queue's journal\n"
+    "  --journal-size BYTES  journal kept per queue (default 8388608: the last 4 to\n"
+    "                        8 MiB of records; 0: none, records in memory only)\n"
+    "  --sync-interval MS    records reach the disk at most this long after they\n"
+    "                        are written (default 100)\n"
     "  --client-buffer BYTES output a client may have waiting (default 262144)\n"
     "  --max-clients N       clients served at once (default 1000)\n"
     "  --stdout              also write one line per queue and event on standard output\n"
@@ -122,23 +130,6 @@ UniqueFd OpenSignals() {
   return fd;
 }
 
-// A random id of this run of the daemon, 32 hexadecimal digits: clients
-// tell by it that sequence numbers from an earlier run no longer apply.
-std::string RunId() {
-  unsigned char bytes[16] = {};
-  if (getrandom(bytes, sizeof(bytes), 0) != ssize_t(sizeof(bytes))) {
-    const uint64_t seed = uint64_t(NowMs()) ^ (uint64_t(getpid()) << 32);
-    memcpy(bytes, &seed, sizeof(seed));
-  }
-  std::string id;
-  char digits[3];
-  for (unsigned char byte : bytes) {
-    snprintf(digits, sizeof(digits), "%02x", byte);
-    id += digits;
-  }
-  return id;
-}
-
 // READY=1 with the status line the service manager shows for the daemon.
 std::string ReadyState(size_t directories, size_t queues) {
   return "READY=1\nSTATUS=watching " + std::to_string(directories) + " directories for " +
@@ -150,6 +141,9 @@ struct Options {
   Stdout out = Stdout::kNone;
   double retry_seconds = kDefaultRetrySeconds;
   size_t keep = 100;
+  std::string state_dir = kDefaultStateDir;
+  uint64_t journal_size = 8 << 20;
+  int64_t sync_interval_ms = 100;
 };
 
 // Serves events until a stop signal (returns 0) or a fatal error (1).
@@ -158,11 +152,23 @@ int Serve(const Options& options) {
   CatalogueWatch catalogue_watch;
   UniqueFd inotify = OpenInotify();
   if (signals.get() < 0 || inotify.get() < 0 || !catalogue_watch.Open()) return 1;
+  StateDir state;
+  if (!state.Open(options.state_dir)) return 1;
+  JournalDir journals;
+  // --journal-size 0: records in memory only, a new journal id each start.
+  const bool journaling = options.journal_size > 0 ? journals.Open(state) : false;
   CatalogueLoader loader;
   QueueLogs logs(options.keep);
+  logs.set_journal_id(journals.id().empty() ? RandomId() : journals.id());
+  if (journaling) {
+    logs.UseJournals(journals.fd(), options.journal_size, BootId(),
+                     [&journals] { return journals.Renew(); });
+  }
+  SyncTimer sync(options.sync_interval_ms);
+  sync.Join([&logs] { logs.Sync(); });
   Reporter reporter(logs, options.out);
   WatchTree tree(std::move(inotify), options.retry_seconds);
-  Server server(options.server, logs, RunId(), [&] {
+  Server server(options.server, logs, RandomId(), [&] {
     std::string status;
     AppendJsonNumber(&status, "directories", tree.size());
     status += ',';
@@ -175,10 +181,18 @@ int Serve(const Options& options) {
     AppendJsonNumber(&status, "trees_missing", tree.missing());
     status += ',';
     AppendJsonNumber(&status, "directories_over_watch_limit", tree.over_limit());
+    status += ',';
+    AppendJsonField(&status, "state",
+                    !journaling       ? "no journal"
+                    : logs.degraded() ? "degraded"
+                                      : "ok");
+    status += ',';
+    logs.AppendStatus(&status);
     return status;
   });
   if (!server.Listen()) return 1;
   reporter.OnRecord([&server](QueueLog* log) { server.Recorded(log); });
+  logs.OnRecord([&server](QueueLog* log) { server.Recorded(log); });
   // Reads the catalogue, and makes the records, the watches and the
   // clients' subscriptions follow it.
   auto load = [&] {
@@ -201,7 +215,8 @@ int Serve(const Options& options) {
   for (;;) {
     // Trees that went away, were replaced or did not fit under the watch
     // limit are looked at again on a fixed period, whatever the load.
-    const int ready = poll(fds, 4, int(std::max<int64_t>(0, next_tick - NowMs())));
+    const int64_t wake = sync.due() >= 0 ? std::min(next_tick, sync.due()) : next_tick;
+    const int ready = poll(fds, 4, int(std::max<int64_t>(0, wake - NowMs())));
     if (ready < 0 && errno != EINTR) {
       syslog(LOG_ERR, "poll failed: %s", strerror(errno));
       return 1;
@@ -219,6 +234,9 @@ int Serve(const Options& options) {
       syslog(LOG_INFO, "stopping on %s: releasing %zu watches", strsignal(int(info.ssi_signo)),
              tree.size());
       tree.Clear();
+      logs.WriteOut();
+      sync.Run(NowMs());
+      logs.Close();
       return 0;
     }
     if (ready > 0 && (fds[1].revents & POLLIN) && !tree.ReadEvents(reporter)) return 1;
@@ -240,6 +258,13 @@ int Serve(const Options& options) {
       next_tick = NowMs() + retry_ms;
     }
     server.Deliver();
+    // The journals' records of this turn, one write each, synced in groups;
+    // a journal written again after a failure gives its queue rescan
+    // records.
+    logs.WriteOut();
+    if (logs.unsynced()) sync.Wrote(NowMs());
+    if (logs.Settle()) server.Deliver();
+    sync.RunIfDue(NowMs());
     if (options.out != Stdout::kNone && (fflush(stdout) != 0 || ferror(stdout))) {
       syslog(LOG_ERR, "cannot write the report to standard output: stopping");
       tree.Clear();
@@ -277,6 +302,8 @@ int ParseOptions(int argc, char** argv, Options* options) {
       if (options->out == Stdout::kNone) options->out = Stdout::kText;
     } else if (arg == "--socket" && value != nullptr) {
       options->server.socket_path = argv[++i];
+    } else if (arg == "--state-dir" && value != nullptr) {
+      options->state_dir = argv[++i];
     } else if (arg == "--group" && value != nullptr) {
       ++i;
       const struct group* group = getgrnam(value);
@@ -288,6 +315,14 @@ int ParseOptions(int argc, char** argv, Options* options) {
       options->server.group = group != nullptr ? group->gr_gid : gid_t(number);
     } else if (arg == "--keep" && value != nullptr && ParseCount(value, 1, 1000000, &number)) {
       options->keep = size_t(number);
+      ++i;
+    } else if (arg == "--journal-size" && value != nullptr &&
+               ParseCount(value, 0, 1ull << 40, &number) && (number == 0 || number >= 65536)) {
+      options->journal_size = number;
+      ++i;
+    } else if (arg == "--sync-interval" && value != nullptr &&
+               ParseCount(value, 1, 3600000, &number)) {
+      options->sync_interval_ms = int64_t(number);
       ++i;
     } else if (arg == "--client-buffer" && value != nullptr &&
                ParseCount(value, 1024, 1ull << 30, &number)) {

@@ -77,16 +77,18 @@ class Daemon : public zorv_test::ChildProcess {
            std::filesystem::current_path();
   }
   // Reads JSON lines, each as "queue path mask" ("queue lost" for a lost
-  // notice), until one equal to |last|; every line read, |last| included.
-  // Stops early (the result then lacks |last|) on a timeout.
+  // notice, "queue rescan PATH" for a rescan record), until one equal to |last|; every line read,
+  // |last| included. Stops early (the result then lacks |last|) on a timeout.
   Lines ReadUntil(const std::string& last) {
     Lines lines;
     for (std::string text; (lines.empty() || lines.back() != last) && !(text = Read()).empty();) {
       const Json::Value v = ParseJson(text);
       lines.push_back(!v.isObject()        ? text
                       : v.isMember("lost") ? v["queue"].asString() + " lost"
-                                           : v["queue"].asString() + " " + v["path"].asString() +
-                                                 " " + std::to_string(v["mask"].asUInt()));
+                      : v.isMember("rescan")
+                          ? v["queue"].asString() + " rescan " + v["rescan"].asString()
+                          : v["queue"].asString() + " " + v["path"].asString() + " " +
+                                std::to_string(v["mask"].asUInt()));
     }
     return lines;
   }
@@ -465,7 +467,8 @@ TEST_F(DaemonTest, ServesWhatFitsUnderTheWatchLimitAndSaysWhenEventsWereLost) {
     close(open(("/tmp/big/10/n" + std::to_string(i)).c_str(), O_CREAT | O_WRONLY, 0644));
   }
   ASSERT_EQ(kill(daemon.pid(), SIGCONT), 0);
-  EXPECT_TRUE(daemon.Heard("big lost"));
+  // The queue is told which tree to rescan, in place of a bare "lost".
+  EXPECT_TRUE(daemon.Heard("big rescan /tmp/big"));
   EXPECT_TRUE(daemon.Logged("inotify event queue overflowed, events were lost"));
   ASSERT_TRUE(Put("/tmp/big/10/after", "x"));
   EXPECT_TRUE(daemon.Heard("big /tmp/big/10/after 256"));
@@ -500,7 +503,7 @@ class Client {
     return v;
   }
   // The next line as "queue seq path" ("queue seq KEY" for a notice,
-  // "queue missed N"), "" when none came.
+  // "queue seq rescan PATH", "queue missed N"), "" when none came.
   std::string Line() {
     const Json::Value v = Next();
     if (!v.isObject()) return "";
@@ -510,6 +513,7 @@ class Client {
     for (const char* notice : {"lost", "removed", "registered"}) {
       if (v.isMember(notice)) return line + " " + notice;
     }
+    if (v.isMember("rescan")) return line + " rescan " + v["rescan"].asString();
     return line + " " + v["path"].asString();
   }
 
@@ -534,7 +538,7 @@ TEST_F(DaemonTest, DeliversEachQueueItsEventsToItsSubscribers) {
   ASSERT_EQ(std::system("rm -rf /tmp/s && mkdir -p /tmp/s/a /tmp/s/b"), 0);
   Register("a", "/tmp/s/a", kCreate);
   Register("b", "/tmp/s/b", kCreate);
-  Daemon daemon({"--keep", "5", "--client-buffer", "1024"});
+  Daemon daemon({"--keep", "5", "--client-buffer", "1024", "--journal-size", "65536"});
   ASSERT_TRUE(daemon.Logged("ready: watching 2 directories for 2 queues"));
   Client b, sleeper;
   Client* a = new Client;
@@ -560,16 +564,16 @@ TEST_F(DaemonTest, DeliversEachQueueItsEventsToItsSubscribers) {
   for (int i = 21; i <= kFiles; ++i) ASSERT_TRUE(Put(name + std::to_string(i), "x"));
   ASSERT_TRUE(Put("/tmp/s/b/x", "x"));
   EXPECT_EQ(b.Line(), "b 1 /tmp/s/b/x");
-  // What the sleeper's buffer could not hold is counted.
+  // What the sleeper's buffer could not hold, nor the journal, is counted.
   std::string line;
   for (int i = 0; i <= kFiles && (line = sleeper.Line()).find("missed") == std::string::npos;) ++i;
   EXPECT_EQ(line.find("a missed "), 0u) << line;
 
-  // Back with "since": what was kept, after a count of what was not.
+  // Back with "since": the 5 records before those in memory from the
+  // journal, then those in memory.
   Client again;
   Subscribe(again, "a", kFiles - 10);
-  EXPECT_EQ(again.Line(), "a missed 5");
-  for (int seq = kFiles - 4; seq <= kFiles; ++seq) {
+  for (int seq = kFiles - 9; seq <= kFiles; ++seq) {
     EXPECT_EQ(again.Line(), "a " + std::to_string(seq) + " " + name + std::to_string(seq));
   }
 
@@ -601,6 +605,19 @@ TEST_F(DaemonTest, DeliversEachQueueItsEventsToItsSubscribers) {
   EXPECT_EQ(std::vector<Json::Value>({v["queues"], v["clients"], v["directories"]}),
             std::vector<Json::Value>({2, 4, 2}));
   EXPECT_EQ(daemon.Stop(SIGTERM), 0);
+
+  // Started again, with nothing in memory: the same records from the
+  // journal's files, which took turns many times, then new ones.
+  Daemon restarted({"--keep", "5", "--journal-size", "65536"});
+  ASSERT_TRUE(restarted.Logged("ready:"));
+  Client back;
+  Subscribe(back, "a", kFiles - 10);
+  for (int seq = kFiles - 9; seq <= kFiles; ++seq) {
+    EXPECT_EQ(back.Line(), "a " + std::to_string(seq) + " " + name + std::to_string(seq));
+  }
+  ASSERT_TRUE(Put("/tmp/s/a/last", "x"));
+  EXPECT_EQ(back.Line(), "a " + std::to_string(kFiles + 1) + " /tmp/s/a/last");
+  EXPECT_EQ(restarted.Stop(SIGTERM), 0);
 }
 
 // The daemon's CPU time so far, in clock ticks (-1 when unknown).
@@ -725,6 +742,7 @@ TEST_F(DaemonTest, ListensOnItsOwnSocketInARootOnlyDirectory) {
   ASSERT_EQ(std::system("rm -rf /tmp/k && mkdir /tmp/k"), 0);
   Register("k", "/tmp/k", kCreate);
   Daemon daemon({"--json", "--retry", "0.05"});
+  EXPECT_TRUE(daemon.Logged("made the state directory \"/var/lib/zorvnotifyd\""));
   ASSERT_TRUE(daemon.Logged("ready: watching 1 directories for 1 queues"));
   Client before;
   ASSERT_TRUE(before.connected());
@@ -770,6 +788,18 @@ TEST_F(DaemonTest, ListensOnItsOwnSocketInARootOnlyDirectory) {
     EXPECT_EQ(refused.Stop(0), 1);
     EXPECT_NE(access((dir + "/zorvnotifyd.sock").c_str(), F_OK), 0);
   }
+  // So would a state directory: refused too, and so is a link to one.
+  ASSERT_EQ(symlink("/tmp/k", "/tmp/state-link"), 0);
+  for (const std::string dir : {"/tmp/open", "/tmp/theirs", "/tmp/state-link"}) {
+    Daemon refused({"--state-dir", dir});
+    EXPECT_TRUE(refused.Logged(
+        "cannot use the state directory: \"" + dir +
+        (dir == "/tmp/open"     ? "\" is owned by uid 0 with mode 1777; it must be root's"
+         : dir == "/tmp/theirs" ? "\" is owned by uid 65534 with mode 0755; it must be root's"
+                                : "\" cannot be used: it is not a directory (a link is not "
+                                  "followed)")));
+    EXPECT_EQ(refused.Stop(0), 1);
+  }
 
   // Started by hand, without the runtime directory its service makes: the
   // daemon makes it.
@@ -783,6 +813,10 @@ TEST_F(DaemonTest, ListensOnItsOwnSocketInARootOnlyDirectory) {
       << std::oct << st.st_mode;
   ASSERT_EQ(lstat((run + "/zorvnotifyd.sock").c_str(), &st), 0);
   EXPECT_TRUE(S_ISSOCK(st.st_mode));
+  // And its state directory (made by the first daemon), root's alone.
+  ASSERT_EQ(lstat("/var/lib/zorvnotifyd", &st), 0);
+  EXPECT_TRUE(S_ISDIR(st.st_mode) && st.st_uid == 0 && (st.st_mode & 07777) == 0700)
+      << std::oct << st.st_mode;
   EXPECT_EQ(by_hand.Stop(SIGTERM), 0);
 }
 
@@ -806,6 +840,173 @@ TEST_F(DaemonTest, ServesWhatExistsOnAReadOnlyUsr) {
   Put("/tmp/ro/y", "y");
   daemon.Expect({"late share g /tmp/ro/y " + std::to_string(IN_CREATE),
                  "ro etc f /tmp/ro/y " + std::to_string(IN_CREATE)});
+  EXPECT_EQ(daemon.Stop(SIGTERM), 0);
+}
+
+// The status reply of the daemon on the default socket.
+Json::Value Status() {
+  Client client;
+  EXPECT_TRUE(client.Send("{\"request\":\"status\"}"));
+  return client.Next();
+}
+
+// Each queue's records outlive the daemon: stopped, killed in the middle
+// of a burst, restarted, the numbering goes on under the same journal id,
+// and a client that comes back with "since" gets each record once, in
+// order.  A journal cut short, garbage, a FIFO or a link in its place, or
+// its id removed, is told: rescan records, a new id, never a crash, a hang
+// or a silent gap.
+TEST_F(DaemonTest, KeepsEachQueuesRecordsAcrossRestarts) {
+  ASSERT_EQ(std::system("rm -rf /tmp/j && mkdir /tmp/j"), 0);
+  Register("j", "/tmp/j", kCreate);
+  std::string journal;
+  {
+    Daemon daemon(Lines{});
+    ASSERT_TRUE(daemon.Logged("ready:"));
+    Client client;
+    journal = Subscribe(client, "j")["journal"].asString();
+    EXPECT_EQ(journal.size(), 32u);
+    ASSERT_TRUE(Put("/tmp/j/1", "x") && Put("/tmp/j/2", "x"));
+    EXPECT_EQ(client.Line(), "j 1 /tmp/j/1");
+    EXPECT_EQ(client.Line(), "j 2 /tmp/j/2");
+    EXPECT_EQ(daemon.Stop(SIGTERM), 0);
+  }
+  // 20,000 records while a client reads none, and kill -9 once the daemon
+  // has read them all, in the middle of its delivery.
+  constexpr int kAway = 20000;
+  {
+    Daemon daemon(Lines{});
+    ASSERT_TRUE(daemon.Logged("ready:"));
+    Client sleeper;
+    Subscribe(sleeper, "j");
+    for (int i = 3; i < kAway + 3; ++i) {
+      ASSERT_EQ(close(open(("/tmp/j/" + std::to_string(i)).c_str(), O_CREAT | O_WRONLY, 0644)), 0);
+    }
+    for (int tries = 0; tries < 1000 && Status()["events"].asInt() < kAway; ++tries) usleep(10000);
+    EXPECT_EQ(daemon.Stop(SIGKILL), -1);
+  }
+  {
+    Daemon daemon(Lines{});
+    ASSERT_TRUE(daemon.Logged("ready:"));
+    Client client;
+    const Json::Value reply = Subscribe(client, "j", 2);
+    EXPECT_EQ(reply["journal"], journal);
+    EXPECT_EQ(reply["queues"][0]["seq"], kAway + 2);
+    for (int seq = 3; seq < kAway + 3; ++seq) {
+      const std::string line = client.Line();
+      if (line != "j " + std::to_string(seq) + " /tmp/j/" + std::to_string(seq)) {
+        FAIL() << "record " << seq << ": " << line;
+      }
+    }
+    ASSERT_TRUE(Put("/tmp/j/after", "x"));
+    EXPECT_EQ(client.Line(), "j " + std::to_string(kAway + 3) + " /tmp/j/after");
+    const Json::Value status = Status();
+    EXPECT_EQ(status["journal"], journal);
+    EXPECT_EQ(status["state"], "ok");
+    EXPECT_EQ(status["journals"][0]["first"], 1);
+    EXPECT_EQ(status["journals"][0]["last"], kAway + 3);
+    EXPECT_GT(status["journals"][0]["bytes"].asUInt64(), uint64_t(kAway) * 50);
+    EXPECT_EQ(daemon.Stop(SIGTERM), 0);
+  }
+
+  // Cut short in the middle of a record: the records before are kept, and
+  // the queue rescans its tree, numbered after every record a client may
+  // have seen.
+  const std::string dir = "/var/lib/zorvnotifyd/journal/";
+  std::string segment;
+  for (const auto& entry : std::filesystem::directory_iterator(dir)) {
+    if (entry.path().extension() == ".0") segment = entry.path();
+  }
+  ASSERT_FALSE(segment.empty());
+  ASSERT_EQ(truncate(segment.c_str(), std::filesystem::file_size(segment) - 10), 0);
+  uint64_t rescan_seq = 0;
+  {
+    Daemon daemon(Lines{});
+    ASSERT_TRUE(daemon.Logged("the journal of queue \"j\" (etc/f) is damaged or cut short"));
+    ASSERT_TRUE(daemon.Logged("ready:"));
+    Client client;
+    EXPECT_EQ(Subscribe(client, "j", kAway + 1)["journal"], journal);
+    EXPECT_EQ(client.Line(),
+              "j " + std::to_string(kAway + 2) + " /tmp/j/" + std::to_string(kAway + 2));
+    EXPECT_EQ(client.Line(), "j " + std::to_string(kAway + 3) + " /tmp/j/after");
+    const Json::Value rescan = client.Next();
+    EXPECT_EQ(rescan["rescan"], "/tmp/j");
+    rescan_seq = rescan["seq"].asUInt64();
+    EXPECT_GT(rescan_seq, uint64_t(kAway) + 3);
+    EXPECT_EQ(daemon.Stop(SIGTERM), 0);
+  }
+  // Garbage, a FIFO and a link in place of the journal's files: replaced,
+  // the link's target untouched.
+  ASSERT_TRUE(Put(segment, std::string(5000, 'g')));
+  const std::string other = segment.substr(0, segment.size() - 1) + "1";
+  ASSERT_EQ(mkfifo(other.c_str(), 0600), 0);
+  {
+    Daemon daemon(Lines{});
+    ASSERT_TRUE(daemon.Logged("cannot be used: it is not a journal, or its start is damaged"));
+    ASSERT_TRUE(daemon.Logged("cannot be used: it is not a regular file; replacing it"));
+    ASSERT_TRUE(daemon.Logged("ready:"));
+    // Its numbering is lost with it: a new journal id says so.
+    Client client;
+    const Json::Value reply = Subscribe(client, "j", rescan_seq);
+    EXPECT_NE(reply["journal"], journal);
+    journal = reply["journal"].asString();
+    EXPECT_EQ(client.Line(), "j 1 rescan /tmp/j");
+    EXPECT_EQ(daemon.Stop(SIGTERM), 0);
+  }
+  unlink(other.c_str());  // replaced by nothing, or by a new segment
+  ASSERT_EQ(symlink("/tmp/j/1", other.c_str()), 0);
+  {
+    Daemon daemon(Lines{});
+    ASSERT_TRUE(daemon.Logged("cannot be used: it is a symbolic link; replacing it"));
+    ASSERT_TRUE(daemon.Logged("ready:"));
+    EXPECT_EQ(Status()["journal"], journal);
+    EXPECT_EQ(daemon.Stop(SIGTERM), 0);
+  }
+  EXPECT_EQ(std::filesystem::file_size("/tmp/j/1"), 1u);
+  // The id removed: the journals are reset under a new one.
+  ASSERT_EQ(unlink((dir + "id").c_str()), 0);
+  Daemon daemon(Lines{});
+  ASSERT_TRUE(daemon.Logged("starting a new journal"));
+  ASSERT_TRUE(daemon.Logged("ready:"));
+  const Json::Value status = Status();
+  EXPECT_EQ(status["journal"].asString().size(), 32u);
+  EXPECT_NE(status["journal"], journal);
+  EXPECT_EQ(daemon.Stop(SIGTERM), 0);
+}
+
+// A full state directory (a tiny tmpfs on it, in the daemon's own mount
+// namespace): live delivery goes on, one log line, the status says
+// degraded, and once writing works again the queue rescans its tree.
+TEST_F(DaemonTest, DeliversLiveWhenTheJournalCannotBeWritten) {
+  ASSERT_EQ(std::system("rm -rf /tmp/full /tmp/fs && mkdir /tmp/full /tmp/fs"), 0);
+  Register("full", "/tmp/full", kCreate);
+  Daemon daemon({"--state-dir", "/tmp/fs"}, [] {
+    return unshare(CLONE_NEWNS) == 0 &&
+           mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == 0 &&
+           mount("zorv-test", "/tmp/fs", "tmpfs", 0, "mode=0700,size=64k") == 0;
+  });
+  ASSERT_TRUE(daemon.Logged("ready:"));
+  Client client;
+  Subscribe(client, "full");
+  // Fills what the daemon sees at /tmp/fs.
+  const std::string filler = "/proc/" + std::to_string(daemon.pid()) + "/root/tmp/fs/filler";
+  {
+    std::ofstream out(filler);
+    const std::string block(4096, 'f');
+    for (int i = 0; i < 64 && out.write(block.data(), block.size()); ++i) out.flush();
+  }
+  for (int i = 1; i <= 300; ++i) {
+    ASSERT_TRUE(Put("/tmp/full/" + std::to_string(i), "x"));
+    ASSERT_EQ(client.Line(), "full " + std::to_string(i) + " /tmp/full/" + std::to_string(i));
+  }
+  EXPECT_TRUE(daemon.Logged("the journal of queue \"full\" (etc/f) is degraded: cannot write"));
+  EXPECT_EQ(Status()["state"], "degraded");
+  ASSERT_EQ(unlink(filler.c_str()), 0);
+  ASSERT_TRUE(Put("/tmp/full/again", "x"));
+  EXPECT_EQ(client.Line(), "full 301 /tmp/full/again");
+  EXPECT_EQ(client.Line(), "full 302 rescan /tmp/full");
+  EXPECT_TRUE(daemon.Logged("the journal of queue \"full\" (etc/f) is written again"));
+  EXPECT_EQ(Status()["state"], "ok");
   EXPECT_EQ(daemon.Stop(SIGTERM), 0);
 }
 
