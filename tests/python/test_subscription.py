@@ -136,6 +136,38 @@ class SubscriptionTest(unittest.TestCase):
         finally:
             daemon.stop()
 
+    def test_follows_across_restarts_each_record_once(self):
+        tree = "/tmp/py/restart"
+        register("r", tree)
+        daemon = Daemon("--state-dir", "/tmp/py/state")
+        try:
+            with zorvnotifyd.Subscription(SOCKET) as subscription:
+                subscription.subscribe("r")
+                touch(tree + "/1")
+                self.assertEqual(take(subscription, 1), [("event", 1, tree + "/1")])
+                journal = subscription.journal
+                self.assertRegex(journal, "^[0-9a-f]{32}$")
+                # Made while the daemon is away and just after it is back,
+                # before the subscription is: resumed, once each, no gap.
+                daemon.stop()
+                touch(tree + "/2")
+                daemon = Daemon("--state-dir", "/tmp/py/state")
+                touch(tree + "/3")
+                got = take_until(subscription, tree + "/3")
+                self.assertEqual(got[-1:], [("event", 1 + len(got), tree + "/3")])
+                self.assertEqual([seq for _, seq, _ in got], list(range(2, 2 + len(got))))
+                self.assertEqual(subscription.journal, journal)
+                # Another journal: no resuming, a rescan of the whole queue,
+                # then the new numbering.
+                daemon.stop()
+                daemon = Daemon("--state-dir", "/tmp/py/other-state")
+                self.assertEqual(take(subscription, 1), [("rescan", 0, "")])
+                touch(tree + "/4")
+                self.assertEqual(take(subscription, 1), [("event", 1, tree + "/4")])
+                self.assertNotEqual(subscription.journal, journal)
+        finally:
+            daemon.stop()
+
     def test_resumes_without_duplicates_after_an_overlong_line(self):
         # A daemon of the test's own (root, as the test runs): it repeats
         # records, sends a line of more than 1 MiB, and later a new journal.
