@@ -35,9 +35,7 @@ One Subscription is used by one thread at a time.
 """
 
 import collections
-import errno
 import json
-import os
 import select
 import socket as _socket
 import struct
@@ -54,7 +52,8 @@ MAX_LINE = 1 << 20
 """The longest line read (bytes); a longer one ends the connection."""
 
 REPLY_TIMEOUT = 10.0
-"""Seconds to wait for the reply to a request before the connection counts as lost."""
+"""Seconds to wait for a connection, a reply or room to send a request
+before the connection counts as lost."""
 
 _TYPES = ("share", "etc", "local-etc")
 _FIRST_BACKOFF = 0.1
@@ -147,7 +146,9 @@ class Subscription:
 
     def __init__(self, socket: str = DEFAULT, journal: Optional[str] = None):
         self._path = socket
-        self._given_journal = journal
+        # The numbering that the since values given to subscribe() belong
+        # to: the journal given, else that of the first connection.
+        self._since_numbering = ("journal", journal) if journal is not None else None
         self._sock: Optional[_socket.socket] = None
         self._buffer = bytearray()
         self._pending: collections.deque = collections.deque()
@@ -210,7 +211,8 @@ class Subscription:
         """Yields the records of the followed queues, in the order they came.
 
         timeout (seconds) bounds the wait for each event: the generator ends
-        when none came in time; None waits for ever.  Reconnects as needed.
+        when none came in time (a connection being made may add up to
+        REPLY_TIMEOUT); None waits for ever.  Reconnects as needed.
         Raises Error on a refusal and NotRoot when the peer is not root.
         """
         while not self._closed:
@@ -276,6 +278,9 @@ class Subscription:
         the daemon cannot be reached or the connection is lost meanwhile.
         """
         sock = _socket.socket(_socket.AF_UNIX, _socket.SOCK_STREAM | _socket.SOCK_CLOEXEC)
+        # Bounds connect() (a full listen backlog blocks it) and sendall();
+        # reads wait in poll() first.
+        sock.settimeout(REPLY_TIMEOUT)
         try:
             sock.connect(self._path)
             creds = sock.getsockopt(_socket.SOL_SOCKET, _socket.SO_PEERCRED,
@@ -288,8 +293,9 @@ class Subscription:
             sock.close()
             self._drop()
             return
-        except BaseException:
+        except NotRoot:
             sock.close()
+            self._drop()
             raise
         self._sock = sock
         try:
@@ -311,6 +317,8 @@ class Subscription:
         numbering = ("journal", journal) if isinstance(journal, str) else ("run", status.get("run"))
         reset = self._numbering is not None and numbering != self._numbering
         self._numbering = numbering
+        if self._since_numbering is None:
+            self._since_numbering = numbering
         self._journal = journal if isinstance(journal, str) else None
         for (type_, file, name), last in list(self._last.items()):
             request = {"request": "subscribe", "queue": name, "type": type_, "file": file}
@@ -327,8 +335,7 @@ class Subscription:
     def _send_sub(self, sub: list) -> None:
         """Sends one of the user's subscriptions and takes its reply."""
         name, type_, file, since = sub
-        stale = (since is not None and self._given_journal is not None
-                 and self._journal != self._given_journal)
+        stale = since is not None and self._since_numbering != self._numbering
         request = {"request": "subscribe", "queue": name}
         if type_ is not None:
             request["type"] = type_
@@ -436,7 +443,7 @@ class Subscription:
             del self._buffer[:newline + 1]
             try:
                 message = json.loads(line.decode("utf-8", "surrogateescape"))
-            except ValueError as e:
+            except (ValueError, RecursionError) as e:
                 raise _Lost("a line that is not JSON") from e
             if not isinstance(message, dict):
                 raise _Lost("a line that is not a JSON object")

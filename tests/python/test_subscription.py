@@ -168,9 +168,10 @@ class SubscriptionTest(unittest.TestCase):
         finally:
             daemon.stop()
 
-    def test_resumes_without_duplicates_after_an_overlong_line(self):
+    def test_resumes_each_record_once_and_only_in_its_journal(self):
         # A daemon of the test's own (root, as the test runs): it repeats
-        # records, sends a line of more than 1 MiB, and later a new journal.
+        # records, sends a line of more than 1 MiB, and later a new journal;
+        # then a number stored under a journal it no longer has.
         path = "/tmp/py-fake.sock"
         requests = []
         reply = {"reply": "subscribe", "queue": "f",
@@ -192,27 +193,35 @@ class SubscriptionTest(unittest.TestCase):
                 reader.read()  # until the client hangs up
 
         status = {"reply": "status", "run": "r"}
+        overlong = b"x" * (1 << 20) + b"x"
+        reply7 = dict(reply, queues=[{"type": "etc", "file": "x", "seq": 7}])
         thread, failures = serve(path, [
             lambda r, w: exchange(r, w, "J", [status, reply],
-                                  [record(1), record(2), record(1), b"x" * (1 << 20) + b"x"], hold=True),
+                                  [record(1), record(2), record(1), overlong], hold=True),
             lambda r, w: exchange(r, w, "J", [status, reply, reply], [record(2), record(3)]),
-            lambda r, w: exchange(r, w, "K", [status, dict(reply, queues=[
-                {"type": "etc", "file": "x", "seq": 7}]), reply], [record(7), record(8)], hold=True),
+            lambda r, w: exchange(r, w, "K", [status, reply7, reply], [record(7), record(8)],
+                                  hold=True),
+            lambda r, w: exchange(r, w, "K", [status, reply], [record(1)], hold=True),
         ])
         with zorvnotifyd.Subscription(path) as subscription:
             subscription.subscribe("f")
             got = take(subscription, 5)
             self.assertEqual(subscription.journal, "K")
+        with zorvnotifyd.Subscription(path, journal="J") as subscription:
+            subscription.subscribe("f", since=5)
+            got += take(subscription, 2)
         thread.join(10)
         os.unlink(path)
         self.assertEqual(failures, [])
         self.assertEqual(got, [("event", 1, "/p1"), ("event", 2, "/p2"), ("event", 3, "/p3"),
-                               ("rescan", 7, ""), ("event", 8, "/p8")])
+                               ("rescan", 7, ""), ("event", 8, "/p8"),
+                               ("rescan", 0, ""), ("event", 1, "/p1")])
         subscribe = {"request": "subscribe", "queue": "f"}
         resume = dict(subscribe, type="etc", file="x")
         self.assertEqual(requests, [{"request": "status"}, subscribe,
                                     {"request": "status"}, dict(resume, since=2), subscribe,
-                                    {"request": "status"}, resume, subscribe])
+                                    {"request": "status"}, resume, subscribe,
+                                    {"request": "status"}, subscribe])
 
     def test_refuses_a_peer_that_is_not_root(self):
         os.makedirs("/tmp/py-theirs", mode=0o777, exist_ok=True)
