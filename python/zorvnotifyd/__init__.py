@@ -177,10 +177,14 @@ class Subscription:
 
         Without since, the records from now on; with since, every record
         after that sequence number that the daemon still keeps (a "missed"
-        event says how many are gone), then the new ones.  Raises Error when
-        the daemon refuses the subscription, NotRoot when the socket's peer
-        is not root; when the daemon cannot be reached, the subscription is
-        kept and made when events() gets through.
+        event says how many are gone), then the new ones.  since belongs to
+        the journal given to Subscription() (without one, to the numbering
+        of the first connection): under another, it cannot apply, and the
+        queues are followed from now, after a "rescan" event each.
+
+        Raises Error when the daemon refuses the subscription, NotRoot when
+        the socket's peer is not root; when the daemon cannot be reached,
+        the subscription is kept and made when events() gets through.
         """
         if not isinstance(name, str):
             raise TypeError("name must be a str")
