@@ -338,7 +338,18 @@ void WatchTree::Walk(int dir, const std::string& path, WalkContext& context) {
     if (context.found != nullptr) context.found->Found(child, entry.is_dir);
     if (!entry.is_dir) continue;
     UniqueFd sub = OpenSubdir(dir, entry.name);
-    if (sub.get() >= 0) Walk(sub.get(), child, context);
+    if (sub.get() >= 0) {
+      Walk(sub.get(), child, context);
+    } else if ((errno == EMFILE || errno == ENFILE) && !context.out_of_descriptors) {
+      // Each level of a walk holds a descriptor: a tree deeper than the
+      // descriptors left would otherwise lose its lower levels unsaid.
+      const int error = errno;
+      context.out_of_descriptors = true;
+      syslog(LOG_ERR,
+             "cannot open %s to watch it and the directories below it: %s (a walk holds a "
+             "descriptor per level; raise the descriptor limit or lower --max-clients)",
+             Quoted(child).c_str(), strerror(error));
+    }
   }
   context.ancestors.pop_back();
 }

@@ -135,6 +135,7 @@ class WatchTree {
     size_t dirs = 0;                           // directories met
     size_t unwatched = 0;                      // of which the watch limit refused
     std::vector<std::pair<dev_t, ino_t>> ancestors;  // loop guard
+    bool out_of_descriptors = false;                 // a subdirectory could not be opened, logged
   };
 
   // Reads one buffer of events into pending_.  False when nothing was read

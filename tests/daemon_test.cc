@@ -639,7 +639,7 @@ long CpuTicks(pid_t pid) {
 // allows: each is refused with an error line, and the daemon goes on
 // serving, watching new directories, and waiting without spinning.
 TEST_F(DaemonTest, OutlivesHostileClients) {
-  ASSERT_EQ(std::system("rm -rf /tmp/h && mkdir /tmp/h"), 0);
+  ASSERT_EQ(std::system("rm -rf /tmp/h /tmp/deep && mkdir /tmp/h"), 0);
   Register("h", "/tmp/h", kCreate);
   // 160 descriptors leave room for 32 clients besides the daemon's reserve.
   constexpr size_t kCap = 32;
@@ -702,6 +702,13 @@ TEST_F(DaemonTest, OutlivesHostileClients) {
     EXPECT_EQ(client->Next(), Json::Value()) << "not closed";
   }
   EXPECT_TRUE(daemon.Logged("at the client limit"));
+  // A tree deeper than the reserve lets a walk go, moved in at the cap:
+  // what the walk cannot open is said, not silently left unwatched.
+  std::string deep = "/tmp/deep";
+  for (int i = 0; i < 150; ++i) deep += "/d";
+  ASSERT_TRUE(std::filesystem::create_directories(deep));
+  ASSERT_EQ(rename("/tmp/deep", "/tmp/h/deep"), 0);
+  EXPECT_TRUE(daemon.Logged("to watch it and the directories below it: Too many open files"));
   idle.clear();
   beyond.clear();
   EXPECT_TRUE(daemon.Logged("accepting clients again: 150 were refused at the client limit"));

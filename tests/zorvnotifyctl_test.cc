@@ -391,6 +391,9 @@ TEST(ZorvnotifyctlTest, ReadsFilesInNameOrderAndAReadOnlyUsrWithWarnings) {
   Check({{"list w", "", 1,
           "queue file /usr/zorv/etc/zorvnotifyd/w is refused: it is writable by group or others"},
          {"get w w", "", 1, "/usr/zorv/etc/zorvnotifyd/w is refused"},
+         // A write would keep the others' queues in a file of root's alone.
+         {"upsert w", WatchingPath("/s/t"), 1, "/usr/zorv/etc/zorvnotifyd/w is refused"},
+         {"delete w w", "", 1, "/usr/zorv/etc/zorvnotifyd/w is refused"},
          {"list a", "", 0, ""}});
   ASSERT_EQ(chown("/usr/zorv/etc/zorvnotifyd/a", 1000, 0), 0);
   ASSERT_EQ(chmod("/usr/zorv", 0775), 0);

@@ -455,10 +455,14 @@ int RunUpsert(const Invocation& invocation) {
   Json::Value object;
   const std::string problem = ParseQueueObject(text, &object);
   if (!problem.empty()) {
-    return Fail(kExitUsage, "invalid queue object in " +
-                                (source == "-" ? std::string("standard input") : source) + ": " +
-                                problem);
+    return Fail(kExitUsage,
+                "invalid queue object in " +
+                    (source == "-" ? std::string("standard input") : Printable(source)) + ": " +
+                    problem);
   }
+  // A write keeps the file's other queues, in a file of root's alone: one
+  // that others control would have theirs trusted from then on.
+  if (!CheckTrusted(invocation, file, &status)) return status;
   const MonitorQueue queue(object);
   if (!StoreWithRetry(
           invocation, [&] { return MonitorQueue::Upsert(queue, file, invocation.type); },
@@ -481,7 +485,7 @@ int RunDelete(const Invocation& invocation) {
   const std::string& name = invocation.args[0];
   const std::string& file = invocation.args[1];
   int status = kExitOk;
-  if (!CheckFileName(file, &status)) return status;
+  if (!CheckFileName(file, &status) || !CheckTrusted(invocation, file, &status)) return status;
   // Whether the queue is there only shapes the report: the library treats
   // a missing name as success and so does the exit status.
   std::vector<MonitorQueue> before;

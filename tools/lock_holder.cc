@@ -73,10 +73,9 @@ std::string LockHolder(const std::string& lock_file) {
     std::string holder = "pid " + pid;
     uid_t uid = 0;
     if (RealUid(pid, &uid)) {
-      const struct passwd* user = getpwuid(uid);
-      holder += user != nullptr
-                    ? " (user " + std::string(user->pw_name) + ", uid " + std::to_string(uid) + ")"
-                    : " (uid " + std::to_string(uid) + ")";
+      const std::string name = UserName(uid);
+      holder += " (" + (name.empty() ? "" : zorvcommon::Printable(name) + ", ") + "uid " +
+                std::to_string(uid) + ")";
     }
     return holder;
   }

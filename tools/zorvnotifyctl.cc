@@ -57,7 +57,7 @@ constexpr CommandInfo kCommands[] = {
      "that does not exist holds no queues.  With --json: the queues as a JSON array\n"
      "in the file's own form.  A file that root alone does not control (its owner,\n"
      "or write permission for group or others on it or a directory above it) is\n"
-     "refused with exit status 1, as it is by get.\n"},
+     "refused with exit status 1, as it is by get, upsert and delete.\n"},
     {"get", 2, 2, kFileType, RunGet, "NAME FILE",
      "Shows the first queue named NAME (exactly, case included) of queue file FILE.\n"
      "Exit status 1 when the file holds no such queue.  With --json: the queue\n"
