@@ -1017,4 +1017,31 @@ TEST_F(DaemonTest, DeliversLiveWhenTheJournalCannotBeWritten) {
   EXPECT_EQ(daemon.Stop(SIGTERM), 0);
 }
 
+// The Python module and its example against this daemon, which
+// tests/python/test_subscription.py starts and stops itself (a restart is
+// part of what it checks).  Its unittest report comes out on a failure.
+TEST_F(DaemonTest, PythonModuleFollowsQueues) {
+  if (access(PYTHON3_PATH, X_OK) != 0) GTEST_SKIP() << "no Python 3 at " PYTHON3_PATH;
+  zorv_test::ChildProcess python(
+      {PYTHON3_PATH, ZORVNOTIFYD_SOURCE_DIR "/tests/python/test_subscription.py"},
+      [] {
+        return setenv("PYTHONPATH", ZORVNOTIFYD_SOURCE_DIR "/python", 1) == 0 &&
+               setenv("PYTHONDONTWRITEBYTECODE", "1", 1) == 0 &&
+               setenv("ZORVNOTIFYD_PATH", ZORVNOTIFYD_PATH, 1) == 0 &&
+               setenv("ZORVNOTIFYCTL_PATH", ZORVNOTIFYCTL_PATH, 1) == 0 &&
+               setenv("ZORVNOTIFYD_SOCKET", kSocket, 1) == 0;
+      },
+      true);
+  // unittest's last line is "OK" or "FAILED (...)"; two empty reads in a
+  // row mean a time-out (its report has no two blank lines together).
+  std::string report, line;
+  for (int empty = 0; empty < 2 && line.rfind("OK", 0) != 0 && line.rfind("FAILED", 0) != 0;) {
+    line = python.Read();
+    empty = line.empty() ? empty + 1 : 0;
+    report += line + "\n";
+  }
+  EXPECT_EQ(line, "OK") << report;
+  EXPECT_EQ(python.Stop(0), 0);
+}
+
 }  // namespace

@@ -1,0 +1,258 @@
+"""Tests of the zorvnotifyd module and examples/python/follow.py.
+
+Run by daemon_test inside its sandbox (as root, with a private /usr and
+/tmp): ZORVNOTIFYD_PATH and ZORVNOTIFYCTL_PATH name the daemon and the tool,
+ZORVNOTIFYD_SOCKET the socket in a directory of root's, and PYTHONPATH holds
+the module.  The daemon is started and stopped here, as a restart is part of
+what is checked.
+"""
+
+import json
+import os
+import signal
+import socket
+import subprocess
+import sys
+import threading
+import time
+import unittest
+
+import zorvnotifyd
+
+DAEMON = os.environ.get("ZORVNOTIFYD_PATH", "")
+TOOL = os.environ.get("ZORVNOTIFYCTL_PATH", "")
+SOCKET = os.environ.get("ZORVNOTIFYD_SOCKET", "/tmp/zorvrun/zorvnotifyd.sock")
+FOLLOW = os.path.join(os.path.dirname(__file__), "..", "..", "examples", "python", "follow.py")
+IN_CREATE = 0x100
+
+
+def register(name, tree):
+    """Registers the queue NAME watching TREE for IN_CREATE in queue file "py"."""
+    os.makedirs(tree, exist_ok=True)
+    queue = {"queue": name, "config": [{"path": tree, "mask": IN_CREATE}]}
+    subprocess.run([TOOL, "upsert", "py"], input=json.dumps(queue).encode(), check=True,
+                   stdout=subprocess.DEVNULL)
+
+
+def touch(path):
+    with open(path, "wb"):
+        pass
+
+
+class Daemon:
+    """The daemon on SOCKET, ready once constructed; its log in /tmp."""
+
+    def __init__(self, *args):
+        self.log = "/tmp/py-daemon.log"
+        with open(self.log, "wb") as log:
+            self.process = subprocess.Popen([DAEMON, "--socket", SOCKET, *args],
+                                            stdout=subprocess.DEVNULL, stderr=log)
+        for _ in range(1000):
+            with open(self.log, "rb") as log:
+                if b"ready:" in log.read():
+                    return
+            if self.process.poll() is not None:
+                break
+            time.sleep(0.01)
+        self.stop()
+        raise AssertionError("the daemon did not get ready")
+
+    def stop(self):
+        self.process.send_signal(signal.SIGTERM)
+        self.process.wait(10)
+
+
+def take(subscription, count):
+    """The next COUNT events, each as (kind, seq, path); fewer after 10 s without one."""
+    got = []
+    for event in subscription.events(timeout=10):
+        got.append((event.kind, event.seq, event.path))
+        if len(got) == count:
+            break
+    return got
+
+
+def take_until(subscription, path):
+    """The events up to the one of PATH, each as (kind, seq, path); all of
+    them when it did not come within 10 s of the last."""
+    got = []
+    for event in subscription.events(timeout=10):
+        got.append((event.kind, event.seq, event.path))
+        if event.path == path:
+            break
+    return got
+
+
+def serve(path, scripts):
+    """Serves one connection at PATH with each of SCRIPTS in turn, in a thread.
+
+    A script takes the connection's reader and writer; it returns when it is
+    done with the connection, which is then closed.  The thread's failures
+    are kept in the returned list.
+    """
+    listener = socket.socket(socket.AF_UNIX, socket.SOCK_STREAM)
+    listener.bind(path)
+    listener.listen()
+    failures = []
+
+    def run():
+        with listener:
+            for script in scripts:
+                conn, _ = listener.accept()
+                with conn, conn.makefile("rb") as reader, conn.makefile("wb") as writer:
+                    try:
+                        script(reader, writer)
+                    except Exception as e:  # reported by the test
+                        failures.append(repr(e))
+
+    thread = threading.Thread(target=run, daemon=True)
+    thread.start()
+    return thread, failures
+
+
+class SubscriptionTest(unittest.TestCase):
+    def test_events_come_in_order_with_their_bytes(self):
+        # A queue name and a path that are not UTF-8, on the way in and out.
+        name, tree = "caf\udce9", "/tmp/py/order"
+        register(name, tree)
+        daemon = Daemon()
+        try:
+            with zorvnotifyd.Subscription(SOCKET) as subscription:
+                subscription.subscribe(name)
+                for base in (b"a", b"b", b"caf\xe9"):
+                    touch(tree.encode() + b"/" + base)
+                got = take(subscription, 3)
+                self.assertEqual(got, [("event", 1, tree + "/a"), ("event", 2, tree + "/b"),
+                                       ("event", 3, tree + "/caf\udce9")])
+                self.assertEqual(got[2][2].encode("utf-8", "surrogateescape"),
+                                 b"/tmp/py/order/caf\xe9")
+            # The example prints the records still kept, escaped.
+            with subprocess.Popen([sys.executable, FOLLOW, "--socket", SOCKET, "--since", "1",
+                                   name], stdout=subprocess.PIPE) as follow:
+                lines = [follow.stdout.readline() for _ in range(2)]
+                follow.terminate()
+            self.assertEqual(lines, [b"etc/py 2 event /tmp/py/order/b 256\n",
+                                     b"etc/py 3 event /tmp/py/order/caf\\udce9 256\n"])
+        finally:
+            daemon.stop()
+
+    def test_follows_across_restarts_each_record_once(self):
+        tree = "/tmp/py/restart"
+        register("r", tree)
+        daemon = Daemon("--state-dir", "/tmp/py/state")
+        try:
+            with zorvnotifyd.Subscription(SOCKET) as subscription:
+                subscription.subscribe("r")
+                touch(tree + "/1")
+                self.assertEqual(take(subscription, 1), [("event", 1, tree + "/1")])
+                journal = subscription.journal
+                self.assertRegex(journal, "^[0-9a-f]{32}$")
+                # Made while the daemon is away and just after it is back,
+                # before the subscription is: resumed, once each, no gap.
+                daemon.stop()
+                touch(tree + "/2")
+                daemon = Daemon("--state-dir", "/tmp/py/state")
+                touch(tree + "/3")
+                got = take_until(subscription, tree + "/3")
+                self.assertEqual(got[-1:], [("event", 1 + len(got), tree + "/3")])
+                self.assertEqual([seq for _, seq, _ in got], list(range(2, 2 + len(got))))
+                self.assertEqual(subscription.journal, journal)
+                # Another journal: no resuming, a rescan of the whole queue,
+                # then the new numbering.
+                daemon.stop()
+                daemon = Daemon("--state-dir", "/tmp/py/other-state")
+                self.assertEqual(take(subscription, 1), [("rescan", 0, "")])
+                touch(tree + "/4")
+                self.assertEqual(take(subscription, 1), [("event", 1, tree + "/4")])
+                self.assertNotEqual(subscription.journal, journal)
+        finally:
+            daemon.stop()
+
+    def test_resumes_each_record_once_and_only_in_its_journal(self):
+        # A daemon of the test's own (root, as the test runs): it repeats
+        # records, sends a line of more than 1 MiB, and later a new journal;
+        # then a number stored under a journal it no longer has.
+        path = "/tmp/py-fake.sock"
+        requests = []
+        reply = {"reply": "subscribe", "queue": "f",
+                 "queues": [{"type": "etc", "file": "x", "seq": 0}]}
+
+        def record(seq):
+            return {"queue": "f", "type": "etc", "file": "x", "seq": seq, "path": "/p%d" % seq,
+                    "mask": 256}
+
+        def exchange(reader, writer, journal, answers, then, hold=False):
+            for answer in answers:
+                requests.append(json.loads(reader.readline()))
+                writer.write(json.dumps(dict(answer, journal=journal)).encode() + b"\n")
+                writer.flush()
+            for line in then:
+                writer.write(line if isinstance(line, bytes) else json.dumps(line).encode() + b"\n")
+            writer.flush()
+            if hold:
+                reader.read()  # until the client hangs up
+
+        status = {"reply": "status", "run": "r"}
+        overlong = b"x" * (1 << 20) + b"x"
+        reply7 = dict(reply, queues=[{"type": "etc", "file": "x", "seq": 7}])
+        thread, failures = serve(path, [
+            lambda r, w: exchange(r, w, "J", [status, reply],
+                                  [record(1), record(2), record(1), overlong], hold=True),
+            lambda r, w: exchange(r, w, "J", [status, reply, reply], [record(2), record(3)]),
+            lambda r, w: exchange(r, w, "K", [status, reply7, reply], [record(7), record(8)],
+                                  hold=True),
+            lambda r, w: exchange(r, w, "K", [status, reply], [record(1)], hold=True),
+        ])
+        with zorvnotifyd.Subscription(path) as subscription:
+            subscription.subscribe("f")
+            got = take(subscription, 5)
+            self.assertEqual(subscription.journal, "K")
+        with zorvnotifyd.Subscription(path, journal="J") as subscription:
+            subscription.subscribe("f", since=5)
+            got += take(subscription, 2)
+        thread.join(10)
+        os.unlink(path)
+        self.assertEqual(failures, [])
+        self.assertEqual(got, [("event", 1, "/p1"), ("event", 2, "/p2"), ("event", 3, "/p3"),
+                               ("rescan", 7, ""), ("event", 8, "/p8"),
+                               ("rescan", 0, ""), ("event", 1, "/p1")])
+        subscribe = {"request": "subscribe", "queue": "f"}
+        resume = dict(subscribe, type="etc", file="x")
+        self.assertEqual(requests, [{"request": "status"}, subscribe,
+                                    {"request": "status"}, dict(resume, since=2), subscribe,
+                                    {"request": "status"}, resume, subscribe,
+                                    {"request": "status"}, subscribe])
+
+    def test_refuses_a_peer_that_is_not_root(self):
+        os.makedirs("/tmp/py-theirs", mode=0o777, exist_ok=True)
+        os.chmod("/tmp/py-theirs", 0o777)
+        path = "/tmp/py-theirs/zorvnotifyd.sock"
+        ready_r, ready_w = os.pipe()
+        pid = os.fork()
+        if pid == 0:  # a listener of uid 65534 that would say anything
+            try:
+                os.setgid(65534)
+                os.setuid(65534)
+                listener = socket.socket(socket.AF_UNIX, socket.SOCK_STREAM)
+                listener.bind(path)
+                listener.listen()
+                os.write(ready_w, b"!")
+                conn, _ = listener.accept()
+                conn.sendall(b'{"reply":"status","run":"x","journal":"x"}\n')
+                conn.recv(1)
+            finally:
+                os._exit(0)
+        os.close(ready_w)
+        self.assertEqual(os.read(ready_r, 1), b"!")
+        os.close(ready_r)
+        try:
+            with zorvnotifyd.Subscription(path) as subscription:
+                with self.assertRaisesRegex(zorvnotifyd.NotRoot, "uid 65534"):
+                    subscription.subscribe("q")
+        finally:
+            os.kill(pid, signal.SIGKILL)
+            os.waitpid(pid, 0)
+
+
+if __name__ == "__main__":
+    unittest.main(verbosity=2)
