@@ -29,6 +29,7 @@
 #include "queue_log.h"
 #include "report.h"
 #include "server.h"
+#include "state_dir.h"
 #include "text.h"
 #include "unique_fd.h"
 #include "watch_tree.h"
@@ -44,6 +45,8 @@ const char kUsage[] =
     "the daemon's Unix socket, as JSON lines (see zorvnotifyd(8) for the protocol).\n"
     "\n"
     "  --socket PATH         the socket (default /run/zorvnotifyd/zorvnotifyd.sock), in\n"
+    "                        a directory of root's that only root may write\n"
+    "  --state-dir DIR       what is kept across restarts (default /var/lib/zorvnotifyd),\n"
     "                        a directory of root's that only root may write\n"
     "  --group GROUP         members of GROUP may connect too (default: root only)\n"
     "  --keep N              events kept per queue for clients that reconnect\n"
@@ -150,6 +153,7 @@ struct Options {
   Stdout out = Stdout::kNone;
   double retry_seconds = kDefaultRetrySeconds;
   size_t keep = 100;
+  std::string state_dir = kDefaultStateDir;
 };
 
 // Serves events until a stop signal (returns 0) or a fatal error (1).
@@ -158,6 +162,8 @@ int Serve(const Options& options) {
   CatalogueWatch catalogue_watch;
   UniqueFd inotify = OpenInotify();
   if (signals.get() < 0 || inotify.get() < 0 || !catalogue_watch.Open()) return 1;
+  StateDir state;
+  if (!state.Open(options.state_dir)) return 1;
   CatalogueLoader loader;
   QueueLogs logs(options.keep);
   Reporter reporter(logs, options.out);
@@ -277,6 +283,8 @@ int ParseOptions(int argc, char** argv, Options* options) {
       if (options->out == Stdout::kNone) options->out = Stdout::kText;
     } else if (arg == "--socket" && value != nullptr) {
       options->server.socket_path = argv[++i];
+    } else if (arg == "--state-dir" && value != nullptr) {
+      options->state_dir = argv[++i];
     } else if (arg == "--group" && value != nullptr) {
       ++i;
       const struct group* group = getgrnam(value);

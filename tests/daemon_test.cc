@@ -725,6 +725,7 @@ TEST_F(DaemonTest, ListensOnItsOwnSocketInARootOnlyDirectory) {
   ASSERT_EQ(std::system("rm -rf /tmp/k && mkdir /tmp/k"), 0);
   Register("k", "/tmp/k", kCreate);
   Daemon daemon({"--json", "--retry", "0.05"});
+  EXPECT_TRUE(daemon.Logged("made the state directory \"/var/lib/zorvnotifyd\""));
   ASSERT_TRUE(daemon.Logged("ready: watching 1 directories for 1 queues"));
   Client before;
   ASSERT_TRUE(before.connected());
@@ -770,6 +771,18 @@ TEST_F(DaemonTest, ListensOnItsOwnSocketInARootOnlyDirectory) {
     EXPECT_EQ(refused.Stop(0), 1);
     EXPECT_NE(access((dir + "/zorvnotifyd.sock").c_str(), F_OK), 0);
   }
+  // So would a state directory: refused too, and so is a link to one.
+  ASSERT_EQ(symlink("/tmp/k", "/tmp/state-link"), 0);
+  for (const std::string dir : {"/tmp/open", "/tmp/theirs", "/tmp/state-link"}) {
+    Daemon refused({"--state-dir", dir});
+    EXPECT_TRUE(refused.Logged(
+        "cannot use the state directory: \"" + dir +
+        (dir == "/tmp/open"     ? "\" is owned by uid 0 with mode 1777; it must be root's"
+         : dir == "/tmp/theirs" ? "\" is owned by uid 65534 with mode 0755; it must be root's"
+                                : "\" cannot be used: it is not a directory (a link is not "
+                                  "followed)")));
+    EXPECT_EQ(refused.Stop(0), 1);
+  }
 
   // Started by hand, without the runtime directory its service makes: the
   // daemon makes it.
@@ -783,6 +796,10 @@ TEST_F(DaemonTest, ListensOnItsOwnSocketInARootOnlyDirectory) {
       << std::oct << st.st_mode;
   ASSERT_EQ(lstat((run + "/zorvnotifyd.sock").c_str(), &st), 0);
   EXPECT_TRUE(S_ISSOCK(st.st_mode));
+  // And its state directory (made by the first daemon), root's alone.
+  ASSERT_EQ(lstat("/var/lib/zorvnotifyd", &st), 0);
+  EXPECT_TRUE(S_ISDIR(st.st_mode) && st.st_uid == 0 && (st.st_mode & 07777) == 0700)
+      << std::oct << st.st_mode;
   EXPECT_EQ(by_hand.Stop(SIGTERM), 0);
 }
 

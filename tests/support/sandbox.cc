@@ -62,6 +62,10 @@ std::string SetUp() {
       mount("tmp", "/tmp", "tmpfs", MS_NOSUID | MS_NODEV, "mode=1777") != 0) {
     return std::string("overlay on /usr, tmpfs on /tmp: ") + strerror(errno);
   }
+  // The daemon's default state directory is made there, never on the host.
+  if (mount("varlib", "/var/lib", "tmpfs", MS_NOSUID | MS_NODEV, "mode=0755") != 0) {
+    return std::string("tmpfs on /var/lib: ") + strerror(errno);
+  }
   // The host's /usr and /tmp are out of reach.
   if (statfs("/usr", &usr_fs) != 0 || usr_fs.f_type != OVERLAYFS_SUPER_MAGIC ||
       statfs("/tmp", &tmp_fs) != 0 || tmp_fs.f_type != TMPFS_MAGIC || !fs::is_empty("/tmp")) {
@@ -89,8 +93,8 @@ const char* SandboxSkipReason() { return g_reason.c_str(); }
 
 void ResetStore() {
   if (!g_active) return;
-  for (const char* tree :
-       {"/usr/zorv", "/usr/local/etc/zorvnotifyd", "/tmp/zorvnotifyd_monitor_q.lock"}) {
+  for (const char* tree : {"/usr/zorv", "/usr/local/etc/zorvnotifyd",
+                           "/tmp/zorvnotifyd_monitor_q.lock", "/var/lib/zorvnotifyd"}) {
     fs::remove_all(tree);
   }
   fs::create_directories(kDir);

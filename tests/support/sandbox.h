@@ -1,5 +1,6 @@
 // The test sandbox: a private mount namespace in which /usr is an overlay
-// whose writes land on a throw-away tmpfs and /tmp is a fresh, empty tmpfs.
+// whose writes land on a throw-away tmpfs and /tmp and /var/lib are fresh,
+// empty tmpfs (the daemon's default state directory is made there).
 // Tests may create /usr/zorv, /usr/local/etc/zorvnotifyd and the store lock
 // in /tmp without changing anything on the host, and the sandbox's fake
 // /usr/bin/systemctl records service requests instead of performing them.
@@ -27,9 +28,9 @@ bool SandboxActive();
 const char* SandboxSkipReason();
 
 // Returns the store to its initial state: removes /usr/zorv,
-// /usr/local/etc/zorvnotifyd and /tmp/zorvnotifyd_monitor_q.lock (whole
-// trees), reinstalls the fake systemctl, empties its records and sets its
-// exit status back to 0.  A failure throws (gtest reports it as a failure of
+// /usr/local/etc/zorvnotifyd, /tmp/zorvnotifyd_monitor_q.lock and the
+// daemon's state in /var/lib/zorvnotifyd (whole trees), reinstalls the fake systemctl, empties its
+// records and sets its exit status back to 0.  A failure throws (gtest reports it as a failure of
 // the test).  Needs effective root; does nothing when the sandbox is inactive.
 void ResetStore();
 
