@@ -269,22 +269,6 @@ bool TreeSnapshot::Save(int dir) {
   return true;
 }
 
-Snapshot::Snapshot(int state_dir) {
-  if (mkdirat(state_dir, "snapshot", 0700) != 0 && errno != EEXIST) {
-    syslog(LOG_ERR, "cannot make the snapshot directory: %s", strerror(errno));
-    return;
-  }
-  dir_ = UniqueFd(openat(state_dir, "snapshot", O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
-  struct stat st;
-  if (dir_.get() < 0 || fstat(dir_.get(), &st) != 0 || st.st_uid != geteuid() ||
-      (st.st_mode & 022) != 0) {
-    syslog(LOG_ERR,
-           "the snapshot directory is not a directory of root's that only root may write: "
-           "keeping no snapshot");
-    dir_.Reset();
-  }
-}
-
 TreeSnapshot* Snapshot::Loaded(const std::string& root) {
   const auto it = trees_.find(root);
   return it == trees_.end() ? nullptr : it->second.get();

@@ -88,10 +88,10 @@ class TreeSnapshot {
 // directory: one file per tree, named by a hash of the tree's path.
 class Snapshot {
  public:
-  // Opens (making it when missing, mode 0700) "snapshot" in the open state
-  // directory |state_dir|, never through a link.  Without it (logged) the
-  // snapshot keeps nothing and every tree is answered with a rescan.
-  explicit Snapshot(int state_dir);
+  // Keeps the files in the open directory |dir| (root's alone).  Without
+  // one (empty) it keeps nothing on disk: every tree walked afresh is
+  // answered with a rescan.
+  explicit Snapshot(UniqueFd dir) : dir_(std::move(dir)) {}
   Snapshot(const Snapshot&) = delete;
   Snapshot& operator=(const Snapshot&) = delete;
 

@@ -10,6 +10,8 @@
 #include <syslog.h>
 #include <unistd.h>
 
+#include <utility>
+
 #include "directory.h"
 #include "offline_changes.h"
 #include "text.h"
@@ -84,6 +86,7 @@ void WatchTree::Resync() {
 void WatchTree::Sync(const std::vector<std::string>& roots,
                      const ZORV::ZORVNOTIFYD::MonitorQueueIndex& index) {
   const HomeAtReturn home(*this);
+  Relist();  // while the directories marked are still watched
   roots_ = std::set<std::string, std::less<>>(roots.begin(), roots.end());
   index_ = index;
   std::set<int> synced;
@@ -170,7 +173,7 @@ void WatchTree::Tick(EventSink& sink) {
     }
     if (!exists) continue;  // logged as missing already, when it went
     WalkContext context;
-    if (snapshot_ == nullptr) context.found = &sink;
+    context.found = &sink;
     std::string why;
     if (!WatchRootTree(root, context, &why, true)) continue;
     if (context.unwatched != 0) limited_[root] += context.unwatched;
@@ -216,6 +219,7 @@ bool WatchTree::ReadEvents(EventSink& sink) {
       }
       syslog(LOG_WARNING, "inotify event queue overflowed, events were lost: rescanning the trees");
       sink.Lost();
+      Relist();
       // Deletions and moves may be among the lost events, so no watch is
       // trusted: all are dropped and the trees watched afresh.
       Clear();
@@ -355,16 +359,28 @@ bool WatchTree::WatchRootTree(const std::string& root, WalkContext& context, std
   }
   Snapshot::Known known;
   OfflineChanges changes(snapshot_->Tree(root, &known));
+  EventSink* found = std::exchange(context.found, nullptr);
   context.compare = &changes;
   Walk(dir.get(), root, context);
   context.compare = nullptr;
+  context.found = found;
   // Without a saved view, a flood of creations would tell no more than
   // one rescan of the tree, and could not tell what was deleted.
   if (known == Snapshot::Known::kSaved) {
     changes.Finish(*sink_);
-  } else {
-    sink_->Rescan(root);
+    return true;
   }
+  if (known == Snapshot::Known::kNone && context.found != nullptr) {
+    // A tree that appears for the first time has no past: all it holds
+    // is new, and found.
+    for (const auto& [path, listing] : snapshot_->Loaded(root)->dirs()) {
+      for (const SnapshotEntry& entry : listing.entries) {
+        context.found->Found(path + "/" + entry.name, entry.is_dir);
+      }
+    }
+    return true;
+  }
+  sink_->Rescan(root);
   return true;
 }
 
@@ -574,6 +590,12 @@ bool WatchTree::ListWatched(const std::string& path, SnapshotListing* listing) {
 
 void WatchTree::SaveSnapshot() {
   if (snapshot_ == nullptr) return;
+  Relist();
+  snapshot_->Save();
+}
+
+void WatchTree::Relist() {
+  if (snapshot_ == nullptr) return;
   // A directory that left its parent's listing, and one that came, by
   // inode: one that moved takes the listings below it along; one that
   // left the trees loses them; one new to a tree is listed in turn.
@@ -651,7 +673,6 @@ void WatchTree::SaveSnapshot() {
       }
     }
   }
-  snapshot_->Save();
 }
 
 }  // namespace zorvnotifyd

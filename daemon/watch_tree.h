@@ -187,6 +187,9 @@ class WatchTree {
   // entries as Found; with |compare| and a snapshot, compares it with the
   // snapshot instead.  False (with |why|) when the root cannot be opened.
   bool WatchRootTree(const std::string& root, WalkContext& context, std::string* why, bool compare);
+  // The listing half of SaveSnapshot: puts the directories marked into
+  // the snapshot, without saving it.
+  void Relist();
   // Tells sink_ to rescan each of |tops| not told already.
   void NoteUnwatched(const std::vector<std::string>& tops);
   // Lists the watched directory |path| into |listing|; false when it is

@@ -29,6 +29,7 @@
 #include "queue_log.h"
 #include "report.h"
 #include "server.h"
+#include "snapshot.h"
 #include "state_dir.h"
 #include "text.h"
 #include "unique_fd.h"
@@ -65,6 +66,10 @@ const char kUsage[] =
     "and stops on SIGTERM or SIGINT (status 0).  Log lines go to syslog and to standard error.\n";
 
 constexpr double kDefaultRetrySeconds = 5;
+
+// How long after a change the snapshot of the trees is saved: changes are
+// saved in groups, never one write and sync per event.
+constexpr int64_t kSnapshotSaveMs = 100;
 
 // Descriptors kept from the clients for everything else: about 16 that the
 // daemon holds or opens for a moment (standard streams, syslog, the
@@ -168,6 +173,14 @@ int Serve(const Options& options) {
   QueueLogs logs(options.keep);
   Reporter reporter(logs, options.out);
   WatchTree tree(std::move(inotify), options.retry_seconds);
+  std::string reason;
+  UniqueFd snapshot_dir = state.OpenSubdirectory("snapshot", &reason);
+  if (snapshot_dir.get() < 0) {
+    syslog(LOG_ERR, "cannot keep the snapshot of the trees (%s): every tree is rescanned",
+           reason.c_str());
+  }
+  Snapshot snapshot(std::move(snapshot_dir));
+  tree.UseSnapshot(&snapshot, &reporter);
   Server server(options.server, logs, RunId(), [&] {
     std::string status;
     AppendJsonNumber(&status, "directories", tree.size());
@@ -196,6 +209,7 @@ int Serve(const Options& options) {
     server.FollowNew(created);
   };
   load();
+  int64_t save_due = NowMs() + kSnapshotSaveMs;  // the views of the trees walked
   syslog(LOG_INFO, "ready: watching %zu directories for %zu queues", tree.size(), reporter.size());
   NotifyServiceManager(ReadyState(tree.size(), reporter.size()));
   const int64_t retry_ms = std::max<int64_t>(1, int64_t(options.retry_seconds * 1000));
@@ -207,7 +221,8 @@ int Serve(const Options& options) {
   for (;;) {
     // Trees that went away, were replaced or did not fit under the watch
     // limit are looked at again on a fixed period, whatever the load.
-    const int ready = poll(fds, 4, int(std::max<int64_t>(0, next_tick - NowMs())));
+    const int64_t wake = save_due < 0 ? next_tick : std::min(next_tick, save_due);
+    const int ready = poll(fds, 4, int(std::max<int64_t>(0, wake - NowMs())));
     if (ready < 0 && errno != EINTR) {
       syslog(LOG_ERR, "poll failed: %s", strerror(errno));
       return 1;
@@ -224,10 +239,14 @@ int Serve(const Options& options) {
       NotifyServiceManager("STOPPING=1");
       syslog(LOG_INFO, "stopping on %s: releasing %zu watches", strsignal(int(info.ssi_signo)),
              tree.size());
+      tree.SaveSnapshot();
       tree.Clear();
       return 0;
     }
-    if (ready > 0 && (fds[1].revents & POLLIN) && !tree.ReadEvents(reporter)) return 1;
+    if (ready > 0 && (fds[1].revents & POLLIN)) {
+      if (!tree.ReadEvents(reporter)) return 1;
+      if (save_due < 0) save_due = NowMs() + kSnapshotSaveMs;
+    }
     // A configuration directory that was missing (a read-only /usr) and
     // exists now is read as soon as the next tick finds it.
     const bool tick = NowMs() >= next_tick;
@@ -235,6 +254,7 @@ int Serve(const Options& options) {
     if (hangup || changed || (tick && catalogue_watch.WatchMissing())) {
       NotifyServiceManager("RELOADING=1");
       load();
+      if (save_due < 0) save_due = NowMs() + kSnapshotSaveMs;
       syslog(LOG_INFO, "catalogue reloaded: watching %zu directories for %zu queues", tree.size(),
              reporter.size());
       NotifyServiceManager(ReadyState(tree.size(), reporter.size()));
@@ -244,6 +264,11 @@ int Serve(const Options& options) {
       tree.Tick(reporter);
       server.Tick(options.retry_seconds);
       next_tick = NowMs() + retry_ms;
+      if (save_due < 0) save_due = NowMs() + kSnapshotSaveMs;
+    }
+    if (save_due >= 0 && NowMs() >= save_due) {
+      tree.SaveSnapshot();
+      save_due = -1;
     }
     server.Deliver();
     if (options.out != Stdout::kNone && (fflush(stdout) != 0 || ferror(stdout))) {

@@ -324,21 +324,23 @@ TEST(ZorvnotifyctlTest, WatchAndStatusAskTheDaemon) {
   // Its first line comes once the subscription is in place.
   zorv_test::ChildProcess watch({ZORVNOTIFYCTL_PATH, "--socket", socket, "watch", "backup"},
                                 nullptr, true);
-  EXPECT_EQ(watch.Read(), "watching backup: etc/nas (last #0)");
+  EXPECT_EQ(watch.Read(), "watching backup: etc/nas (last #1)");
   std::ofstream("/tmp/wd/new").flush();
-  EXPECT_EQ(watch.Read(), "backup [etc/nas] #1 IN_CREATE /tmp/wd/new");
+  EXPECT_EQ(watch.Read(), "backup [etc/nas] #2 IN_CREATE /tmp/wd/new");
   std::ofstream("/tmp/wd/b\xff").flush();  // named by its escape, as valid UTF-8
-  EXPECT_EQ(watch.Read(), "backup [etc/nas] #2 IN_CREATE /tmp/wd/b\\udcff");
+  EXPECT_EQ(watch.Read(), "backup [etc/nas] #3 IN_CREATE /tmp/wd/b\\udcff");
   EXPECT_EQ(watch.Stop(SIGINT), 0);
 
-  // Kept records come first with --since; the daemon's going away ends
-  // the watch with status 1.
+  // Kept records come first with --since (the first, of the daemon's
+  // first start, asks for a rescan of the tree); the daemon's going away
+  // ends the watch with status 1.
   zorv_test::ChildProcess json(
       {ZORVNOTIFYCTL_PATH, "--json", "--since", "0", "--socket", socket, "watch", "backup", "nas"},
       nullptr, true);
   EXPECT_EQ(Parse(json.Read())["reply"], "subscribe");
+  EXPECT_EQ(Parse(json.Read())["rescan"], "/tmp/wd");
   const Json::Value event = Parse(json.Read());
-  EXPECT_EQ(event["seq"], 1);
+  EXPECT_EQ(event["seq"], 2);
   EXPECT_EQ(event["path"], "/tmp/wd/new");
   EXPECT_THAT(json.Read(), ::testing::HasSubstr(R"("path":"/tmp/wd/b\udcff")"));
   EXPECT_EQ(daemon.Stop(SIGTERM), 0);
