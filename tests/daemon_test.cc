@@ -839,4 +839,118 @@ TEST_F(DaemonTest, ServesWhatExistsOnAReadOnlyUsr) {
   EXPECT_EQ(daemon.Stop(SIGTERM), 0);
 }
 
+// The next record of |client| as "SEQ PATH MASK", with " offline" for a
+// change made while the daemon was stopped, or "SEQ rescan PATH"; "" when
+// none came.
+std::string Record(Client& client) {
+  const Json::Value v = client.Next();
+  if (!v.isObject()) return "";
+  const std::string seq = std::to_string(v["seq"].asUInt64());
+  if (v.isMember("rescan")) return seq + " rescan " + v["rescan"].asString();
+  return seq + " " + v["path"].asString() + " " + std::to_string(v["mask"].asUInt()) +
+         (v["offline"].asBool() ? " offline" : "");
+}
+
+// What is done to a tree while the daemon is stopped (cleanly, or killed)
+// reaches a client once, as offline records; a snapshot that cannot be
+// trusted gives a rescan record instead.
+TEST_F(DaemonTest, ReportsWhatChangedWhileItWasStopped) {
+  ASSERT_EQ(std::system("rm -rf /tmp/o && mkdir -p /tmp/o/d /tmp/o/d2/inner /tmp/o/gone && "
+                        "cd /tmp/o && touch del f mv same gone/x"),
+            0);
+  constexpr unsigned kAll =
+      IN_CREATE | IN_MODIFY | IN_CLOSE_WRITE | IN_DELETE | IN_MOVED_FROM | IN_MOVED_TO;
+  Register("o", "/tmp/o", kAll);
+  // Each run: the records a client resuming from the start gets until one
+  // ending in |last|; |log| is a line the daemon must log first; with |out|
+  // the daemon is left running there.
+  auto run = [](const std::string& last, const std::string& log = "",
+                std::unique_ptr<Daemon>* out = nullptr) {
+    auto daemon = std::make_unique<Daemon>(Lines{"--retry", "0.05"});
+    EXPECT_TRUE(log.empty() || daemon->Logged(log)) << log;
+    EXPECT_TRUE(daemon->Logged("ready: watching"));
+    Client client;
+    Subscribe(client, "o", 0);
+    Lines got;
+    const auto ends = [&last](const std::string& text) {
+      return text.empty() || (text.size() >= last.size() &&
+                              text.compare(text.size() - last.size(), last.size(), last) == 0);
+    };
+    do {
+      got.push_back(Record(client));
+    } while (!ends(got.back()));
+    if (out != nullptr) {
+      *out = std::move(daemon);
+    } else {
+      EXPECT_EQ(daemon->Stop(SIGTERM), 0);
+    }
+    return got;
+  };
+  // No saved view at the first start: the whole tree to rescan.
+  EXPECT_EQ(run("1 rescan /tmp/o"), Lines({"1 rescan /tmp/o"}));
+
+  // Every kind of change, in the walk's order, a move told where its
+  // first half is met.
+  ASSERT_EQ(std::system("cd /tmp/o && touch new && echo x >> f && rm del gone/x && rmdir gone && "
+                        "mv mv d/moved && mv d2 d3 && mkdir newdir"),
+            0);
+  const auto line = [](int seq, const std::string& path, unsigned mask) {
+    return std::to_string(seq) + " /tmp/o/" + path + " " + std::to_string(mask) + " offline";
+  };
+  std::unique_ptr<Daemon> daemon;
+  EXPECT_EQ(run("/tmp/o/gone/x 512 offline", "", &daemon),
+            Lines({line(1, "d2", IN_MOVED_FROM | IN_ISDIR), line(2, "d3", IN_MOVED_TO | IN_ISDIR),
+                   line(3, "del", IN_DELETE), line(4, "f", IN_MODIFY | IN_CLOSE_WRITE),
+                   line(5, "gone", IN_DELETE | IN_ISDIR), line(6, "mv", IN_MOVED_FROM),
+                   line(7, "d/moved", IN_MOVED_TO), line(8, "new", IN_CREATE),
+                   line(9, "newdir", IN_CREATE | IN_ISDIR), line(10, "gone/x", IN_DELETE)}));
+
+  // Killed right after an event, before its directory is saved (the view
+  // taken at start is, after the group save's delay): the comparison finds
+  // it again (perhaps twice), and what came after.
+  usleep(300 * 1000);
+  Client live;
+  Subscribe(live, "o");
+  ASSERT_EQ(std::system("touch /tmp/o/k1"), 0);
+  EXPECT_EQ(Record(live), "11 /tmp/o/k1 256");
+  EXPECT_EQ(daemon->Stop(SIGKILL), -1);
+  ASSERT_EQ(std::system("touch /tmp/o/k2"), 0);
+  const Lines after_kill = run("/tmp/o/k2 256 offline");
+  ASSERT_FALSE(after_kill.empty());
+  EXPECT_EQ(after_kill.back().substr(after_kill.back().find(' ')), " /tmp/o/k2 256 offline");
+  for (size_t i = 0; i + 1 < after_kill.size(); ++i) {
+    EXPECT_EQ(after_kill[i].substr(after_kill[i].find(' ')), " /tmp/o/k1 256 offline");
+  }
+
+  // A snapshot that cannot be trusted is logged, answered with a rescan
+  // of its tree, and written afresh.
+  std::string file;
+  for (const auto& entry : std::filesystem::directory_iterator("/var/lib/zorvnotifyd/snapshot"))
+    file = entry.path();
+  const std::string unusable = "the snapshot of tree \"/tmp/o\" is unusable (";
+  for (const auto& [spoil, why] : std::vector<std::pair<std::string, std::string>>{
+           {"printf garbage | dd of=$F bs=1 seek=40 conv=notrunc status=none",
+            "a record does not match its checksum"},
+           {"truncate -s -3 $F", "cut short"},
+           {"mv $F $F.real && ln -s $F.real $F", "a symbolic link"},
+           {"rm $F && mkfifo $F", "not a regular file"},
+           {"truncate -s 300M $F", "too large"},
+           {"chown 65534 $F", "not root's alone"}}) {
+    std::string command = "set -e; F=" + file + "; " + spoil;
+    ASSERT_EQ(std::system(command.c_str()), 0) << spoil;
+    EXPECT_EQ(run("1 rescan /tmp/o", unusable + why + "): starting it afresh"),
+              Lines({"1 rescan /tmp/o"}))
+        << why;
+  }
+
+  // A tree removed and made again while stopped: all it held is gone.
+  ASSERT_EQ(std::system("rm -r /tmp/o && mkdir /tmp/o && touch /tmp/o/again"), 0);
+  EXPECT_EQ(run("/tmp/o/d3/inner 1073742336 offline"),
+            Lines({line(1, "again", IN_CREATE), line(2, "d", IN_DELETE | IN_ISDIR),
+                   line(3, "d3", IN_DELETE | IN_ISDIR), line(4, "f", IN_DELETE),
+                   line(5, "k1", IN_DELETE), line(6, "k2", IN_DELETE), line(7, "new", IN_DELETE),
+                   line(8, "newdir", IN_DELETE | IN_ISDIR), line(9, "same", IN_DELETE),
+                   line(10, "d/moved", IN_DELETE), line(11, "d3/inner", IN_DELETE | IN_ISDIR)}));
+}
+
 }  // namespace
