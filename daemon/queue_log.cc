@@ -2,7 +2,10 @@
 
 #include "queue_log.h"
 
+#include <algorithm>
+
 #include "json_writer.h"
+#include "text.h"
 
 namespace zorvnotifyd {
 namespace {
@@ -42,6 +45,7 @@ LogRecord& QueueLog::Next(uint64_t order) {
     record = std::move(records_.front());
     records_.pop_front();
   }
+  record.seq = next_seq_;
   record.order = order;
   record.line.assign(head_);
   AppendJsonNumber(&record.line, "seq", next_seq_++);
@@ -56,6 +60,20 @@ void QueueLog::AddEvent(const std::string& path, uint32_t mask, uint64_t order, 
   line += ',';
   AppendJsonNumber(&line, "mask", mask);
   line += offline ? ",\"offline\":true}\n" : "}\n";
+  Keep(records_.back());
+}
+
+void QueueLog::Keep(const LogRecord& record) {
+  if (!journal_) return;
+  journal_->Append(record.seq, record.order, record.line);
+  if (!listed_) {
+    listed_ = true;
+    written_->push_back(this);
+  }
+}
+
+void QueueLog::AddRescans(uint64_t order) {
+  for (const std::string& tree : trees) AddRescan(tree, order);
 }
 
 void QueueLog::AddRescan(const std::string& path, uint64_t order) {
@@ -63,6 +81,7 @@ void QueueLog::AddRescan(const std::string& path, uint64_t order) {
   line += ',';
   AppendJsonField(&line, "rescan", path);
   line += "}\n";
+  Keep(records_.back());
 }
 
 void QueueLog::AddNotice(const char* key, uint64_t order) {
@@ -70,6 +89,15 @@ void QueueLog::AddNotice(const char* key, uint64_t order) {
   line += ",\"";
   line += key;
   line += "\":true}\n";
+  Keep(records_.back());
+}
+
+void QueueLogs::UseJournals(int dir, uint64_t size, std::string boot,
+                            std::function<std::string()> renew) {
+  journal_dir_ = dir;
+  journal_size_ = size;
+  boot_ = std::move(boot);
+  renew_ = std::move(renew);
 }
 
 void QueueLogs::Follow(const Catalogue& catalogue, std::vector<QueueLog*>* by_position,
@@ -78,20 +106,45 @@ void QueueLogs::Follow(const Catalogue& catalogue, std::vector<QueueLog*>* by_po
   for (auto& [key, log] : logs_) {
     was_present[log.get()] = log->present;
     log->present = false;
+    log->trees.clear();
   }
   by_position->clear();
+  std::vector<QueueLog*> damaged;
   for (const CatalogueQueue& entry : catalogue) {
     const std::string key = Key(entry.type, entry.file, entry.queue._name);
     std::unique_ptr<QueueLog>& log = logs_[key];
     if (!log) {
       const auto before = forgotten_.find(key);
-      log = std::make_unique<QueueLog>(entry.type, entry.file, entry.queue._name, keep_,
-                                       before == forgotten_.end() ? 0 : before->second);
+      uint64_t last_seq = before == forgotten_.end() ? 0 : before->second;
+      std::unique_ptr<Journal> journal;
+      JournalStart start;
+      if (journal_dir_ >= 0) {
+        const std::string shown = "queue " + zorvcommon::Quoted(entry.queue._name) + " (" +
+                                  zorvcommon::QueueTypeName(entry.type) + "/" +
+                                  zorvcommon::Printable(entry.file) + ")";
+        journal = std::make_unique<Journal>(journal_dir_, key, shown, journal_size_, boot_);
+        start = journal->Open();
+        last_seq = std::max(last_seq, start.last_seq);
+        order_ = std::max(order_, start.last_order);
+      }
+      log = std::make_unique<QueueLog>(entry.type, entry.file, entry.queue._name, keep_, last_seq);
+      if (journal) log->UseJournal(std::move(journal), &written_);
+      log->Skip(start.last_record + 1, start.last_seq + 1);
+      if (start.damaged) damaged.push_back(log.get());
+      // A client's "since" for this queue means nothing now.
+      if (start.lost && renew_) journal_id_ = renew_();
       created->push_back(log.get());
     }
     log->present = true;
+    for (const auto& config : entry.queue._configs) {
+      if (std::find(log->trees.begin(), log->trees.end(), config._path) == log->trees.end()) {
+        log->trees.push_back(config._path);
+      }
+    }
     by_position->push_back(log.get());
   }
+  // What a damaged journal lost is not known: its queue rescans its trees.
+  for (QueueLog* log : damaged) log->AddRescans(NextOrder());
   for (auto it = logs_.begin(); it != logs_.end();) {
     QueueLog& log = *it->second;
     const auto before = was_present.find(&log);
@@ -99,12 +152,104 @@ void QueueLogs::Follow(const Catalogue& catalogue, std::vector<QueueLog*>* by_po
       log.AddNotice(log.present ? "registered" : "removed", NextOrder());
     }
     if (!log.present && log.followers == 0) {
-      forgotten_[it->first] = log.last_seq();
+      Forget(it);
       it = logs_.erase(it);
     } else {
       ++it;
     }
   }
+}
+
+void QueueLogs::Forget(std::map<std::string, std::unique_ptr<QueueLog>>::iterator it) {
+  QueueLog& log = *it->second;
+  forgotten_[it->first] = log.last_seq();
+  if (log.journal() == nullptr) return;
+  log.journal()->Close(log.last_seq());
+  written_.erase(std::remove(written_.begin(), written_.end(), &log), written_.end());
+  degraded_.erase(std::remove(degraded_.begin(), degraded_.end(), &log), degraded_.end());
+}
+
+void QueueLogs::WriteOut() {
+  if (written_.empty()) return;
+  unsynced_ = true;
+  for (QueueLog* log : written_) {
+    log->Written();
+    const bool was_healthy = log->journal()->healthy();
+    if (!log->journal()->WriteOut() && was_healthy) degraded_.push_back(log);
+  }
+  written_.clear();
+}
+
+void QueueLogs::BeforeSend() {
+  for (QueueLog* log : written_) {
+    if (log->journal()->NeedsSyncFor(log->last_seq())) log->journal()->Sync();
+  }
+  WriteOut();
+}
+
+void QueueLogs::Sync() {
+  unsynced_ = false;
+  for (auto& [key, log] : logs_) {
+    if (log->journal() != nullptr) log->journal()->Sync();
+  }
+}
+
+bool QueueLogs::Settle() {
+  bool added = false;
+  for (auto it = degraded_.begin(); it != degraded_.end();) {
+    QueueLog* log = *it;
+    if (!log->journal()->healthy()) {
+      ++it;
+      continue;
+    }
+    // Records made while it failed are not in the journal.
+    log->AddRescans(NextOrder());
+    if (recorded_) recorded_(log);
+    added = true;
+    it = degraded_.erase(it);
+  }
+  return added;
+}
+
+void QueueLogs::Close() {
+  if (closed_) return;
+  closed_ = true;
+  for (auto& [key, log] : logs_) {
+    if (log->journal() != nullptr) log->journal()->Close(log->last_seq());
+  }
+  written_.clear();
+}
+
+bool QueueLogs::degraded() const {
+  for (const auto& [key, log] : logs_) {
+    if (log->journal() != nullptr && !log->journal()->healthy()) return true;
+  }
+  return false;
+}
+
+void QueueLogs::AppendStatus(std::string* out) const {
+  *out += "\"journals\":[";
+  bool first = true;
+  for (const auto& [key, log] : logs_) {
+    if (log->journal() == nullptr) continue;
+    if (!first) *out += ',';
+    first = false;
+    *out += '{';
+    AppendJsonField(out, "queue", log->name());
+    *out += ',';
+    AppendJsonField(out, "type", zorvcommon::QueueTypeName(log->type()));
+    *out += ',';
+    AppendJsonField(out, "file", log->file());
+    *out += ',';
+    AppendJsonNumber(out, "first", log->journal()->first_seq());
+    *out += ',';
+    AppendJsonNumber(out, "last", log->last_seq());
+    *out += ',';
+    AppendJsonNumber(out, "bytes", log->journal()->bytes());
+    *out += ",\"healthy\":";
+    *out += log->journal()->healthy() ? "true}" : "false}";
+  }
+  *out += ']';
 }
 
 std::vector<QueueLog*> QueueLogs::Find(const std::string& name, const QueueType* type,
@@ -123,7 +268,7 @@ void QueueLogs::Unfollow(QueueLog* log) {
   if (--log->followers > 0 || log->present) return;
   for (auto it = logs_.begin(); it != logs_.end(); ++it) {
     if (it->second.get() == log) {
-      forgotten_[it->first] = log->last_seq();
+      Forget(it);
       logs_.erase(it);
       return;
     }

@@ -1,17 +1,21 @@
 // What the daemon keeps of each queue's events for its clients: the most
-// recent records, numbered, so that a client that reconnects gets what it
-// missed and a slow client is told how much it lost.
+// recent records in memory, every record in the queue's journal (as far as
+// its size allows), numbered, so that a client that reconnects, even to a
+// daemon started again, gets what it missed, and a slow client is told how
+// much it lost.
 #ifndef ZORVNOTIFYD_DAEMON_QUEUE_LOG_H_
 #define ZORVNOTIFYD_DAEMON_QUEUE_LOG_H_
 
 #include <cstdint>
 #include <deque>
+#include <functional>
 #include <map>
 #include <memory>
 #include <string>
 #include <vector>
 
 #include "catalogue.h"
+#include "journal.h"
 
 namespace zorvnotifyd {
 
@@ -19,12 +23,14 @@ namespace zorvnotifyd {
 // records of every queue (so that a client of several queues gets them in
 // the order they happened).
 struct LogRecord {
+  uint64_t seq;
   uint64_t order;
   std::string line;
 };
 
 // The records of one queue, numbered from 1 by a sequence number of its
-// own; only the last |keep| are kept.
+// own; the last |keep| are kept in memory, and with a journal every record
+// is appended to it as it is made.
 class QueueLog {
  public:
   // A log whose first record will be numbered |last_seq| + 1.
@@ -46,6 +52,34 @@ class QueueLog {
   // The record numbered |seq|, first_seq() <= seq <= last_seq().
   const LogRecord& at(uint64_t seq) const { return records_[seq - first_seq()]; }
 
+  // Appends to |out| the records from |seq| on that the journal holds, up
+  // to about |max_bytes|; nothing without a journal.
+  void ReadJournal(uint64_t seq, size_t max_bytes, std::deque<JournalRecord>* out) const {
+    if (journal_) journal_->Read(seq, max_bytes, out);
+  }
+  // Numbers from |from| to before |to| were never given to a record (the
+  // numbering went on past a damaged journal): a client is not told of
+  // them as missed.
+  void Skip(uint64_t from, uint64_t to) {
+    skipped_from_ = from;
+    skipped_to_ = to;
+  }
+  // |seq| if it was given to a record, otherwise the next number that was.
+  uint64_t Given(uint64_t seq) const {
+    return seq >= skipped_from_ && seq < skipped_to_ ? skipped_to_ : seq;
+  }
+  // The journal (null when there is none).
+  Journal* journal() const { return journal_.get(); }
+  // Keeps the queue's records in |journal| from now on; |written| is the
+  // list of logs with records to write, which this log joins when it has
+  // some.
+  void UseJournal(std::unique_ptr<Journal> journal, std::vector<QueueLog*>* written) {
+    journal_ = std::move(journal);
+    written_ = written;
+  }
+  // Its journal's records were written: off the list of logs to write.
+  void Written() { listed_ = false; }
+
   // Appends an event: {..,"seq":N,"path":..,"mask":M}, with
   // ,"offline":true before the brace for a change made while the daemon was
   // not watching.
@@ -53,10 +87,16 @@ class QueueLog {
   // Appends a rescan record: {..,"seq":N,"rescan":PATH}: what happened at
   // or below PATH is not known.
   void AddRescan(const std::string& path, uint64_t order);
-  // Appends a notice: {..,"seq":N,"KEY":true} ("lost", "removed",
+  // Appends a notice: {..,"seq":N,"KEY":true} ("removed",
   // "registered").
   void AddNotice(const char* key, uint64_t order);
+  // Appends a rescan record for each of |trees|.
+  void AddRescans(uint64_t order);
 
+  // The trees of the queue's configurations (of every queue of its name in
+  // its file), which a rescan record names when what happened in them is
+  // not known.
+  std::vector<std::string> trees;
   // Whether the queue is in the catalogue now, and how many clients follow
   // it; a log in neither case is forgotten.
   bool present = false;
@@ -66,12 +106,18 @@ class QueueLog {
 
  private:
   LogRecord& Next(uint64_t order);
+  // The last record made is complete: into the journal's buffer.
+  void Keep(const LogRecord& record);
 
   QueueType type_;
   std::string file_, name_, head_;
   size_t keep_;
   std::deque<LogRecord> records_;
   uint64_t next_seq_ = 1;
+  std::unique_ptr<Journal> journal_;
+  std::vector<QueueLog*>* written_ = nullptr;
+  bool listed_ = false;  // in *written_
+  uint64_t skipped_from_ = 0, skipped_to_ = 0;
 };
 
 // The logs of every queue of the catalogue, and of removed queues that
@@ -79,6 +125,41 @@ class QueueLog {
 class QueueLogs {
  public:
   explicit QueueLogs(size_t keep) : keep_(keep) {}
+  ~QueueLogs() { Close(); }
+
+  // Keeps each queue's records in a journal in |dir| (not owned), of
+  // |size| bytes at most, from the next Follow on; |boot| identifies the
+  // running boot.  |renew| makes a new journal id when a queue's numbering
+  // is lost.
+  void UseJournals(int dir, uint64_t size, std::string boot, std::function<std::string()> renew);
+  // The id of the journals: 32 hexadecimal digits.
+  const std::string& journal_id() const { return journal_id_; }
+  void set_journal_id(std::string id) { journal_id_ = std::move(id); }
+  // Calls |recorded| after each record the logs add themselves (rescan
+  // records of a journal written again).
+  void OnRecord(std::function<void(QueueLog*)> recorded) { recorded_ = std::move(recorded); }
+
+  // Writes every journal's new records (one write each).
+  void WriteOut();
+  // True when records were written since the last Sync: the group sync is
+  // due within its interval.
+  bool unsynced() const { return unsynced_; }
+  // Before records go to a client: writes them out, and syncs a journal
+  // whose reserve of numbers does not cover them yet (see Journal).
+  void BeforeSend();
+  // The group sync: every journal synced.
+  void Sync();
+  // A rescan record for the trees of each queue whose journal is written
+  // again after a failure (what was not journaled is covered); true when
+  // any was added.
+  bool Settle();
+  // Marks every journal as cleanly stopped (once; the destructor calls it).
+  void Close();
+  // True while some journal cannot be written.
+  bool degraded() const;
+  // Appends to |out| the members "journals":[{"queue","type","file",
+  // "first","last","bytes"},..] of the status reply.
+  void AppendStatus(std::string* out) const;
 
   // Follows a new catalogue: |by_position| gets the log of each queue of
   // |catalogue| (created when new; one log for queues of the same name in
@@ -99,8 +180,22 @@ class QueueLogs {
   uint64_t NextOrder() { return ++order_; }
 
  private:
+  // Keeps the last number of the log at |it| for a queue that comes back,
+  // and closes its journal; the caller erases it.
+  void Forget(std::map<std::string, std::unique_ptr<QueueLog>>::iterator it);
+
   size_t keep_;
   uint64_t order_ = 0;
+  int journal_dir_ = -1;
+  uint64_t journal_size_ = 0;
+  std::string boot_;
+  std::string journal_id_;
+  std::function<std::string()> renew_;
+  std::function<void(QueueLog*)> recorded_;
+  std::vector<QueueLog*> written_;   // logs whose journals have records to write
+  std::vector<QueueLog*> degraded_;  // logs whose journals failed to write
+  bool closed_ = false;
+  bool unsynced_ = false;
   std::map<std::string, std::unique_ptr<QueueLog>> logs_;  // by type, file and name
   // The last sequence number of each queue forgotten, so that a queue that
   // comes back goes on numbering where it stopped: a client's "since" holds

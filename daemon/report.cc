@@ -117,20 +117,28 @@ void Reporter::RecordWanted(const std::string& path, uint32_t kinds, uint32_t ex
 }
 
 void Reporter::Lost() {
+  // Which events were lost is not known, only where they may have been:
+  // each queue is told to rescan its trees.
   ++overflows_;
   const uint64_t order = logs_.NextOrder();
   for (size_t i = 0; i < catalogue_.size(); ++i) {
     QueueLog* log = logs_by_position_[i];
     if (log->last_order != order) {
       log->last_order = order;
-      log->AddNotice("lost", order);
+      log->AddRescans(order);
       if (recorded_) recorded_(log);
     }
     if (stdout_ == Stdout::kNone) continue;
-    Head(catalogue_[i], stdout_ == Stdout::kJson, &line_);
-    line_ += stdout_ == Stdout::kJson ? "\"lost\":true}\n"
-                                      : "LOST events may have been lost (inotify queue overflow)\n";
-    fwrite(line_.data(), 1, line_.size(), stdout);
+    for (const std::string& tree : log->trees) {
+      Head(catalogue_[i], stdout_ == Stdout::kJson, &line_);
+      if (stdout_ == Stdout::kJson) {
+        AppendJsonField(&line_, "rescan", tree);
+        line_ += "}\n";
+      } else {
+        line_ += "RESCAN " + Printable(tree) + " (inotify queue overflow)\n";
+      }
+      fwrite(line_.data(), 1, line_.size(), stdout);
+    }
   }
 }
 

@@ -28,9 +28,9 @@ enum class Stdout { kNone, kText, kJson };
 // asking a MonitorQueueIndex which they are.  With standard output on,
 // also writes one line per queue (buffered: the caller flushes):
 //   text:  queue NAME [TYPE/FILE]: IN_CREATE|IN_ISDIR PATH
-//          queue NAME [TYPE/FILE]: LOST events may have been lost ...
+//          queue NAME [TYPE/FILE]: RESCAN TREE ...
 //   JSON:  {"queue":..,"type":..,"file":..,"path":..,"mask":..}
-//          {"queue":..,"type":..,"file":..,"lost":true}
+//          {"queue":..,"type":..,"file":..,"rescan":TREE}
 // with control bytes escaped (\xNN in text; as JSON does).
 class Reporter : public EventSink {
  public:
@@ -56,7 +56,8 @@ class Reporter : public EventSink {
   // that mask that the queue's matching configurations ask for (and
   // IN_ISDIR for a directory).
   void Found(const std::string& path, bool is_dir) override;
-  // A "lost" record for every queue of the catalogue.
+  // After a kernel queue overflow: a rescan record for each tree of every
+  // queue of the catalogue.
   void Lost() override;
   // A record with "offline":true for each queue that wants some kind of
   // |mask| on |path|, with the kinds it wants (and IN_ISDIR as given).

@@ -28,6 +28,11 @@ namespace {
 
 using zorvcommon::Quoted;
 
+// How much a client behind the records kept in memory reads of a journal
+// at a time: what its buffer takes in a turn of the loop, never the whole
+// journal.
+constexpr size_t kJournalRead = 64 * 1024;
+
 // A request line longer than this is refused and the client let go.
 constexpr size_t kMaxRequest = 64 * 1024;
 
@@ -79,6 +84,9 @@ struct Server::Client {
   std::string out;
   size_t sent = 0;
   std::map<QueueLog*, uint64_t> next;  // the next record to deliver of each followed queue
+  // Records read from a journal, for a queue whose next record is no
+  // longer in memory.
+  std::map<QueueLog*, std::deque<JournalRecord>> read;
   std::vector<Subscription> subscriptions;
   bool closing = false;   // let go once the output is written
   bool behind = false;    // records wait in the logs: Fill delivers them in order
@@ -427,6 +435,8 @@ void Server::Request(Client& client, const std::string& line) {
     client.out += "{\"reply\":\"status\",";
     AppendJsonField(&client.out, "run", run_id_);
     client.out += ',';
+    AppendJsonField(&client.out, "journal", logs_.journal_id());
+    client.out += ',';
     AppendJsonNumber(&client.out, "clients", clients_.size());
     client.out += ',';
     AppendJsonNumber(&client.out, "max_clients", options_.max_clients);
@@ -491,6 +501,8 @@ void Server::Subscribe(Client& client, const Subscription& subscription, bool ha
   *reply = "{\"reply\":\"subscribe\",";
   AppendJsonField(reply, "run", run_id_);
   *reply += ',';
+  AppendJsonField(reply, "journal", logs_.journal_id());
+  *reply += ',';
   AppendJsonField(reply, "queue", subscription.name);
   *reply += ",\"queues\":[";
   bool first = true;
@@ -507,7 +519,7 @@ void Server::Subscribe(Client& client, const Subscription& subscription, bool ha
     AppendJsonNumber(reply, "seq", log->last_seq());
     *reply += '}';
     // From after |since| (a number beyond the last record comes from
-    // another run of the daemon: everything kept), or from now on.
+    // another journal: everything kept), or from now on.
     const uint64_t after = !has_since ? log->last_seq() : since > log->last_seq() ? 0 : since;
     const auto known = client.next.find(log);
     if (known == client.next.end()) {
@@ -548,13 +560,26 @@ void Server::Fill(Client& client) {
     for (auto& [log, next] : client.next) {
       if (next > log->last_seq()) continue;
       if (next < log->first_seq()) {
-        // Records the client did not take in time are gone: say how many.
-        client.out += log->head();
-        AppendJsonNumber(&client.out, "missed", log->first_seq() - next);
-        client.out += "}\n";
-        next = log->first_seq();
+        // Before the records in memory: from the journal, a stretch at a
+        // time.
+        std::deque<JournalRecord>& read = client.read[log];
+        while (!read.empty() && read.front().seq < next) read.pop_front();
+        if (read.empty()) log->ReadJournal(next, kJournalRead, &read);
+        const uint64_t kept =
+            read.empty() ? log->first_seq() : std::min(read.front().seq, log->first_seq());
+        // Numbers never given to a record are passed over without a word.
+        next = std::min(log->Given(next), kept);
+        if (next < kept) {
+          // Records no longer kept are gone: say how many.
+          client.out += log->head();
+          AppendJsonNumber(&client.out, "missed", kept - next);
+          client.out += "}\n";
+          next = kept;
+        }
+        if (next >= log->first_seq()) client.read.erase(log);
       }
-      const uint64_t order = log->at(next).order;
+      const uint64_t order =
+          next < log->first_seq() ? client.read[log].front().order : log->at(next).order;
       if (best == nullptr || order < best_order) {
         best = log;
         best_order = order;
@@ -564,7 +589,15 @@ void Server::Fill(Client& client) {
       client.behind = false;
       return;
     }
-    client.out += best->at(client.next[best]++).line;
+    uint64_t& next = client.next[best];
+    if (next < best->first_seq()) {
+      std::deque<JournalRecord>& read = client.read[best];
+      client.out += read.front().line;
+      read.pop_front();
+    } else {
+      client.out += best->at(next).line;
+    }
+    ++next;
   }
   client.behind = true;
 }
@@ -603,6 +636,8 @@ void Server::Follow(Client& client, QueueLog* log, uint64_t next) {
 }
 
 bool Server::Write(Client& client) {
+  // Nothing reaches a client before its journal holds it.
+  logs_.BeforeSend();
   while (client.sent < client.out.size()) {
     const ssize_t n = send(client.fd.get(), client.out.data() + client.sent,
                            client.out.size() - client.sent, MSG_NOSIGNAL | MSG_DONTWAIT);
@@ -658,6 +693,7 @@ void Server::Drop(Client& client) {
     }
     logs_.Unfollow(log);
   }
+  client.read.clear();
   if (client.dirty) dirty_.erase(std::find(dirty_.begin(), dirty_.end(), &client));
   clients_.erase(client.self);  // closing the descriptor takes it out of epoll
   // Its descriptor is free again.

@@ -33,8 +33,10 @@ struct ServerOptions {
 
 class Server {
  public:
-  // |logs| holds the records; |status| makes the reply to a status request
-  // (a JSON object's members, without braces).
+  // |logs| holds the records and the journal id; |run_id| changes at each
+  // start, the journal id only when the journals were lost or reset (both
+  // go in every reply); |status| makes the rest of the reply to a status
+  // request (a JSON object's members, without braces).
   Server(ServerOptions options, QueueLogs& logs, std::string run_id,
          std::function<std::string()> status);
   ~Server();

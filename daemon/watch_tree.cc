@@ -87,6 +87,8 @@ void WatchTree::Sync(const std::vector<std::string>& roots,
                      const ZORV::ZORVNOTIFYD::MonitorQueueIndex& index) {
   const HomeAtReturn home(*this);
   Relist();  // while the directories marked are still watched
+  reloading_ = synced_;
+  synced_ = true;
   roots_ = std::set<std::string, std::less<>>(roots.begin(), roots.end());
   index_ = index;
   std::set<int> synced;
@@ -148,6 +150,7 @@ void WatchTree::Sync(const std::vector<std::string>& roots,
     if (told.count(top) != 0) unwatched_tops_.insert(top);
   }
   NoteUnwatched(std::vector<std::string>(tops.begin(), tops.end()));
+  reloading_ = false;
 }
 
 void WatchTree::NoteUnwatched(const std::vector<std::string>& tops) {
@@ -380,6 +383,9 @@ bool WatchTree::WatchRootTree(const std::string& root, WalkContext& context, std
     }
     return true;
   }
+  // A tree of a queue registered while the daemon runs starts from now,
+  // as its queue does.
+  if (known == Snapshot::Known::kNone && reloading_) return true;
   sink_->Rescan(root);
   return true;
 }

@@ -238,6 +238,8 @@ class WatchTree {
   Snapshot* snapshot_ = nullptr;
   EventSink* sink_ = nullptr;             // where comparisons and rescans go
   std::set<std::string> unwatched_tops_;  // told to rescan, over the watch limit
+  bool synced_ = false;                   // Sync ran before
+  bool reloading_ = false;                // within a Sync that is not the first
   double retry_seconds_;
 };
 

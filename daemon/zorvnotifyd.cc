@@ -10,7 +10,6 @@
 #include <poll.h>
 #include <signal.h>
 #include <string.h>
-#include <sys/random.h>
 #include <sys/resource.h>
 #include <sys/signalfd.h>
 #include <syslog.h>
@@ -24,6 +23,7 @@
 #include <string>
 
 #include "catalogue.h"
+#include "journal_dir.h"
 #include "json_writer.h"
 #include "notify.h"
 #include "queue_log.h"
@@ -31,6 +31,7 @@
 #include "server.h"
 #include "snapshot.h"
 #include "state_dir.h"
+#include "sync_timer.h"
 #include "text.h"
 #include "unique_fd.h"
 #include "watch_tree.h"
@@ -50,8 +51,12 @@ const char kUsage[] =
     "  --state-dir DIR       what is kept across restarts (default /var/lib/zorvnotifyd),\n"
     "                        a directory of root's that only root may write\n"
     "  --group GROUP         members of GROUP may connect too (default: root only)\n"
-    "  --keep N              events kept per queue for clients that reconnect\n"
-    "                        (default 100)\n"
+    "  --keep N              records kept in memory per queue (default 100); older\n"
+    "                        ones are read back from the queue's journal\n"
+    "  --journal-size BYTES  journal kept per queue (default 8388608: the last 4 to\n"
+    "                        8 MiB of records; 0: none, records in memory only)\n"
+    "  --sync-interval MS    records reach the disk at most this long after they\n"
+    "                        are written (default 100)\n"
     "  --client-buffer BYTES output a client may have waiting (default 262144)\n"
     "  --max-clients N       clients served at once (default 1000)\n"
     "  --stdout              also write one line per queue and event on standard output\n"
@@ -66,10 +71,6 @@ const char kUsage[] =
     "and stops on SIGTERM or SIGINT (status 0).  Log lines go to syslog and to standard error.\n";
 
 constexpr double kDefaultRetrySeconds = 5;
-
-// How long after a change the snapshot of the trees is saved: changes are
-// saved in groups, never one write and sync per event.
-constexpr int64_t kSnapshotSaveMs = 100;
 
 // Descriptors kept from the clients for everything else: about 16 that the
 // daemon holds or opens for a moment (standard streams, syslog, the
@@ -130,23 +131,6 @@ UniqueFd OpenSignals() {
   return fd;
 }
 
-// A random id of this run of the daemon, 32 hexadecimal digits: clients
-// tell by it that sequence numbers from an earlier run no longer apply.
-std::string RunId() {
-  unsigned char bytes[16] = {};
-  if (getrandom(bytes, sizeof(bytes), 0) != ssize_t(sizeof(bytes))) {
-    const uint64_t seed = uint64_t(NowMs()) ^ (uint64_t(getpid()) << 32);
-    memcpy(bytes, &seed, sizeof(seed));
-  }
-  std::string id;
-  char digits[3];
-  for (unsigned char byte : bytes) {
-    snprintf(digits, sizeof(digits), "%02x", byte);
-    id += digits;
-  }
-  return id;
-}
-
 // READY=1 with the status line the service manager shows for the daemon.
 std::string ReadyState(size_t directories, size_t queues) {
   return "READY=1\nSTATUS=watching " + std::to_string(directories) + " directories for " +
@@ -159,6 +143,8 @@ struct Options {
   double retry_seconds = kDefaultRetrySeconds;
   size_t keep = 100;
   std::string state_dir = kDefaultStateDir;
+  uint64_t journal_size = 8 << 20;
+  int64_t sync_interval_ms = 100;
 };
 
 // Serves events until a stop signal (returns 0) or a fatal error (1).
@@ -169,8 +155,18 @@ int Serve(const Options& options) {
   if (signals.get() < 0 || inotify.get() < 0 || !catalogue_watch.Open()) return 1;
   StateDir state;
   if (!state.Open(options.state_dir)) return 1;
+  JournalDir journals;
+  // --journal-size 0: records in memory only, a new journal id each start.
+  const bool journaling = options.journal_size > 0 ? journals.Open(state) : false;
   CatalogueLoader loader;
   QueueLogs logs(options.keep);
+  logs.set_journal_id(journals.id().empty() ? RandomId() : journals.id());
+  if (journaling) {
+    logs.UseJournals(journals.fd(), options.journal_size, BootId(),
+                     [&journals] { return journals.Renew(); });
+  }
+  SyncTimer sync(options.sync_interval_ms);
+  sync.Join([&logs] { logs.Sync(); });
   Reporter reporter(logs, options.out);
   WatchTree tree(std::move(inotify), options.retry_seconds);
   std::string reason;
@@ -181,7 +177,10 @@ int Serve(const Options& options) {
   }
   Snapshot snapshot(std::move(snapshot_dir));
   tree.UseSnapshot(&snapshot, &reporter);
-  Server server(options.server, logs, RunId(), [&] {
+  // After the journals: a change is in the snapshot only once the records
+  // that told it are durable.
+  sync.Join([&tree] { tree.SaveSnapshot(); });
+  Server server(options.server, logs, RandomId(), [&] {
     std::string status;
     AppendJsonNumber(&status, "directories", tree.size());
     status += ',';
@@ -194,10 +193,18 @@ int Serve(const Options& options) {
     AppendJsonNumber(&status, "trees_missing", tree.missing());
     status += ',';
     AppendJsonNumber(&status, "directories_over_watch_limit", tree.over_limit());
+    status += ',';
+    AppendJsonField(&status, "state",
+                    !journaling       ? "no journal"
+                    : logs.degraded() ? "degraded"
+                                      : "ok");
+    status += ',';
+    logs.AppendStatus(&status);
     return status;
   });
   if (!server.Listen()) return 1;
   reporter.OnRecord([&server](QueueLog* log) { server.Recorded(log); });
+  logs.OnRecord([&server](QueueLog* log) { server.Recorded(log); });
   // Reads the catalogue, and makes the records, the watches and the
   // clients' subscriptions follow it.
   auto load = [&] {
@@ -209,7 +216,7 @@ int Serve(const Options& options) {
     server.FollowNew(created);
   };
   load();
-  int64_t save_due = NowMs() + kSnapshotSaveMs;  // the views of the trees walked
+  sync.Wrote(NowMs());  // the views of the trees walked
   syslog(LOG_INFO, "ready: watching %zu directories for %zu queues", tree.size(), reporter.size());
   NotifyServiceManager(ReadyState(tree.size(), reporter.size()));
   const int64_t retry_ms = std::max<int64_t>(1, int64_t(options.retry_seconds * 1000));
@@ -221,7 +228,7 @@ int Serve(const Options& options) {
   for (;;) {
     // Trees that went away, were replaced or did not fit under the watch
     // limit are looked at again on a fixed period, whatever the load.
-    const int64_t wake = save_due < 0 ? next_tick : std::min(next_tick, save_due);
+    const int64_t wake = sync.due() >= 0 ? std::min(next_tick, sync.due()) : next_tick;
     const int ready = poll(fds, 4, int(std::max<int64_t>(0, wake - NowMs())));
     if (ready < 0 && errno != EINTR) {
       syslog(LOG_ERR, "poll failed: %s", strerror(errno));
@@ -239,13 +246,17 @@ int Serve(const Options& options) {
       NotifyServiceManager("STOPPING=1");
       syslog(LOG_INFO, "stopping on %s: releasing %zu watches", strsignal(int(info.ssi_signo)),
              tree.size());
-      tree.SaveSnapshot();
+      // The snapshot is saved with the last sync, while the watches still
+      // tell which directories are the ones watched.
+      logs.WriteOut();
+      sync.Run(NowMs());
       tree.Clear();
+      logs.Close();
       return 0;
     }
     if (ready > 0 && (fds[1].revents & POLLIN)) {
       if (!tree.ReadEvents(reporter)) return 1;
-      if (save_due < 0) save_due = NowMs() + kSnapshotSaveMs;
+      sync.Wrote(NowMs());  // the directories the events marked
     }
     // A configuration directory that was missing (a read-only /usr) and
     // exists now is read as soon as the next tick finds it.
@@ -254,7 +265,7 @@ int Serve(const Options& options) {
     if (hangup || changed || (tick && catalogue_watch.WatchMissing())) {
       NotifyServiceManager("RELOADING=1");
       load();
-      if (save_due < 0) save_due = NowMs() + kSnapshotSaveMs;
+      sync.Wrote(NowMs());
       syslog(LOG_INFO, "catalogue reloaded: watching %zu directories for %zu queues", tree.size(),
              reporter.size());
       NotifyServiceManager(ReadyState(tree.size(), reporter.size()));
@@ -264,13 +275,16 @@ int Serve(const Options& options) {
       tree.Tick(reporter);
       server.Tick(options.retry_seconds);
       next_tick = NowMs() + retry_ms;
-      if (save_due < 0) save_due = NowMs() + kSnapshotSaveMs;
-    }
-    if (save_due >= 0 && NowMs() >= save_due) {
-      tree.SaveSnapshot();
-      save_due = -1;
+      sync.Wrote(NowMs());  // a tree that came back was compared
     }
     server.Deliver();
+    // The journals' records of this turn, one write each, synced in groups;
+    // a journal written again after a failure gives its queue rescan
+    // records.
+    logs.WriteOut();
+    if (logs.unsynced()) sync.Wrote(NowMs());
+    if (logs.Settle()) server.Deliver();
+    sync.RunIfDue(NowMs());
     if (options.out != Stdout::kNone && (fflush(stdout) != 0 || ferror(stdout))) {
       syslog(LOG_ERR, "cannot write the report to standard output: stopping");
       tree.Clear();
@@ -321,6 +335,14 @@ int ParseOptions(int argc, char** argv, Options* options) {
       options->server.group = group != nullptr ? group->gr_gid : gid_t(number);
     } else if (arg == "--keep" && value != nullptr && ParseCount(value, 1, 1000000, &number)) {
       options->keep = size_t(number);
+      ++i;
+    } else if (arg == "--journal-size" && value != nullptr &&
+               ParseCount(value, 0, 1ull << 40, &number) && (number == 0 || number >= 65536)) {
+      options->journal_size = number;
+      ++i;
+    } else if (arg == "--sync-interval" && value != nullptr &&
+               ParseCount(value, 1, 3600000, &number)) {
+      options->sync_interval_ms = int64_t(number);
       ++i;
     } else if (arg == "--client-buffer" && value != nullptr &&
                ParseCount(value, 1024, 1ull << 30, &number)) {

@@ -69,13 +69,15 @@ class Daemon : public zorv_test::ChildProcess {
                   const char* socket = kSocket)
       : ChildProcess(WithSocket(std::move(args), socket), in_child) {}
   // The next line of standard output ("" on a timeout or at the end),
-  // leaving out rescan records: every tree gets one at the first start on
-  // a fresh state directory (SnapshotTest checks them).
+  // leaving out the rescan records that come before the first other line:
+  // every tree gets one at the first start on a fresh state directory
+  // (ReportsWhatChangedWhileItWasStopped checks them).
   std::string Read() {
     for (;;) {
       std::string line = ChildProcess::Read();
-      if (line.find("\"rescan\":") == std::string::npos &&
-          line.find("]: RESCAN /") == std::string::npos) {
+      if (started_ || (line.find("\"rescan\":") == std::string::npos &&
+                       line.find("]: RESCAN /") == std::string::npos)) {
+        started_ = true;
         return line;
       }
     }
@@ -89,16 +91,18 @@ class Daemon : public zorv_test::ChildProcess {
            std::filesystem::current_path();
   }
   // Reads JSON lines, each as "queue path mask" ("queue lost" for a lost
-  // notice), until one equal to |last|; every line read, |last| included.
-  // Stops early (the result then lacks |last|) on a timeout.
+  // notice, "queue rescan PATH" for a rescan record), until one equal to |last|; every line read,
+  // |last| included. Stops early (the result then lacks |last|) on a timeout.
   Lines ReadUntil(const std::string& last) {
     Lines lines;
     for (std::string text; (lines.empty() || lines.back() != last) && !(text = Read()).empty();) {
       const Json::Value v = ParseJson(text);
       lines.push_back(!v.isObject()        ? text
                       : v.isMember("lost") ? v["queue"].asString() + " lost"
-                                           : v["queue"].asString() + " " + v["path"].asString() +
-                                                 " " + std::to_string(v["mask"].asUInt()));
+                      : v.isMember("rescan")
+                          ? v["queue"].asString() + " rescan " + v["rescan"].asString()
+                          : v["queue"].asString() + " " + v["path"].asString() + " " +
+                                std::to_string(v["mask"].asUInt()));
     }
     return lines;
   }
@@ -125,6 +129,7 @@ class Daemon : public zorv_test::ChildProcess {
   }
 
  private:
+  bool started_ = false;  // a line other than a rescan record came
   static Lines WithSocket(Lines args, const char* socket) {
     if (socket != nullptr) args.insert(args.begin(), {"--socket", socket});
     args.insert(args.begin(), ZORVNOTIFYD_PATH);
@@ -465,7 +470,8 @@ TEST_F(DaemonTest, ServesWhatFitsUnderTheWatchLimitAndSaysWhenEventsWereLost) {
             0);
   EXPECT_EQ(
       daemon.ReadUntil("big /tmp/big/12/13/g 256"),
-      Lines({"big /tmp/big/0/1/2/g 256", "big /tmp/big/3/4/5/6/g 256", "big /tmp/big/7/8/9/g 256",
+      Lines({"big rescan /tmp/big/12/13", "big rescan /tmp/big/3", "big rescan /tmp/big/7",
+             "big /tmp/big/0/1/2/g 256", "big /tmp/big/3/4/5/6/g 256", "big /tmp/big/7/8/9/g 256",
              "big /tmp/big/10/g 256", "big /tmp/big/11/g 256", "big /tmp/big/12/13/g 256"}));
 
   // More events than the kernel queues while the daemon is stopped.
@@ -477,7 +483,8 @@ TEST_F(DaemonTest, ServesWhatFitsUnderTheWatchLimitAndSaysWhenEventsWereLost) {
     close(open(("/tmp/big/10/n" + std::to_string(i)).c_str(), O_CREAT | O_WRONLY, 0644));
   }
   ASSERT_EQ(kill(daemon.pid(), SIGCONT), 0);
-  EXPECT_TRUE(daemon.Heard("big lost"));
+  // The queue is told which tree to rescan, in place of a bare "lost".
+  EXPECT_TRUE(daemon.Heard("big rescan /tmp/big"));
   EXPECT_TRUE(daemon.Logged("inotify event queue overflowed, events were lost"));
   ASSERT_TRUE(Put("/tmp/big/10/after", "x"));
   EXPECT_TRUE(daemon.Heard("big /tmp/big/10/after 256"));
@@ -512,7 +519,7 @@ class Client {
     return v;
   }
   // The next line as "queue seq path" ("queue seq KEY" for a notice,
-  // "queue missed N"), "" when none came.
+  // "queue seq rescan PATH", "queue missed N"), "" when none came.
   std::string Line() {
     const Json::Value v = Next();
     if (!v.isObject()) return "";
@@ -522,6 +529,7 @@ class Client {
     for (const char* notice : {"lost", "removed", "registered"}) {
       if (v.isMember(notice)) return line + " " + notice;
     }
+    if (v.isMember("rescan")) return line + " rescan " + v["rescan"].asString();
     return line + " " + v["path"].asString();
   }
 
@@ -546,7 +554,7 @@ TEST_F(DaemonTest, DeliversEachQueueItsEventsToItsSubscribers) {
   ASSERT_EQ(std::system("rm -rf /tmp/s && mkdir -p /tmp/s/a /tmp/s/b"), 0);
   Register("a", "/tmp/s/a", kCreate);
   Register("b", "/tmp/s/b", kCreate);
-  Daemon daemon({"--keep", "5", "--client-buffer", "1024"});
+  Daemon daemon({"--keep", "5", "--client-buffer", "1024", "--journal-size", "65536"});
   ASSERT_TRUE(daemon.Logged("ready: watching 2 directories for 2 queues"));
   Client b, sleeper;
   Client* a = new Client;
@@ -573,16 +581,16 @@ TEST_F(DaemonTest, DeliversEachQueueItsEventsToItsSubscribers) {
   for (int i = 21; i <= kFiles; ++i) ASSERT_TRUE(Put(name + std::to_string(i), "x"));
   ASSERT_TRUE(Put("/tmp/s/b/x", "x"));
   EXPECT_EQ(b.Line(), "b 2 /tmp/s/b/x");
-  // What the sleeper's buffer could not hold is counted.
+  // What the sleeper's buffer could not hold, nor the journal, is counted.
   std::string line;
   for (int i = 0; i <= kFiles && (line = sleeper.Line()).find("missed") == std::string::npos;) ++i;
   EXPECT_EQ(line.find("a missed "), 0u) << line;
 
-  // Back with "since": what was kept, after a count of what was not.
+  // Back with "since": the 5 records before those in memory from the
+  // journal, then those in memory.
   Client again;
-  Subscribe(again, "a", kFiles - 9);
-  EXPECT_EQ(again.Line(), "a missed 5");
-  for (int seq = kFiles - 3; seq <= kFiles + 1; ++seq) {
+  Subscribe(again, "a", kFiles - 10);
+  for (int seq = kFiles - 9; seq <= kFiles + 1; ++seq) {
     EXPECT_EQ(again.Line(), "a " + std::to_string(seq) + " " + name + std::to_string(seq - 1));
   }
 
@@ -614,6 +622,19 @@ TEST_F(DaemonTest, DeliversEachQueueItsEventsToItsSubscribers) {
   EXPECT_EQ(std::vector<Json::Value>({v["queues"], v["clients"], v["directories"]}),
             std::vector<Json::Value>({2, 4, 2}));
   EXPECT_EQ(daemon.Stop(SIGTERM), 0);
+
+  // Started again, with nothing in memory: the same records from the
+  // journal's files, which took turns many times, then new ones.
+  Daemon restarted({"--keep", "5", "--journal-size", "65536"});
+  ASSERT_TRUE(restarted.Logged("ready:"));
+  Client back;
+  Subscribe(back, "a", kFiles - 10);
+  for (int seq = kFiles - 9; seq <= kFiles + 1; ++seq) {
+    EXPECT_EQ(back.Line(), "a " + std::to_string(seq) + " " + name + std::to_string(seq - 1));
+  }
+  ASSERT_TRUE(Put("/tmp/s/a/last", "x"));
+  EXPECT_EQ(back.Line(), "a " + std::to_string(kFiles + 2) + " /tmp/s/a/last");
+  EXPECT_EQ(restarted.Stop(SIGTERM), 0);
 }
 
 // The daemon's CPU time so far, in clock ticks (-1 when unknown).
@@ -852,8 +873,9 @@ std::string Record(Client& client) {
 }
 
 // What is done to a tree while the daemon is stopped (cleanly, or killed)
-// reaches a client once, as offline records; a snapshot that cannot be
-// trusted gives a rescan record instead.
+// reaches a client that resumes with "since" once, as offline records
+// numbered after its last one, under the same journal id; a snapshot that
+// cannot be trusted gives a rescan record instead.
 TEST_F(DaemonTest, ReportsWhatChangedWhileItWasStopped) {
   ASSERT_EQ(std::system("rm -rf /tmp/o && mkdir -p /tmp/o/d /tmp/o/d2/inner /tmp/o/gone && "
                         "cd /tmp/o && touch del f mv same gone/x"),
@@ -861,16 +883,20 @@ TEST_F(DaemonTest, ReportsWhatChangedWhileItWasStopped) {
   constexpr unsigned kAll =
       IN_CREATE | IN_MODIFY | IN_CLOSE_WRITE | IN_DELETE | IN_MOVED_FROM | IN_MOVED_TO;
   Register("o", "/tmp/o", kAll);
-  // Each run: the records a client resuming from the start gets until one
-  // ending in |last|; |log| is a line the daemon must log first; with |out|
-  // the daemon is left running there.
-  auto run = [](const std::string& last, const std::string& log = "",
-                std::unique_ptr<Daemon>* out = nullptr) {
+  // Each run: the records after |seq| until one ending in |last|, |seq|
+  // moved to the last one; |log| is a line the daemon must log first;
+  // with |out| the daemon is left running there.
+  std::string journal;
+  int seq = 0;
+  auto run = [&journal, &seq](const std::string& last, const std::string& log = "",
+                              std::unique_ptr<Daemon>* out = nullptr) {
     auto daemon = std::make_unique<Daemon>(Lines{"--retry", "0.05"});
     EXPECT_TRUE(log.empty() || daemon->Logged(log)) << log;
     EXPECT_TRUE(daemon->Logged("ready: watching"));
     Client client;
-    Subscribe(client, "o", 0);
+    const std::string id = Subscribe(client, "o", seq)["journal"].asString();
+    EXPECT_EQ(id, journal.empty() ? id : journal);
+    journal = id;
     Lines got;
     const auto ends = [&last](const std::string& text) {
       return text.empty() || (text.size() >= last.size() &&
@@ -879,6 +905,7 @@ TEST_F(DaemonTest, ReportsWhatChangedWhileItWasStopped) {
     do {
       got.push_back(Record(client));
     } while (!ends(got.back()));
+    seq = std::atoi(got.back().c_str());
     if (out != nullptr) {
       *out = std::move(daemon);
     } else {
@@ -894,32 +921,36 @@ TEST_F(DaemonTest, ReportsWhatChangedWhileItWasStopped) {
   ASSERT_EQ(std::system("cd /tmp/o && touch new && echo x >> f && rm del gone/x && rmdir gone && "
                         "mv mv d/moved && mv d2 d3 && mkdir newdir"),
             0);
-  const auto line = [](int seq, const std::string& path, unsigned mask) {
-    return std::to_string(seq) + " /tmp/o/" + path + " " + std::to_string(mask) + " offline";
+  const auto line = [](int number, const std::string& path, unsigned mask) {
+    return std::to_string(number) + " /tmp/o/" + path + " " + std::to_string(mask) + " offline";
   };
   std::unique_ptr<Daemon> daemon;
   EXPECT_EQ(run("/tmp/o/gone/x 512 offline", "", &daemon),
-            Lines({line(1, "d2", IN_MOVED_FROM | IN_ISDIR), line(2, "d3", IN_MOVED_TO | IN_ISDIR),
-                   line(3, "del", IN_DELETE), line(4, "f", IN_MODIFY | IN_CLOSE_WRITE),
-                   line(5, "gone", IN_DELETE | IN_ISDIR), line(6, "mv", IN_MOVED_FROM),
-                   line(7, "d/moved", IN_MOVED_TO), line(8, "new", IN_CREATE),
-                   line(9, "newdir", IN_CREATE | IN_ISDIR), line(10, "gone/x", IN_DELETE)}));
+            Lines({line(2, "d2", IN_MOVED_FROM | IN_ISDIR), line(3, "d3", IN_MOVED_TO | IN_ISDIR),
+                   line(4, "del", IN_DELETE), line(5, "f", IN_MODIFY | IN_CLOSE_WRITE),
+                   line(6, "gone", IN_DELETE | IN_ISDIR), line(7, "mv", IN_MOVED_FROM),
+                   line(8, "d/moved", IN_MOVED_TO), line(9, "new", IN_CREATE),
+                   line(10, "newdir", IN_CREATE | IN_ISDIR), line(11, "gone/x", IN_DELETE)}));
 
   // Killed right after an event, before its directory is saved (the view
-  // taken at start is, after the group save's delay): the comparison finds
-  // it again (perhaps twice), and what came after.
+  // taken at start is, after the group sync): the event is in the
+  // journal, the comparison finds it again (perhaps twice), and what came
+  // after.
   usleep(300 * 1000);
   Client live;
   Subscribe(live, "o");
   ASSERT_EQ(std::system("touch /tmp/o/k1"), 0);
-  EXPECT_EQ(Record(live), "11 /tmp/o/k1 256");
+  EXPECT_EQ(Record(live), "12 /tmp/o/k1 256");
   EXPECT_EQ(daemon->Stop(SIGKILL), -1);
   ASSERT_EQ(std::system("touch /tmp/o/k2"), 0);
   const Lines after_kill = run("/tmp/o/k2 256 offline");
   ASSERT_FALSE(after_kill.empty());
   EXPECT_EQ(after_kill.back().substr(after_kill.back().find(' ')), " /tmp/o/k2 256 offline");
-  for (size_t i = 0; i + 1 < after_kill.size(); ++i) {
-    EXPECT_EQ(after_kill[i].substr(after_kill[i].find(' ')), " /tmp/o/k1 256 offline");
+  for (size_t i = 0; i < after_kill.size(); ++i) {
+    EXPECT_EQ(std::atoi(after_kill[i].c_str()), int(12 + i)) << after_kill[i];
+    if (i + 1 < after_kill.size()) {
+      EXPECT_NE(after_kill[i].find(" /tmp/o/k1 "), std::string::npos);
+    }
   }
 
   // A snapshot that cannot be trusted is logged, answered with a rescan
@@ -938,19 +969,194 @@ TEST_F(DaemonTest, ReportsWhatChangedWhileItWasStopped) {
            {"chown 65534 $F", "not root's alone"}}) {
     std::string command = "set -e; F=" + file + "; " + spoil;
     ASSERT_EQ(std::system(command.c_str()), 0) << spoil;
-    EXPECT_EQ(run("1 rescan /tmp/o", unusable + why + "): starting it afresh"),
-              Lines({"1 rescan /tmp/o"}))
-        << why;
+    const std::string rescan = std::to_string(seq + 1) + " rescan /tmp/o";
+    EXPECT_EQ(run(rescan, unusable + why + "): starting it afresh"), Lines({rescan})) << why;
   }
 
   // A tree removed and made again while stopped: all it held is gone.
   ASSERT_EQ(std::system("rm -r /tmp/o && mkdir /tmp/o && touch /tmp/o/again"), 0);
+  const int n = seq;
   EXPECT_EQ(run("/tmp/o/d3/inner 1073742336 offline"),
-            Lines({line(1, "again", IN_CREATE), line(2, "d", IN_DELETE | IN_ISDIR),
-                   line(3, "d3", IN_DELETE | IN_ISDIR), line(4, "f", IN_DELETE),
-                   line(5, "k1", IN_DELETE), line(6, "k2", IN_DELETE), line(7, "new", IN_DELETE),
-                   line(8, "newdir", IN_DELETE | IN_ISDIR), line(9, "same", IN_DELETE),
-                   line(10, "d/moved", IN_DELETE), line(11, "d3/inner", IN_DELETE | IN_ISDIR)}));
+            Lines({line(n + 1, "again", IN_CREATE), line(n + 2, "d", IN_DELETE | IN_ISDIR),
+                   line(n + 3, "d3", IN_DELETE | IN_ISDIR), line(n + 4, "f", IN_DELETE),
+                   line(n + 5, "k1", IN_DELETE), line(n + 6, "k2", IN_DELETE),
+                   line(n + 7, "new", IN_DELETE), line(n + 8, "newdir", IN_DELETE | IN_ISDIR),
+                   line(n + 9, "same", IN_DELETE), line(n + 10, "d/moved", IN_DELETE),
+                   line(n + 11, "d3/inner", IN_DELETE | IN_ISDIR)}));
+}
+
+// The status reply of the daemon on the default socket.
+Json::Value Status() {
+  Client client;
+  EXPECT_TRUE(client.Send("{\"request\":\"status\"}"));
+  return client.Next();
+}
+
+// Each queue's records outlive the daemon: stopped, killed in the middle
+// of a burst, restarted, the numbering goes on under the same journal id,
+// and a client that comes back with "since" gets each record once, in
+// order.  A journal cut short, garbage, a FIFO or a link in its place, or
+// its id removed, is told: rescan records, a new id, never a crash, a hang
+// or a silent gap.
+TEST_F(DaemonTest, KeepsEachQueuesRecordsAcrossRestarts) {
+  ASSERT_EQ(std::system("rm -rf /tmp/j && mkdir /tmp/j"), 0);
+  Register("j", "/tmp/j", kCreate);
+  std::string journal;
+  {
+    Daemon daemon(Lines{});
+    ASSERT_TRUE(daemon.Logged("ready:"));
+    Client client;
+    journal = Subscribe(client, "j")["journal"].asString();
+    EXPECT_EQ(journal.size(), 32u);
+    ASSERT_TRUE(Put("/tmp/j/1", "x") && Put("/tmp/j/2", "x"));
+    EXPECT_EQ(client.Line(), "j 2 /tmp/j/1");  // after the first start's rescan record
+    EXPECT_EQ(client.Line(), "j 3 /tmp/j/2");
+    EXPECT_EQ(daemon.Stop(SIGTERM), 0);
+  }
+  // 20,000 records while a client reads none, and kill -9 once the daemon
+  // has read them all, in the middle of its delivery.
+  constexpr int kAway = 20000;
+  int last = 0;  // the number of the record of /tmp/j/after
+  {
+    Daemon daemon(Lines{});
+    ASSERT_TRUE(daemon.Logged("ready:"));
+    Client sleeper;
+    Subscribe(sleeper, "j");
+    for (int i = 3; i < kAway + 3; ++i) {
+      ASSERT_EQ(close(open(("/tmp/j/" + std::to_string(i)).c_str(), O_CREAT | O_WRONLY, 0644)), 0);
+    }
+    for (int tries = 0; tries < 1000 && Status()["events"].asInt() < kAway; ++tries) usleep(10000);
+    EXPECT_EQ(daemon.Stop(SIGKILL), -1);
+  }
+  {
+    Daemon daemon(Lines{});
+    ASSERT_TRUE(daemon.Logged("ready:"));
+    Client client;
+    const Json::Value reply = Subscribe(client, "j", 3);
+    EXPECT_EQ(reply["journal"], journal);
+    EXPECT_GE(reply["queues"][0]["seq"], kAway + 3);
+    for (int seq = 4; seq < kAway + 4; ++seq) {
+      const std::string line = client.Line();
+      if (line != "j " + std::to_string(seq) + " /tmp/j/" + std::to_string(seq - 1)) {
+        FAIL() << "record " << seq << ": " << line;
+      }
+    }
+    // Files of the burst not yet in the snapshot at the kill are found
+    // again by the start-up comparison.
+    ASSERT_TRUE(Put("/tmp/j/after", "x"));
+    last = kAway + 4;
+    std::string line;
+    while (!(line = client.Line()).empty() && line.find("/tmp/j/after") == std::string::npos) {
+      EXPECT_EQ(line.rfind("j " + std::to_string(last++) + " /tmp/j/", 0), 0u) << line;
+    }
+    EXPECT_EQ(line, "j " + std::to_string(last) + " /tmp/j/after");
+    const Json::Value status = Status();
+    EXPECT_EQ(status["journal"], journal);
+    EXPECT_EQ(status["state"], "ok");
+    EXPECT_EQ(status["journals"][0]["first"], 1);
+    EXPECT_EQ(status["journals"][0]["last"], last);
+    EXPECT_GT(status["journals"][0]["bytes"].asUInt64(), uint64_t(kAway) * 50);
+    EXPECT_EQ(daemon.Stop(SIGTERM), 0);
+  }
+
+  // Cut short in the middle of a record: the records before are kept, and
+  // the queue rescans its tree, numbered after every record a client may
+  // have seen.
+  const std::string dir = "/var/lib/zorvnotifyd/journal/";
+  std::string segment;
+  for (const auto& entry : std::filesystem::directory_iterator(dir)) {
+    if (entry.path().extension() == ".0") segment = entry.path();
+  }
+  ASSERT_FALSE(segment.empty());
+  ASSERT_EQ(truncate(segment.c_str(), std::filesystem::file_size(segment) - 10), 0);
+  uint64_t rescan_seq = 0;
+  {
+    Daemon daemon(Lines{});
+    ASSERT_TRUE(daemon.Logged("the journal of queue \"j\" (etc/f) is damaged or cut short"));
+    ASSERT_TRUE(daemon.Logged("ready:"));
+    Client client;
+    EXPECT_EQ(Subscribe(client, "j", last - 2)["journal"], journal);
+    EXPECT_EQ(client.Line().rfind("j " + std::to_string(last - 1) + " /tmp/j/", 0), 0u);
+    EXPECT_EQ(client.Line(), "j " + std::to_string(last) + " /tmp/j/after");
+    const Json::Value rescan = client.Next();
+    EXPECT_EQ(rescan["rescan"], "/tmp/j");
+    rescan_seq = rescan["seq"].asUInt64();
+    EXPECT_GT(rescan_seq, uint64_t(last));
+    EXPECT_EQ(daemon.Stop(SIGTERM), 0);
+  }
+  // Garbage, a FIFO and a link in place of the journal's files: replaced,
+  // the link's target untouched.
+  ASSERT_TRUE(Put(segment, std::string(5000, 'g')));
+  const std::string other = segment.substr(0, segment.size() - 1) + "1";
+  ASSERT_EQ(mkfifo(other.c_str(), 0600), 0);
+  {
+    Daemon daemon(Lines{});
+    ASSERT_TRUE(daemon.Logged("cannot be used: it is not a journal, or its start is damaged"));
+    ASSERT_TRUE(daemon.Logged("cannot be used: it is not a regular file; replacing it"));
+    ASSERT_TRUE(daemon.Logged("ready:"));
+    // Its numbering is lost with it: a new journal id says so.
+    Client client;
+    const Json::Value reply = Subscribe(client, "j", rescan_seq);
+    EXPECT_NE(reply["journal"], journal);
+    journal = reply["journal"].asString();
+    EXPECT_EQ(client.Line(), "j 1 rescan /tmp/j");
+    EXPECT_EQ(daemon.Stop(SIGTERM), 0);
+  }
+  unlink(other.c_str());  // replaced by nothing, or by a new segment
+  ASSERT_EQ(symlink("/tmp/j/1", other.c_str()), 0);
+  {
+    Daemon daemon(Lines{});
+    ASSERT_TRUE(daemon.Logged("cannot be used: it is a symbolic link; replacing it"));
+    ASSERT_TRUE(daemon.Logged("ready:"));
+    EXPECT_EQ(Status()["journal"], journal);
+    EXPECT_EQ(daemon.Stop(SIGTERM), 0);
+  }
+  EXPECT_EQ(std::filesystem::file_size("/tmp/j/1"), 1u);
+  // The id removed: the journals are reset under a new one.
+  ASSERT_EQ(unlink((dir + "id").c_str()), 0);
+  Daemon daemon(Lines{});
+  ASSERT_TRUE(daemon.Logged("starting a new journal"));
+  ASSERT_TRUE(daemon.Logged("ready:"));
+  const Json::Value status = Status();
+  EXPECT_EQ(status["journal"].asString().size(), 32u);
+  EXPECT_NE(status["journal"], journal);
+  EXPECT_EQ(daemon.Stop(SIGTERM), 0);
+}
+
+// A full state directory (a tiny tmpfs on it, in the daemon's own mount
+// namespace): live delivery goes on, one log line, the status says
+// degraded, and once writing works again the queue rescans its tree.
+TEST_F(DaemonTest, DeliversLiveWhenTheJournalCannotBeWritten) {
+  ASSERT_EQ(std::system("rm -rf /tmp/full /tmp/fs && mkdir /tmp/full /tmp/fs"), 0);
+  Register("full", "/tmp/full", kCreate);
+  Daemon daemon({"--state-dir", "/tmp/fs"}, [] {
+    return unshare(CLONE_NEWNS) == 0 &&
+           mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == 0 &&
+           mount("zorv-test", "/tmp/fs", "tmpfs", 0, "mode=0700,size=64k") == 0;
+  });
+  ASSERT_TRUE(daemon.Logged("ready:"));
+  Client client;
+  Subscribe(client, "full");
+  // Fills what the daemon sees at /tmp/fs.
+  const std::string filler = "/proc/" + std::to_string(daemon.pid()) + "/root/tmp/fs/filler";
+  {
+    std::ofstream out(filler);
+    const std::string block(4096, 'f');
+    for (int i = 0; i < 64 && out.write(block.data(), block.size()); ++i) out.flush();
+  }
+  for (int i = 1; i <= 300; ++i) {
+    ASSERT_TRUE(Put("/tmp/full/" + std::to_string(i), "x"));
+    ASSERT_EQ(client.Line(), "full " + std::to_string(i + 1) + " /tmp/full/" + std::to_string(i));
+  }
+  EXPECT_TRUE(daemon.Logged("the journal of queue \"full\" (etc/f) is degraded: cannot write"));
+  EXPECT_EQ(Status()["state"], "degraded");
+  ASSERT_EQ(unlink(filler.c_str()), 0);
+  ASSERT_TRUE(Put("/tmp/full/again", "x"));
+  EXPECT_EQ(client.Line(), "full 302 /tmp/full/again");
+  EXPECT_EQ(client.Line(), "full 303 rescan /tmp/full");
+  EXPECT_TRUE(daemon.Logged("the journal of queue \"full\" (etc/f) is written again"));
+  EXPECT_EQ(Status()["state"], "ok");
+  EXPECT_EQ(daemon.Stop(SIGTERM), 0);
 }
 
 }  // namespace

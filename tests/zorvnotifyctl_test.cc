@@ -16,6 +16,7 @@
 
 #include <cerrno>
 #include <cstring>
+#include <filesystem>
 #include <fstream>
 #include <functional>
 #include <sstream>
@@ -324,7 +325,8 @@ TEST(ZorvnotifyctlTest, WatchAndStatusAskTheDaemon) {
   // Its first line comes once the subscription is in place.
   zorv_test::ChildProcess watch({ZORVNOTIFYCTL_PATH, "--socket", socket, "watch", "backup"},
                                 nullptr, true);
-  EXPECT_EQ(watch.Read(), "watching backup: etc/nas (last #1)");
+  EXPECT_THAT(watch.Read(), ::testing::MatchesRegex(
+                                "watching backup: etc/nas \\(last #1\\); journal [0-9a-f]{32}"));
   std::ofstream("/tmp/wd/new").flush();
   EXPECT_EQ(watch.Read(), "backup [etc/nas] #2 IN_CREATE /tmp/wd/new");
   std::ofstream("/tmp/wd/b\xff").flush();  // named by its escape, as valid UTF-8
@@ -343,9 +345,31 @@ TEST(ZorvnotifyctlTest, WatchAndStatusAskTheDaemon) {
   EXPECT_EQ(event["seq"], 2);
   EXPECT_EQ(event["path"], "/tmp/wd/new");
   EXPECT_THAT(json.Read(), ::testing::HasSubstr(R"("path":"/tmp/wd/b\udcff")"));
+  EXPECT_EQ(RunTool("--socket " + socket + " status", "", &out, &err), 0) << err;
+  EXPECT_THAT(out, ::testing::ContainsRegex("\nstate +ok\n"));
+  EXPECT_THAT(out, ::testing::ContainsRegex("\nbackup \\[etc/nas\\] +1 +3 +[0-9]+ +ok\n"));
   EXPECT_EQ(daemon.Stop(SIGTERM), 0);
   EXPECT_THAT(json.Read(), ::testing::HasSubstr("zorvnotifyd closed the connection"));
   EXPECT_EQ(json.Stop(0), 1);
+
+  // Across a restart --since resumes where the watch stopped; a journal
+  // found cut short makes the queue rescan its tree.
+  for (const auto& entry : std::filesystem::directory_iterator("/var/lib/zorvnotifyd/journal")) {
+    if (entry.path().extension() == ".0") {
+      ASSERT_EQ(truncate(entry.path().c_str(), off_t(entry.file_size() - 10)), 0);
+    }
+  }
+  zorv_test::ChildProcess again({ZORVNOTIFYD_PATH, "--socket", socket}, nullptr, true);
+  ASSERT_THAT(again.WaitFor("ready:"), ::testing::HasSubstr("for 1 queues"));
+  zorv_test::ChildProcess resumed(
+      {ZORVNOTIFYCTL_PATH, "--since", "2", "--socket", socket, "watch", "backup"}, nullptr, true);
+  EXPECT_THAT(resumed.Read(), ::testing::HasSubstr("watching backup"));
+  EXPECT_EQ(resumed.Read(), "backup [etc/nas] #3 IN_CREATE /tmp/wd/b\\udcff");
+  EXPECT_THAT(resumed.Read(),
+              ::testing::MatchesRegex("backup \\[etc/nas\\] #[0-9]+ RESCAN /tmp/wd \\(what "
+                                      "changed there is not known\\)"));
+  EXPECT_EQ(resumed.Stop(SIGINT), 0);
+  EXPECT_EQ(again.Stop(SIGTERM), 0);
 }
 
 // Files created in an order other than their names' (tmpfs lists the

@@ -365,7 +365,13 @@ std::string ReadableRecord(const std::string& line) {
   const Json::Value& path = value["path"];
   const Json::Value& mask = value["mask"];
   if (path.isString() && mask.isUInt()) {
-    return label + zorvcommon::MaskNames(mask.asUInt()) + " " + Shown(path);
+    return label + zorvcommon::MaskNames(mask.asUInt()) + " " + Shown(path) +
+           (value["offline"] == true ? " (offline: changed while zorvnotifyd was not watching)"
+                                     : "");
+  }
+  const Json::Value& rescan = value["rescan"];
+  if (rescan.isString()) {
+    return label + "RESCAN " + Shown(rescan) + " (what changed there is not known)";
   }
   if (value["lost"] == true) {
     return label + "LOST events may have been lost (inotify queue overflow)";
@@ -375,7 +381,9 @@ std::string ReadableRecord(const std::string& line) {
   return Printable(line);
 }
 
-// "watching QUEUE: TYPE/FILE (last #N), ...", from the subscribe reply.
+// "watching QUEUE: TYPE/FILE (last #N), ...; journal ID", from the
+// subscribe reply: with the journal id and the last number, a client
+// resumes with --since after a restart of the daemon.
 std::string ReadableSubscription(const Json::Value& reply, const std::string& name) {
   std::string queues;
   for (const Json::Value& queue : reply["queues"]) {
@@ -386,9 +394,11 @@ std::string ReadableSubscription(const Json::Value& reply, const std::string& na
     if (!queues.empty()) queues += ", ";
     queues += Shown(type) + "/" + Shown(file) + " (last #" + std::to_string(seq.asUInt64()) + ")";
   }
+  const Json::Value& journal = reply["journal"];
   return "watching " + Printable(name) + ": " +
          (queues.empty() ? "not in the catalogue now; its events follow once it is registered"
-                         : queues);
+                         : queues) +
+         (journal.isString() ? "; journal " + Shown(journal) : "");
 }
 
 }  // namespace
@@ -669,6 +679,8 @@ int RunStatus(const Invocation& invocation) {
       {"trees_missing", "trees missing"},
       {"directories_over_watch_limit", "directories over the watch limit"},
       {"run", "run id"},
+      {"journal", "journal id"},
+      {"state", "state"},
   };
   constexpr size_t kValueColumn = 34;  // the longest label and two blanks
   const Json::Value& answer = reply;   // read only: no member is added
@@ -679,6 +691,22 @@ int RunStatus(const Invocation& invocation) {
                   : value.isString() ? Shown(value)
                                      : "-")
               << '\n';
+  }
+  // Each queue's journal: the records it holds, and whether it is written.
+  Table journals({"JOURNAL", "FIRST", "LAST", "BYTES", "STATE"});
+  for (const Json::Value& journal : answer["journals"]) {
+    std::string label;
+    if (!QueueLabel(journal, &label)) continue;
+    const auto number = [&journal](const char* key) {
+      const Json::Value& value = journal[key];
+      return value.isUInt64() ? std::to_string(value.asUInt64()) : std::string("-");
+    };
+    journals.AddRow({label, number("first"), number("last"), number("bytes"),
+                     journal["healthy"] == false ? "degraded" : "ok"});
+  }
+  if (!answer["journals"].empty()) {
+    std::cout << '\n';
+    journals.Print(std::cout);
   }
   return kExitOk;
 }

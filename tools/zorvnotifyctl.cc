@@ -107,20 +107,26 @@ constexpr CommandInfo kCommands[] = {
      "given) and shows their events as they happen, one line each, e.g.\n"
      "  backup [etc/nas] #12 IN_CREATE|IN_ISDIR /vol/share/docs\n"
      "with the queue's sequence number of each event, and its notices:\n"
-     "  backup [etc/nas] #13 LOST events may have been lost (inotify queue overflow)\n"
-     "  backup [etc/nas] #14 removed from the catalogue\n"
-     "  backup [etc/nas] #15 registered again\n"
+     "  backup [etc/nas] #13 IN_DELETE /vol/share/a (offline: changed while\n"
+     "      zorvnotifyd was not watching)\n"
+     "  backup [etc/nas] #14 RESCAN /vol/share (what changed there is not known)\n"
+     "  backup [etc/nas] #15 removed from the catalogue\n"
+     "  backup [etc/nas] #16 registered again\n"
      "  backup [etc/nas] MISSED 40 events (no longer kept)\n"
-     "The first line names the queues subscribed to and the number of their last\n"
-     "event.  Without --since, events from now on; with --since N, first every\n"
-     "event after number N the daemon still keeps.  Runs until SIGINT or SIGTERM\n"
+     "The first line names the queues subscribed to, the number of their last\n"
+     "event and the daemon's journal id.  Without --since, events from now on;\n"
+     "with --since N, first every event after number N the daemon's journal\n"
+     "still keeps, across restarts of the daemon while the journal id stays the\n"
+     "same (a new id: rescan, the numbers start afresh).  Runs until SIGINT or SIGTERM\n"
      "(exit status 0) or until the daemon closes the connection (exit status 1).\n"
      "With --json: the subscription's reply, then the daemon's lines as they are,\n"
      "one JSON object per line.\n"},
     {"status", 0, 0, kDaemon, RunStatus, "",
      "Shows the counters of the running daemon zorvnotifyd: directories watched,\n"
      "queues, clients, events handled, overflows (events lost), trees missing,\n"
-     "directories over the watch limit and the id of its run.  With --json: the\n"
+     "directories over the watch limit, the id of its run, its journal id and the\n"
+     "state's health (ok, degraded while a journal cannot be written), then each\n"
+     "queue's journal: first and last numbers kept, bytes.  With --json: the\n"
      "daemon's reply object.\n"},
 };
 
