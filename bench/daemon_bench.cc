@@ -28,6 +28,13 @@
 // queues, beside the bare reader's time to walk the same 10,000 directories
 // and add their watches.
 //
+// Start-up comparison (run last: it replaces the catalogue): one queue on a
+// tree of 10,000 directories holding 100,000 files, the daemon started with
+// the snapshot a first start saved (every directory compared, nothing
+// changed) and with none (the first start, which lists the tree for its
+// first snapshot), beside the bare reader's walk of the same directories;
+// and the size of the saved snapshot per entry.
+//
 // With two CPUs or more, the writer has one to itself and the reading side
 // (the daemon and its clients' thread, or the bare reader) another, so that
 // where the scheduler puts them does not change the batches the readers
@@ -678,6 +685,105 @@ void BareStartup(benchmark::State& state) {
   state.SetLabel("bare inotify reader process: walk and inotify_add_watch, the same directories");
 }
 
+const std::string kSnapTree = kRoot + "/snap";
+const std::string kStateDir = kRoot + "/state";
+const std::string kSnapRoots = kRoot + "/snap-roots";
+constexpr int kSnapDirs = 10000, kSnapFilesPerDir = 10;
+
+// Makes the comparison's tree (100 directories of 99 directories each, 10
+// files in every one) and a catalogue of one queue on it.  False on failure.
+bool UseSnapshotTree() {
+  static bool made = false;
+  if (made) return true;
+  const std::string conf = MonitorQueue::GetConfDir(ZORV::ZORVNOTIFYD::MONITOR_QUEUE_TYPE_ETC_DIR);
+  std::filesystem::remove(conf + "/bench");
+  std::vector<std::string> dirs;
+  for (int i = 0; i < 100; ++i) {
+    const std::string top = kSnapTree + "/t" + std::to_string(i);
+    dirs.push_back(top);
+    for (int j = 0; j < kSnapDirs / 100 - 1; ++j) dirs.push_back(top + "/s" + std::to_string(j));
+  }
+  if (mkdir(kSnapTree.c_str(), 0755) != 0) return false;
+  for (const std::string& dir : dirs) {
+    if (mkdir(dir.c_str(), 0755) != 0) return false;
+    for (int k = 0; k < kSnapFilesPerDir; ++k) {
+      const int fd =
+          open((dir + "/file" + std::to_string(k)).c_str(), O_CREAT | O_WRONLY | O_CLOEXEC, 0644);
+      if (fd < 0 || write(fd, "x", 1) != 1) return false;
+      close(fd);
+    }
+  }
+  Json::Value value(Json::objectValue);
+  value["queue"] = "snap";
+  value["config"][0]["path"] = kSnapTree;
+  value["config"][0]["mask"] = IN_CREATE | IN_CLOSE_WRITE | IN_DELETE;
+  if (!MonitorQueue::SaveToFile({MonitorQueue(value)}, conf + "/snap")) return false;
+  std::ofstream roots(kSnapRoots, std::ios::trunc);
+  roots << "0x" << std::hex << (IN_CREATE | IN_CLOSE_WRITE | IN_DELETE | kTreeKeeping) << std::dec
+        << ' ' << kSnapTree << '\n';
+  return made = static_cast<bool>(roots.flush());
+}
+
+// The snapshot's bytes on disk per entry (directory or file) of the tree.
+double SnapshotBytesPerEntry() {
+  uint64_t bytes = 0;
+  for (const auto& file : std::filesystem::directory_iterator(kStateDir + "/snapshot"))
+    bytes += file.file_size();
+  return double(bytes) / double(kSnapDirs - 1 + kSnapDirs * kSnapFilesPerDir);
+}
+
+// From exec to "ready" on the comparison's tree, with the snapshot of an
+// earlier start (|saved|) or none.
+void SnapshotStartup(benchmark::State& state, bool saved) {
+  if (!UseSnapshotTree()) {
+    state.SkipWithError("cannot make the tree");
+    return;
+  }
+  const std::vector<std::string> args = {ZORVNOTIFYD_PATH, "--socket", kSocket, "--state-dir",
+                                         kStateDir,        "--retry",  "600"};
+  const std::string expected = "watching " + std::to_string(kSnapDirs + 1) + " directories";
+  for (auto _ : state) {
+    state.PauseTiming();
+    std::filesystem::remove_all(kStateDir);
+    if (saved) {
+      Child first(args);  // saves its snapshot as it stops
+      first.WaitFor("ready:", std::chrono::seconds(60));
+    }
+    state.ResumeTiming();
+    const auto start = Clock::now();
+    Child daemon(args);
+    const std::string ready = daemon.WaitFor("ready:", std::chrono::seconds(60));
+    state.SetIterationTime(std::chrono::duration<double>(Clock::now() - start).count());
+    if (ready.find(expected) == std::string::npos) {
+      state.SkipWithError(("the daemon did not start as expected: " + daemon.Output()).c_str());
+      return;
+    }
+  }
+  state.counters["snapshot_bytes_per_entry"] = SnapshotBytesPerEntry();
+  state.SetLabel("1 queue on 10,000 directories of 100,000 files, " +
+                 std::string(saved ? "each compared with the saved snapshot"
+                                   : "no snapshot yet (first start)"));
+}
+
+// From exec to the bare reader's "ready" on the comparison's tree.
+void BareSnapshotStartup(benchmark::State& state) {
+  if (!UseSnapshotTree()) {
+    state.SkipWithError("cannot make the tree");
+    return;
+  }
+  for (auto _ : state) {
+    const auto start = Clock::now();
+    Child bare({BARE_READER_PATH, kSnapRoots});
+    const std::string ready = bare.WaitFor("ready ", std::chrono::seconds(60));
+    state.SetIterationTime(std::chrono::duration<double>(Clock::now() - start).count());
+    if (ready != "ready " + std::to_string(kSnapDirs + 1) + "\n") {
+      state.SkipWithError(("the bare reader did not start as expected: " + bare.Output()).c_str());
+      return;
+    }
+  }
+  state.SetLabel("bare inotify reader process: walk and inotify_add_watch, the same directories");
+}
+
 double Max(const std::vector<double>& values) {
   return values.empty() ? 0 : *std::max_element(values.begin(), values.end());
 }
@@ -721,6 +827,21 @@ int main(int argc, char** argv) {
       ->Unit(benchmark::kMillisecond);
   benchmark::RegisterBenchmark("base/zorvnotifyd/start-up, exec to ready", BareStartup)
       ->Iterations(1)
+      ->UseManualTime()
+      ->Unit(benchmark::kMillisecond);
+  // Last: these replace the catalogue.
+  for (const bool saved : {true, false}) {
+    benchmark::RegisterBenchmark(
+        saved ? "lib/zorvnotifyd/start-up compared with a snapshot, exec to ready"
+              : "lib/zorvnotifyd/start-up without a snapshot, exec to ready",
+        SnapshotStartup, saved)
+        ->Iterations(3)
+        ->UseManualTime()
+        ->Unit(benchmark::kMillisecond);
+  }
+  benchmark::RegisterBenchmark("base/zorvnotifyd/start-up compared with a snapshot, exec to ready",
+                               BareSnapshotStartup)
+      ->Iterations(3)
       ->UseManualTime()
       ->Unit(benchmark::kMillisecond);
   benchmark::RunSpecifiedBenchmarks();

@@ -10,7 +10,10 @@
 #include <syslog.h>
 #include <unistd.h>
 
+#include <utility>
+
 #include "directory.h"
+#include "offline_changes.h"
 #include "text.h"
 
 namespace zorvnotifyd {
@@ -22,6 +25,11 @@ using zorvcommon::Quoted;
 // that directories came, went or moved, and why a watch ends.
 constexpr uint32_t kTreeKeeping =
     IN_CREATE | IN_MOVED_TO | IN_MOVED_FROM | IN_DELETE | IN_MOVE_SELF | IN_DELETE_SELF;
+
+// The kinds that change what a directory's listing holds (names, inodes,
+// sizes, times): an event of these marks its directory for the snapshot.
+constexpr uint32_t kListingChanges =
+    IN_CREATE | IN_DELETE | IN_MOVED_FROM | IN_MOVED_TO | IN_MODIFY | IN_CLOSE_WRITE | IN_ATTRIB;
 
 // Buffers ReadEvents reads before its caller polls again.
 constexpr int kReadsPerRound = 16;
@@ -78,10 +86,14 @@ void WatchTree::Resync() {
 void WatchTree::Sync(const std::vector<std::string>& roots,
                      const ZORV::ZORVNOTIFYD::MonitorQueueIndex& index) {
   const HomeAtReturn home(*this);
+  Relist();  // while the directories marked are still watched
+  reloading_ = synced_;
+  synced_ = true;
   roots_ = std::set<std::string, std::less<>>(roots.begin(), roots.end());
   index_ = index;
   std::set<int> synced;
   std::set<std::string> visited;
+  std::set<std::string> tops;
   std::map<std::string, std::string> was_missing = std::move(missing_);
   std::map<std::string, size_t> was_limited = std::move(limited_);
   missing_.clear();
@@ -98,10 +110,11 @@ void WatchTree::Sync(const std::vector<std::string>& roots,
     context.synced = &synced;
     context.visited = &visited;
     std::string why;
-    if (!WatchRootTree(root, context, &why)) {
+    if (!WatchRootTree(root, context, &why, by_path_.count(root) == 0)) {
       NoteRootMissing(root, why);
       continue;
     }
+    tops.insert(context.tops.begin(), context.tops.end());
     const auto before = was_limited.find(root);
     if (context.unwatched == 0) {
       if (before != was_limited.end()) {
@@ -124,6 +137,26 @@ void WatchTree::Sync(const std::vector<std::string>& roots,
     if (visited.count(path) == 0) stale.push_back(path);
   }
   for (const std::string& path : stale) Unmap(path, true, nullptr);
+  // Directories over the watch limit are rescanned when found so, and
+  // again once watched: what happened meanwhile is unknown.
+  if (sink_ != nullptr) {
+    for (const std::string& top : unwatched_tops_) {
+      if (tops.count(top) == 0) sink_->Rescan(top);
+    }
+  }
+  std::set<std::string> told = std::move(unwatched_tops_);
+  unwatched_tops_.clear();
+  for (const std::string& top : tops) {
+    if (told.count(top) != 0) unwatched_tops_.insert(top);
+  }
+  NoteUnwatched(std::vector<std::string>(tops.begin(), tops.end()));
+  reloading_ = false;
+}
+
+void WatchTree::NoteUnwatched(const std::vector<std::string>& tops) {
+  for (const std::string& top : tops) {
+    if (unwatched_tops_.insert(top).second && sink_ != nullptr) sink_->Rescan(top);
+  }
 }
 
 void WatchTree::Tick(EventSink& sink) {
@@ -145,8 +178,9 @@ void WatchTree::Tick(EventSink& sink) {
     WalkContext context;
     context.found = &sink;
     std::string why;
-    if (!WatchRootTree(root, context, &why)) continue;
+    if (!WatchRootTree(root, context, &why, true)) continue;
     if (context.unwatched != 0) limited_[root] += context.unwatched;
+    NoteUnwatched(context.tops);
   }
   if (!limited_.empty()) Resync();
 }
@@ -188,6 +222,7 @@ bool WatchTree::ReadEvents(EventSink& sink) {
       }
       syslog(LOG_WARNING, "inotify event queue overflowed, events were lost: rescanning the trees");
       sink.Lost();
+      Relist();
       // Deletions and moves may be among the lost events, so no watch is
       // trusted: all are dropped and the trees watched afresh.
       Clear();
@@ -227,7 +262,9 @@ void WatchTree::Handle(const RawEvent& event, EventSink& sink) {
   // Reporting changes no watch, so the paths are read in place and the
   // path of the entry is built in a buffer kept between events: a file's
   // event costs no allocation here.
+  const bool relist = snapshot_ != nullptr && !event.name.empty() && (event.mask & kListingChanges);
   for (const std::string& path : watch.paths) {
+    if (relist) snapshot_->MarkDirty(path);
     if (ToldByParent(path, event)) continue;
     if (event.name.empty()) {
       sink.Event(path, event.mask);
@@ -312,13 +349,44 @@ std::string WatchTree::RootOf(const std::string& dir) const {
   return found;
 }
 
-bool WatchTree::WatchRootTree(const std::string& root, WalkContext& context, std::string* why) {
+bool WatchTree::WatchRootTree(const std::string& root, WalkContext& context, std::string* why,
+                              bool compare) {
   UniqueFd dir = OpenConfiguredDir(root);
   if (dir.get() < 0) {
     *why = errno == ENOTDIR ? "not a directory" : strerror(errno);
     return false;
   }
+  if (!compare || snapshot_ == nullptr || sink_ == nullptr) {
+    Walk(dir.get(), root, context);
+    return true;
+  }
+  Snapshot::Known known;
+  OfflineChanges changes(snapshot_->Tree(root, &known));
+  EventSink* found = std::exchange(context.found, nullptr);
+  context.compare = &changes;
   Walk(dir.get(), root, context);
+  context.compare = nullptr;
+  context.found = found;
+  // Without a saved view, a flood of creations would tell no more than
+  // one rescan of the tree, and could not tell what was deleted.
+  if (known == Snapshot::Known::kSaved) {
+    changes.Finish(*sink_);
+    return true;
+  }
+  if (known == Snapshot::Known::kNone && context.found != nullptr) {
+    // A tree that appears for the first time has no past: all it holds
+    // is new, and found.
+    for (const auto& [path, listing] : snapshot_->Loaded(root)->dirs()) {
+      for (const SnapshotEntry& entry : listing.entries) {
+        context.found->Found(path + "/" + entry.name, entry.is_dir);
+      }
+    }
+    return true;
+  }
+  // A tree of a queue registered while the daemon runs starts from now,
+  // as its queue does.
+  if (known == Snapshot::Known::kNone && reloading_) return true;
+  sink_->Rescan(root);
   return true;
 }
 
@@ -332,17 +400,16 @@ void WatchTree::Walk(int dir, const std::string& path, WalkContext& context) {
   ++context.dirs;
   const size_t refused = context.unwatched;
   if (Add(dir, st, path, context) < 0 && context.unwatched == refused) return;
+  const bool unwatched = context.unwatched != refused;
+  if (unwatched && context.in_unwatched++ == 0) context.tops.push_back(path);
   context.ancestors.push_back(id);
-  for (const DirEntry& entry : ListDir(dir)) {
-    const std::string child = path + "/" + entry.name;
-    if (context.found != nullptr) context.found->Found(child, entry.is_dir);
-    if (!entry.is_dir) continue;
-    UniqueFd sub = OpenSubdir(dir, entry.name);
+  // Each level of a walk holds a descriptor: a tree deeper than the
+  // descriptors left would otherwise lose its lower levels unsaid.
+  auto descend = [&](const std::string& name, const std::string& child) {
+    UniqueFd sub = OpenSubdir(dir, name);
     if (sub.get() >= 0) {
       Walk(sub.get(), child, context);
     } else if ((errno == EMFILE || errno == ENFILE) && !context.out_of_descriptors) {
-      // Each level of a walk holds a descriptor: a tree deeper than the
-      // descriptors left would otherwise lose its lower levels unsaid.
       const int error = errno;
       context.out_of_descriptors = true;
       syslog(LOG_ERR,
@@ -350,8 +417,26 @@ void WatchTree::Walk(int dir, const std::string& path, WalkContext& context) {
              "descriptor per level; raise the descriptor limit or lower --max-clients)",
              Quoted(child).c_str(), strerror(error));
     }
+  };
+  if (context.compare != nullptr) {
+    SnapshotListing listing;
+    listing.ino = st.st_ino;
+    ListWithStatus(dir, &listing);
+    // Kept in the snapshot, whose nodes stay where they are while the
+    // walk below adds others.
+    const SnapshotListing& seen = context.compare->Directory(path, std::move(listing));
+    for (const SnapshotEntry& entry : seen.entries) {
+      if (entry.is_dir) descend(entry.name, path + "/" + entry.name);
+    }
+  } else {
+    for (const DirEntry& entry : ListDir(dir)) {
+      const std::string child = path + "/" + entry.name;
+      if (context.found != nullptr) context.found->Found(child, entry.is_dir);
+      if (entry.is_dir) descend(entry.name, child);
+    }
   }
   context.ancestors.pop_back();
+  if (unwatched) --context.in_unwatched;
 }
 
 int WatchTree::Add(int dir, const struct stat& st, const std::string& path, WalkContext& context) {
@@ -416,6 +501,7 @@ void WatchTree::AddAndScan(const std::string& path, EventSink& sink) {
   context.found = &sink;
   Walk(dir.get(), path, context);
   if (context.unwatched == 0) return;
+  NoteUnwatched(context.tops);
   if (limited_.empty()) {
     syslog(LOG_ERR,
            "cannot watch %zu new directories at %s: inotify watch limit reached (raise "
@@ -499,6 +585,111 @@ void WatchTree::NoteRootMissing(const std::string& path, const std::string& why)
   if (!missing_.emplace(path, why).second) return;
   syslog(LOG_NOTICE, "not watching tree %s: %s; looking for it again every %g s",
          Quoted(path).c_str(), why.c_str(), retry_seconds_);
+}
+
+}  // namespace zorvnotifyd
+
+namespace zorvnotifyd {
+
+bool WatchTree::ListWatched(const std::string& path, SnapshotListing* listing) {
+  const auto known = by_path_.find(path);
+  if (known == by_path_.end()) return false;
+  const Watch& watch = watches_.at(known->second);
+  const UniqueFd dir = OpenBelow(RootOf(path), path);
+  struct stat st;
+  if (dir.get() < 0 || fstat(dir.get(), &st) != 0 || st.st_dev != watch.dev ||
+      st.st_ino != watch.ino) {
+    return false;  // gone or replaced: its parent's listing tells
+  }
+  listing->ino = uint64_t(st.st_ino);
+  return ListWithStatus(dir.get(), listing);
+}
+
+void WatchTree::SaveSnapshot() {
+  if (snapshot_ == nullptr) return;
+  Relist();
+  snapshot_->Save();
+}
+
+void WatchTree::Relist() {
+  if (snapshot_ == nullptr) return;
+  // A directory that left its parent's listing, and one that came, by
+  // inode: one that moved takes the listings below it along; one that
+  // left the trees loses them; one new to a tree is listed in turn.
+  struct Place {
+    TreeSnapshot* tree;
+    std::string path;
+  };
+  std::vector<std::string> work = snapshot_->TakeDirty();
+  while (!work.empty()) {
+    std::unordered_map<uint64_t, Place> left;
+    std::vector<std::pair<uint64_t, Place>> came;
+    for (const std::string& path : work) {
+      SnapshotListing listing;
+      bool listed = false;
+      for (auto& [root, tree] : snapshot_->trees()) {
+        if (path.compare(0, root.size(), root) != 0 ||
+            (path.size() != root.size() && path[root.size()] != '/')) {
+          continue;
+        }
+        if (!listed && !(listed = ListWatched(path, &listing))) break;
+        auto& dirs = tree->dirs();
+        const auto old = dirs.find(path);
+        if (old != dirs.end()) {
+          // Both sorted by name: directories that left, in one pass.
+          auto b = listing.entries.begin();
+          for (const SnapshotEntry& a : old->second.entries) {
+            while (b != listing.entries.end() && b->name < a.name) ++b;
+            const bool kept =
+                b != listing.entries.end() && b->name == a.name && b->ino == a.ino && b->is_dir;
+            if (a.is_dir && !kept) left[a.ino] = {tree.get(), path + "/" + a.name};
+          }
+        }
+        for (const SnapshotEntry& entry : listing.entries) {
+          if (!entry.is_dir) continue;
+          const std::string child = path + "/" + entry.name;
+          const auto known = dirs.find(child);
+          if (known == dirs.end() || known->second.ino != entry.ino) {
+            came.push_back({entry.ino, {tree.get(), child}});
+          }
+        }
+        tree->Put(path, listing);
+      }
+    }
+    work.clear();
+    // Forget what left first: a directory replaced under the same name
+    // must not lose the listing made for its successor.
+    std::vector<std::pair<Place, std::vector<std::pair<std::string, SnapshotListing>>>> moved;
+    for (auto& [ino, from] : left) {
+      std::vector<std::pair<std::string, SnapshotListing>> below;
+      bool moves = false;
+      for (const auto& [came_ino, to] : came) moves |= came_ino == ino && to.tree == from.tree;
+      if (moves) {
+        auto& dirs = from.tree->dirs();
+        for (auto it = dirs.lower_bound(from.path);
+             it != dirs.end() && it->first.compare(0, from.path.size(), from.path) == 0; ++it) {
+          if (it->first.size() == from.path.size() || it->first[from.path.size()] == '/') {
+            below.emplace_back(it->first.substr(from.path.size()), std::move(it->second));
+          }
+        }
+      }
+      from.tree->Forget(from.path);
+      if (moves) moved.push_back({from, std::move(below)});
+    }
+    for (const auto& [ino, to] : came) {
+      const auto from = left.find(ino);
+      if (from == left.end() || from->second.tree != to.tree) {
+        work.push_back(to.path);  // new to the tree: listed in the next round
+        continue;
+      }
+      for (auto& [place, below] : moved) {
+        if (place.path != from->second.path) continue;
+        for (auto& [relative, listing] : below)
+          to.tree->Put(to.path + relative, std::move(listing));
+        below.clear();
+      }
+    }
+  }
 }
 
 }  // namespace zorvnotifyd

@@ -19,9 +19,12 @@
 #include <vector>
 
 #include "monitor_queue_index.h"
+#include "snapshot.h"
 #include "unique_fd.h"
 
 namespace zorvnotifyd {
+
+class OfflineChanges;
 
 // Opens an inotify instance, non-blocking and close-on-exec.  On failure
 // logs why (naming the kernel limit when it is the instance limit) and
@@ -112,6 +115,24 @@ class WatchTree {
   // Removes every watch; the descriptor stays open.
   void Clear();
 
+  // From now on keeps |snapshot| current and compares with it: each walk
+  // of a tree that was not watched (at start, a tree that comes back, one
+  // added to the catalogue, every tree after an overflow) hands |sink| the
+  // changes made since the tree was last seen as Offline, or Rescan(root)
+  // when nothing of it was saved; a tree walked with a snapshot reports
+  // no Found entries.  Directories over the watch limit are told to |sink|
+  // as Rescan when they are found unwatched and again once watched.
+  void UseSnapshot(Snapshot* snapshot, EventSink* sink) {
+    snapshot_ = snapshot;
+    sink_ = sink;
+  }
+  // Lists again every directory whose entries events changed since the
+  // last call (and every directory new to a tree), puts the listings in
+  // the snapshot, and saves it.  Events only mark directories: the
+  // listing and the status calls are paid here, once per directory and
+  // save, never per event.
+  void SaveSnapshot();
+
  private:
   struct Watch {
     std::set<std::string> paths;  // every path it is watched under
@@ -134,6 +155,9 @@ class WatchTree {
     EventSink* found = nullptr;                // report entries as Found
     size_t dirs = 0;                           // directories met
     size_t unwatched = 0;                      // of which the watch limit refused
+    std::vector<std::string> tops;             // the highest unwatched directories
+    size_t in_unwatched = 0;                   // unwatched directories being walked
+    OfflineChanges* compare = nullptr;         // compare with the snapshot
     std::vector<std::pair<dev_t, ino_t>> ancestors;  // loop guard
     bool out_of_descriptors = false;                 // a subdirectory could not be opened, logged
   };
@@ -160,9 +184,18 @@ class WatchTree {
   // Watches and walks the directory at |path| (inside a watched tree),
   // reporting what it holds as Found.
   void AddAndScan(const std::string& path, EventSink& sink);
-  // Watches the tree |root| and walks it; with |sink|, reports its entries
-  // as Found.  False (with |why|) when the root cannot be opened.
-  bool WatchRootTree(const std::string& root, WalkContext& context, std::string* why);
+  // Watches the tree |root| and walks it; with context.found, reports its
+  // entries as Found; with |compare| and a snapshot, compares it with the
+  // snapshot instead.  False (with |why|) when the root cannot be opened.
+  bool WatchRootTree(const std::string& root, WalkContext& context, std::string* why, bool compare);
+  // The listing half of SaveSnapshot: puts the directories marked into
+  // the snapshot, without saving it.
+  void Relist();
+  // Tells sink_ to rescan each of |tops| not told already.
+  void NoteUnwatched(const std::vector<std::string>& tops);
+  // Lists the watched directory |path| into |listing|; false when it is
+  // not watched or is no longer the directory watched there.
+  bool ListWatched(const std::string& path, SnapshotListing* listing);
   // Moves the watches at and below each path of |from| to each path of
   // |to| (a rename within the trees; several paths when the directories
   // have several), then sets the kernel masks that the new place changes.
@@ -203,6 +236,11 @@ class WatchTree {
   std::deque<RawEvent> pending_;                     // events read but not yet handled
   std::set<uint32_t> moves_;  // cookies of directory moves within the trees, already done
   std::string entry_path_;    // Handle's buffer for the path of an event's entry
+  Snapshot* snapshot_ = nullptr;
+  EventSink* sink_ = nullptr;             // where comparisons and rescans go
+  std::set<std::string> unwatched_tops_;  // told to rescan, over the watch limit
+  bool synced_ = false;                   // Sync ran before
+  bool reloading_ = false;                // within a Sync that is not the first
   double retry_seconds_;
 };
 

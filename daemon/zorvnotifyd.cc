@@ -29,6 +29,7 @@
 #include "queue_log.h"
 #include "report.h"
 #include "server.h"
+#include "snapshot.h"
 #include "state_dir.h"
 #include "sync_timer.h"
 #include "text.h"
@@ -168,6 +169,17 @@ int Serve(const Options& options) {
   sync.Join([&logs] { logs.Sync(); });
   Reporter reporter(logs, options.out);
   WatchTree tree(std::move(inotify), options.retry_seconds);
+  std::string reason;
+  UniqueFd snapshot_dir = state.OpenSubdirectory("snapshot", &reason);
+  if (snapshot_dir.get() < 0) {
+    syslog(LOG_ERR, "cannot keep the snapshot of the trees (%s): every tree is rescanned",
+           reason.c_str());
+  }
+  Snapshot snapshot(std::move(snapshot_dir));
+  tree.UseSnapshot(&snapshot, &reporter);
+  // After the journals: a change is in the snapshot only once the records
+  // that told it are durable.
+  sync.Join([&tree] { tree.SaveSnapshot(); });
   Server server(options.server, logs, RandomId(), [&] {
     std::string status;
     AppendJsonNumber(&status, "directories", tree.size());
@@ -204,6 +216,7 @@ int Serve(const Options& options) {
     server.FollowNew(created);
   };
   load();
+  sync.Wrote(NowMs());  // the views of the trees walked
   syslog(LOG_INFO, "ready: watching %zu directories for %zu queues", tree.size(), reporter.size());
   NotifyServiceManager(ReadyState(tree.size(), reporter.size()));
   const int64_t retry_ms = std::max<int64_t>(1, int64_t(options.retry_seconds * 1000));
@@ -233,13 +246,18 @@ int Serve(const Options& options) {
       NotifyServiceManager("STOPPING=1");
       syslog(LOG_INFO, "stopping on %s: releasing %zu watches", strsignal(int(info.ssi_signo)),
              tree.size());
-      tree.Clear();
+      // The snapshot is saved with the last sync, while the watches still
+      // tell which directories are the ones watched.
       logs.WriteOut();
       sync.Run(NowMs());
+      tree.Clear();
       logs.Close();
       return 0;
     }
-    if (ready > 0 && (fds[1].revents & POLLIN) && !tree.ReadEvents(reporter)) return 1;
+    if (ready > 0 && (fds[1].revents & POLLIN)) {
+      if (!tree.ReadEvents(reporter)) return 1;
+      sync.Wrote(NowMs());  // the directories the events marked
+    }
     // A configuration directory that was missing (a read-only /usr) and
     // exists now is read as soon as the next tick finds it.
     const bool tick = NowMs() >= next_tick;
@@ -247,6 +265,7 @@ int Serve(const Options& options) {
     if (hangup || changed || (tick && catalogue_watch.WatchMissing())) {
       NotifyServiceManager("RELOADING=1");
       load();
+      sync.Wrote(NowMs());
       syslog(LOG_INFO, "catalogue reloaded: watching %zu directories for %zu queues", tree.size(),
              reporter.size());
       NotifyServiceManager(ReadyState(tree.size(), reporter.size()));
@@ -256,6 +275,7 @@ int Serve(const Options& options) {
       tree.Tick(reporter);
       server.Tick(options.retry_seconds);
       next_tick = NowMs() + retry_ms;
+      sync.Wrote(NowMs());  // a tree that came back was compared
     }
     server.Deliver();
     // The journals' records of this turn, one write each, synced in groups;

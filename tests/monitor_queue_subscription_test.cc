@@ -105,15 +105,17 @@ TEST_F(SubscriptionTest, FollowsItsQueueInOrderAcrossADaemonRestart) {
   EXPECT_EQ(journal.size(), 32u);
   EXPECT_FALSE(Readable(sub.Fd(), 0));
   const std::string create = " " + std::to_string(IN_CREATE);
+  // Record 1 is the first start's rescan of the tree, made before this
+  // subscription.
   for (const char* name : {"1", "2", "3"}) ASSERT_TRUE(Touch(std::string("/tmp/sub/q/") + name));
   ASSERT_TRUE(Touch("/tmp/sub/o/x"));  // another queue's
   ASSERT_TRUE(Readable(sub.Fd(), 10000));
   usleep(100000);  // all three lines arrive, and are read at once
-  EXPECT_EQ(Next(sub), "EVENT 1 /tmp/sub/q/1" + create);
+  EXPECT_EQ(Next(sub), "EVENT 2 /tmp/sub/q/1" + create);
   // Lines already read keep the descriptor readable.
   EXPECT_TRUE(Readable(sub.Fd(), 0));
-  EXPECT_EQ(Next(sub), "EVENT 2 /tmp/sub/q/2" + create);
-  EXPECT_EQ(Next(sub), "EVENT 3 /tmp/sub/q/3" + create);
+  EXPECT_EQ(Next(sub), "EVENT 3 /tmp/sub/q/2" + create);
+  EXPECT_EQ(Next(sub), "EVENT 4 /tmp/sub/q/3" + create);
   EXPECT_FALSE(Readable(sub.Fd(), 0));
   EXPECT_EQ(Next(sub, 0), "none: timed out");
 
@@ -128,16 +130,16 @@ TEST_F(SubscriptionTest, FollowsItsQueueInOrderAcrossADaemonRestart) {
   EXPECT_EQ(Next(sub, 0), "none: timed out");
   EXPECT_TRUE(sub.Connected());
   for (const char* name : {"4", "5"}) ASSERT_TRUE(Touch(std::string("/tmp/sub/q/") + name));
-  EXPECT_EQ(Next(sub), "EVENT 4 /tmp/sub/q/4" + create);
-  EXPECT_EQ(Next(sub), "EVENT 5 /tmp/sub/q/5" + create);
+  EXPECT_EQ(Next(sub), "EVENT 5 /tmp/sub/q/4" + create);
+  EXPECT_EQ(Next(sub), "EVENT 6 /tmp/sub/q/5" + create);
   EXPECT_EQ(sub.Journal(), journal);
   // Kept records after a number, which come with the reply: read with it,
   // and the descriptor says so.
   MonitorQueueSubscription back(kSocket);
-  ASSERT_TRUE(back.Subscribe("q", 3)) << back.LastError();
+  ASSERT_TRUE(back.Subscribe("q", 4)) << back.LastError();
   EXPECT_TRUE(Readable(back.Fd(), 0));
-  EXPECT_EQ(Next(back, 0), "EVENT 4 /tmp/sub/q/4" + create);
-  EXPECT_EQ(Next(back, 0), "EVENT 5 /tmp/sub/q/5" + create);
+  EXPECT_EQ(Next(back, 0), "EVENT 5 /tmp/sub/q/4" + create);
+  EXPECT_EQ(Next(back, 0), "EVENT 6 /tmp/sub/q/5" + create);
   EXPECT_FALSE(Readable(back.Fd(), 0));
 
   sub.Close();

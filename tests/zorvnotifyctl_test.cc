@@ -326,26 +326,28 @@ TEST(ZorvnotifyctlTest, WatchAndStatusAskTheDaemon) {
   zorv_test::ChildProcess watch({ZORVNOTIFYCTL_PATH, "--socket", socket, "watch", "backup"},
                                 nullptr, true);
   EXPECT_THAT(watch.Read(), ::testing::MatchesRegex(
-                                "watching backup: etc/nas \\(last #0\\); journal [0-9a-f]{32}"));
+                                "watching backup: etc/nas \\(last #1\\); journal [0-9a-f]{32}"));
   std::ofstream("/tmp/wd/new").flush();
-  EXPECT_EQ(watch.Read(), "backup [etc/nas] #1 IN_CREATE /tmp/wd/new");
+  EXPECT_EQ(watch.Read(), "backup [etc/nas] #2 IN_CREATE /tmp/wd/new");
   std::ofstream("/tmp/wd/b\xff").flush();  // named by its escape, as valid UTF-8
-  EXPECT_EQ(watch.Read(), "backup [etc/nas] #2 IN_CREATE /tmp/wd/b\\udcff");
+  EXPECT_EQ(watch.Read(), "backup [etc/nas] #3 IN_CREATE /tmp/wd/b\\udcff");
   EXPECT_EQ(watch.Stop(SIGINT), 0);
 
-  // Kept records come first with --since; the daemon's going away ends
-  // the watch with status 1.
+  // Kept records come first with --since (the first, of the daemon's
+  // first start, asks for a rescan of the tree); the daemon's going away
+  // ends the watch with status 1.
   zorv_test::ChildProcess json(
       {ZORVNOTIFYCTL_PATH, "--json", "--since", "0", "--socket", socket, "watch", "backup", "nas"},
       nullptr, true);
   EXPECT_EQ(Parse(json.Read())["reply"], "subscribe");
+  EXPECT_EQ(Parse(json.Read())["rescan"], "/tmp/wd");
   const Json::Value event = Parse(json.Read());
-  EXPECT_EQ(event["seq"], 1);
+  EXPECT_EQ(event["seq"], 2);
   EXPECT_EQ(event["path"], "/tmp/wd/new");
   EXPECT_THAT(json.Read(), ::testing::HasSubstr(R"("path":"/tmp/wd/b\udcff")"));
   EXPECT_EQ(RunTool("--socket " + socket + " status", "", &out, &err), 0) << err;
   EXPECT_THAT(out, ::testing::ContainsRegex("\nstate +ok\n"));
-  EXPECT_THAT(out, ::testing::ContainsRegex("\nbackup \\[etc/nas\\] +1 +2 +[0-9]+ +ok\n"));
+  EXPECT_THAT(out, ::testing::ContainsRegex("\nbackup \\[etc/nas\\] +1 +3 +[0-9]+ +ok\n"));
   EXPECT_EQ(daemon.Stop(SIGTERM), 0);
   EXPECT_THAT(json.Read(), ::testing::HasSubstr("zorvnotifyd closed the connection"));
   EXPECT_EQ(json.Stop(0), 1);
@@ -360,9 +362,9 @@ TEST(ZorvnotifyctlTest, WatchAndStatusAskTheDaemon) {
   zorv_test::ChildProcess again({ZORVNOTIFYD_PATH, "--socket", socket}, nullptr, true);
   ASSERT_THAT(again.WaitFor("ready:"), ::testing::HasSubstr("for 1 queues"));
   zorv_test::ChildProcess resumed(
-      {ZORVNOTIFYCTL_PATH, "--since", "1", "--socket", socket, "watch", "backup"}, nullptr, true);
+      {ZORVNOTIFYCTL_PATH, "--since", "2", "--socket", socket, "watch", "backup"}, nullptr, true);
   EXPECT_THAT(resumed.Read(), ::testing::HasSubstr("watching backup"));
-  EXPECT_EQ(resumed.Read(), "backup [etc/nas] #2 IN_CREATE /tmp/wd/b\\udcff");
+  EXPECT_EQ(resumed.Read(), "backup [etc/nas] #3 IN_CREATE /tmp/wd/b\\udcff");
   EXPECT_THAT(resumed.Read(),
               ::testing::MatchesRegex("backup \\[etc/nas\\] #[0-9]+ RESCAN /tmp/wd \\(what "
                                       "changed there is not known\\)"));

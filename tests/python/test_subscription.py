@@ -110,6 +110,8 @@ def serve(path, scripts):
     return thread, failures
 
 
+# Each daemon's first start over a tree records a rescan of it (seq 1), so a
+# queue's events are numbered from 2 here.
 class SubscriptionTest(unittest.TestCase):
     def test_events_come_in_order_with_their_bytes(self):
         # A queue name and a path that are not UTF-8, on the way in and out.
@@ -122,17 +124,17 @@ class SubscriptionTest(unittest.TestCase):
                 for base in (b"a", b"b", b"caf\xe9"):
                     touch(tree.encode() + b"/" + base)
                 got = take(subscription, 3)
-                self.assertEqual(got, [("event", 1, tree + "/a"), ("event", 2, tree + "/b"),
-                                       ("event", 3, tree + "/caf\udce9")])
+                self.assertEqual(got, [("event", 2, tree + "/a"), ("event", 3, tree + "/b"),
+                                       ("event", 4, tree + "/caf\udce9")])
                 self.assertEqual(got[2][2].encode("utf-8", "surrogateescape"),
                                  b"/tmp/py/order/caf\xe9")
             # The example prints the records still kept, escaped.
-            with subprocess.Popen([sys.executable, FOLLOW, "--socket", SOCKET, "--since", "1",
+            with subprocess.Popen([sys.executable, FOLLOW, "--socket", SOCKET, "--since", "2",
                                    name], stdout=subprocess.PIPE) as follow:
                 lines = [follow.stdout.readline() for _ in range(2)]
                 follow.terminate()
-            self.assertEqual(lines, [b"etc/py 2 event /tmp/py/order/b 256\n",
-                                     b"etc/py 3 event /tmp/py/order/caf\\udce9 256\n"])
+            self.assertEqual(lines, [b"etc/py 3 event /tmp/py/order/b 256\n",
+                                     b"etc/py 4 event /tmp/py/order/caf\\udce9 256\n"])
         finally:
             daemon.stop()
 
@@ -144,7 +146,7 @@ class SubscriptionTest(unittest.TestCase):
             with zorvnotifyd.Subscription(SOCKET) as subscription:
                 subscription.subscribe("r")
                 touch(tree + "/1")
-                self.assertEqual(take(subscription, 1), [("event", 1, tree + "/1")])
+                self.assertEqual(take(subscription, 1), [("event", 2, tree + "/1")])
                 journal = subscription.journal
                 self.assertRegex(journal, "^[0-9a-f]{32}$")
                 # Made while the daemon is away and just after it is back,
@@ -154,16 +156,17 @@ class SubscriptionTest(unittest.TestCase):
                 daemon = Daemon("--state-dir", "/tmp/py/state")
                 touch(tree + "/3")
                 got = take_until(subscription, tree + "/3")
-                self.assertEqual(got[-1:], [("event", 1 + len(got), tree + "/3")])
-                self.assertEqual([seq for _, seq, _ in got], list(range(2, 2 + len(got))))
+                self.assertEqual(got[-1:], [("event", 2 + len(got), tree + "/3")])
+                self.assertEqual([seq for _, seq, _ in got], list(range(3, 3 + len(got))))
                 self.assertEqual(subscription.journal, journal)
                 # Another journal: no resuming, a rescan of the whole queue,
                 # then the new numbering.
                 daemon.stop()
                 daemon = Daemon("--state-dir", "/tmp/py/other-state")
-                self.assertEqual(take(subscription, 1), [("rescan", 0, "")])
+                # (numbered as the daemon's last record, its own first-start rescan)
+                self.assertEqual(take(subscription, 1), [("rescan", 1, "")])
                 touch(tree + "/4")
-                self.assertEqual(take(subscription, 1), [("event", 1, tree + "/4")])
+                self.assertEqual(take(subscription, 1), [("event", 2, tree + "/4")])
                 self.assertNotEqual(subscription.journal, journal)
         finally:
             daemon.stop()
