@@ -606,9 +606,19 @@ bool WatchTree::ListWatched(const std::string& path, SnapshotListing* listing) {
 }
 
 void WatchTree::SaveSnapshot() {
-  if (snapshot_ == nullptr) return;
-  Relist();
-  snapshot_->Save();
+  if (snapshot_ != nullptr) snapshot_->Save();
+}
+
+bool WatchTree::Drain(EventSink& sink) {
+  // Enough rounds for any burst the kernel's queue holds; a flood that
+  // outlasts them leaves the saving of the snapshot to a later sync.
+  constexpr int kMaxRounds = 64;
+  for (int round = 0; round < kMaxRounds; ++round) {
+    bool failed = false;
+    if (pending_.empty() && !Fill(&failed)) return !failed;
+    if (!ReadEvents(sink)) return false;
+  }
+  return false;
 }
 
 void WatchTree::Relist() {

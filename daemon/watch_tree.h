@@ -126,12 +126,18 @@ class WatchTree {
     snapshot_ = snapshot;
     sink_ = sink;
   }
+  // Saves the snapshot as it stands in memory.
+  void SaveSnapshot();
   // Lists again every directory whose entries events changed since the
-  // last call (and every directory new to a tree), puts the listings in
-  // the snapshot, and saves it.  Events only mark directories: the
+  // last call (and every directory new to a tree) and puts the listings in
+  // the snapshot, without saving it.  Events only mark directories: the
   // listing and the status calls are paid here, once per directory and
   // save, never per event.
-  void SaveSnapshot();
+  void Relist();
+  // Reads and hands to |sink| every event the kernel has queued, as
+  // ReadEvents does, until the queue is found empty; false when it was not
+  // within a bound (a flood of events) or reading failed.
+  bool Drain(EventSink& sink);
 
  private:
   struct Watch {
@@ -188,9 +194,6 @@ class WatchTree {
   // entries as Found; with |compare| and a snapshot, compares it with the
   // snapshot instead.  False (with |why|) when the root cannot be opened.
   bool WatchRootTree(const std::string& root, WalkContext& context, std::string* why, bool compare);
-  // The listing half of SaveSnapshot: puts the directories marked into
-  // the snapshot, without saving it.
-  void Relist();
   // Tells sink_ to rescan each of |tops| not told already.
   void NoteUnwatched(const std::vector<std::string>& tops);
   // Lists the watched directory |path| into |listing|; false when it is

@@ -166,7 +166,6 @@ int Serve(const Options& options) {
                      [&journals] { return journals.Renew(); });
   }
   SyncTimer sync(options.sync_interval_ms);
-  sync.Join([&logs] { logs.Sync(); });
   Reporter reporter(logs, options.out);
   WatchTree tree(std::move(inotify), options.retry_seconds);
   std::string reason;
@@ -177,9 +176,19 @@ int Serve(const Options& options) {
   }
   Snapshot snapshot(std::move(snapshot_dir));
   tree.UseSnapshot(&snapshot, &reporter);
-  // After the journals: a change is in the snapshot only once the records
-  // that told it are durable.
-  sync.Join([&tree] { tree.SaveSnapshot(); });
+  // The snapshot never gets ahead of the journals.  A change seen by the
+  // listing had its event queued by then, so every queued event is read
+  // and its records written and synced before the listing is saved: a
+  // crash at any moment leaves each change in a journal, or still to be
+  // found by comparing with the older snapshot.  Under a flood that does
+  // not let the queue empty, the snapshot waits for a later sync.
+  sync.Join([&tree, &logs, &reporter] {
+    tree.Relist();
+    const bool drained = tree.Drain(reporter);
+    logs.WriteOut();
+    logs.Sync();
+    if (drained) tree.SaveSnapshot();
+  });
   Server server(options.server, logs, RandomId(), [&] {
     std::string status;
     AppendJsonNumber(&status, "directories", tree.size());
