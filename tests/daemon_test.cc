@@ -58,7 +58,6 @@ Json::Value ParseJson(const std::string& text, bool* ok = nullptr) {
 }
 
 // In a directory of root's that only root may write, as a socket's must be.
-constexpr const char* kSocketDir = "/tmp/zorvrun";
 constexpr const char* kSocket = "/tmp/zorvrun/zorvnotifyd.sock";
 
 // The daemon as a child process, listening on |socket| (nullptr: its
@@ -195,8 +194,6 @@ class DaemonTest : public ::testing::Test {
   void SetUp() override {
     ZORV_REQUIRE_SANDBOX();
     zorv_test::ResetStore();
-    mkdir(kSocketDir, 0755);
-    ASSERT_EQ(chmod(kSocketDir, 0755), 0);
   }
 };
 

@@ -12,21 +12,8 @@
 #include <tuple>
 
 #include "monitor_queue.h"
+#include "support/allocation_count.h"
 #include "support/syslog_capture.h"
-
-// Counting replacements of the global allocation functions (the array forms
-// reach them, the aligned forms stay with the runtime).  Blocks come from
-// malloc, so a sanitizer still pairs them; the release stays out of line so
-// that the compiler does not pair a new-expression with free().
-static long g_allocations = 0;
-[[gnu::noinline]] static void Release(void* block) noexcept { std::free(block); }
-void* operator new(std::size_t size) {
-  ++g_allocations;
-  if (void* block = std::malloc(size == 0 ? 1 : size)) return block;
-  throw std::bad_alloc();
-}
-void operator delete(void* block) noexcept { Release(block); }
-void operator delete(void* block, std::size_t) noexcept { Release(block); }
 
 namespace ZORV::ZORVNOTIFYD {
 
@@ -129,16 +116,16 @@ TEST(MatchingTest, PreparedQueriesMakeNoHeapAllocation) {
   const std::string paths[] = {root + "/archive/2024/report.txt", root + "/drafts/report.txt~",
                                root + "/archivex", "/volume2/share/documents/x"};
   const std::string dirs[] = {"/volume1/share", root + "/archive/2024", "/volume1/sh"};
-  const long unprepared = g_allocations;
+  const long unprepared = zorv_test::Allocations();
   for (const std::string& path : paths) queue.IsMonitoring(path, 1);  // prepares both
   ASSERT_TRUE(queue._configs[0]._prepared && queue._configs[1]._prepared);
-  ASSERT_GT(g_allocations, unprepared);  // the library's allocations are counted
+  ASSERT_GT(zorv_test::Allocations(), unprepared);  // the library's allocations are counted
   int answers = 0;
-  const long before = g_allocations;
+  const long before = zorv_test::Allocations();
   for (const std::string& path : paths)
     answers += queue.IsMonitoring(path, 1) + queue.IsMonitoring(path, 4);
   for (const std::string& dir : dirs) answers += queue.IsDirMonitoring(dir);
-  EXPECT_EQ(g_allocations - before, 0);
+  EXPECT_EQ(zorv_test::Allocations() - before, 0);
   EXPECT_EQ(answers, 3);  // report.txt, archivex and /volume1/share
 }
 

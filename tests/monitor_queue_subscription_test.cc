@@ -23,27 +23,15 @@
 
 #include "monitor_queue.h"
 #include "monitor_queue_subscription.h"
+#include "support/allocation_count.h"
 #include "support/child_process.h"
 #include "support/sandbox.h"
-
-// Counting replacements of the global allocation functions, as in
-// matching_test.cc.
-static long g_allocations = 0;
-[[gnu::noinline]] static void Release(void* block) noexcept { std::free(block); }
-void* operator new(std::size_t size) {
-  ++g_allocations;
-  if (void* block = std::malloc(size == 0 ? 1 : size)) return block;
-  throw std::bad_alloc();
-}
-void operator delete(void* block) noexcept { Release(block); }
-void operator delete(void* block, std::size_t) noexcept { Release(block); }
 
 namespace {
 
 using namespace ZORV::ZORVNOTIFYD;  // NOLINT
 using Lines = std::vector<std::string>;
 
-constexpr const char* kSocketDir = "/tmp/zorvrun";
 constexpr const char* kSocket = "/tmp/zorvrun/zorvnotifyd.sock";
 
 class SubscriptionTest : public ::testing::Test {
@@ -51,8 +39,6 @@ class SubscriptionTest : public ::testing::Test {
   void SetUp() override {
     ZORV_REQUIRE_SANDBOX();
     zorv_test::ResetStore();
-    mkdir(kSocketDir, 0755);
-    ASSERT_EQ(chmod(kSocketDir, 0755), 0);
   }
 };
 
@@ -280,11 +266,11 @@ TEST_F(SubscriptionTest, ReadsWhatTheDaemonSaysAndResumesOrRescans) {
   }
   // Warmed up: no allocation per event.
   MonitorQueueEvent event;
-  const long before = g_allocations;
+  const long before = zorv_test::Allocations();
   int count = 0;
   for (int seq = 13; seq < 203; ++seq)
     count += sub.Next(event, 10000) && event._seq == uint64_t(seq);
-  EXPECT_EQ(g_allocations - before, 0);
+  EXPECT_EQ(zorv_test::Allocations() - before, 0);
   EXPECT_EQ(count, 190);
   EXPECT_EQ(Next(sub), "MISSED 7");  // after the repeat of 150, dropped
   EXPECT_EQ(Next(sub), "LOST 203 ");

@@ -99,6 +99,10 @@ void ResetStore() {
   }
   fs::create_directories(kDir);
   fs::remove(kDir + "status");
+  // Where the tests' daemons listen: root's and writable by root alone, as
+  // the daemon requires of its socket's directory (/tmp itself is not).
+  fs::create_directories(kSocketDir);
+  fs::permissions(kSocketDir, fs::perms(0755));
   WriteFile("/usr/bin/systemctl", kScript, 0755);
   WriteFile(kDir + "calls", "", 0666);
   WriteFile(kDir + "procs", "", 0666);

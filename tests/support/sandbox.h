@@ -34,6 +34,10 @@ const char* SandboxSkipReason();
 // the test).  Needs effective root; does nothing when the sandbox is inactive.
 void ResetStore();
 
+// A directory for the tests' daemon sockets, made (root's, 0755) by
+// ResetStore.
+constexpr const char* kSocketDir = "/tmp/zorvrun";
+
 // The arguments of every fake systemctl call since the last ResetStore, one
 // entry per call, joined by single spaces ("--no-block start zorvnotifyd").
 std::vector<std::string> SystemctlCalls();
