@@ -2,6 +2,7 @@
 
 #include "json_bytes.h"
 
+#include <cstdint>
 #include <cstdio>
 #include <utility>
 
@@ -41,7 +42,8 @@ size_t Utf8SequenceLength(std::string_view text) {
   return length;
 }
 
-void AppendJsonString(std::string* out, std::string_view text) {
+bool AppendJsonString(std::string* out, std::string_view text) {
+  bool raw = false;
   out->push_back('"');
   for (size_t i = 0; i < text.size();) {
     const auto byte = static_cast<unsigned char>(text[i]);
@@ -76,6 +78,7 @@ void AppendJsonString(std::string* out, std::string_view text) {
         break;
       default: {
         // A control byte as \u00XX; a byte outside UTF-8 as \udcXY.
+        raw = raw || byte >= 0x80;
         char escaped[7];
         snprintf(escaped, sizeof(escaped), "\\u%s%02x", byte < 0x80 ? "00" : "dc", byte);
         out->append(escaped);
@@ -83,6 +86,24 @@ void AppendJsonString(std::string* out, std::string_view text) {
     }
   }
   out->push_back('"');
+  return raw;
+}
+
+void AppendBase64(std::string* out, std::string_view bytes) {
+  static const char kDigits[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
+  const auto at = [&bytes](size_t i) { return static_cast<unsigned char>(bytes[i]); };
+  size_t i = 0;
+  for (; i + 3 <= bytes.size(); i += 3) {
+    const uint32_t group = (uint32_t{at(i)} << 16) | (uint32_t{at(i + 1)} << 8) | at(i + 2);
+    for (int shift = 18; shift >= 0; shift -= 6) out->push_back(kDigits[(group >> shift) & 63]);
+  }
+  const size_t left = bytes.size() - i;
+  if (left == 0) return;
+  const uint32_t group = (uint32_t{at(i)} << 16) | (left == 2 ? uint32_t{at(i + 1)} << 8 : 0);
+  out->push_back(kDigits[group >> 18]);
+  out->push_back(kDigits[(group >> 12) & 63]);
+  out->push_back(left == 2 ? kDigits[(group >> 6) & 63] : '=');
+  out->push_back('=');
 }
 
 std::string DecodeRawBytes(std::string_view text) {

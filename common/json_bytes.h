@@ -27,8 +27,14 @@ size_t Utf8SequenceLength(std::string_view text);
 
 // Appends |text| to |out| as a JSON string, quotes included: '"', '\' and
 // control bytes escaped (\n, \t, ... or \u00XX), each byte that is not part
-// of valid UTF-8 as \udcXY, valid UTF-8 as it is.
-void AppendJsonString(std::string* out, std::string_view text);
+// of valid UTF-8 as \udcXY, valid UTF-8 as it is.  True when some byte was
+// not UTF-8, so that a caller learns it without a second pass.
+bool AppendJsonString(std::string* out, std::string_view text);
+
+// Appends the standard base64 of |bytes| (RFC 4648 section 4, with "="
+// padding, no line breaks).  A reader that loses a lone surrogate (most do
+// other than Python's) gets the exact bytes of a name back from it.
+void AppendBase64(std::string* out, std::string_view bytes);
 
 // |text| with each UTF-8 encoding of a code point U+DC80 to U+DCFF (the
 // bytes ED B2 80 to ED B3 BF, which a JSON reader makes of "\udc80" to

@@ -19,6 +19,18 @@ void AppendJsonField(std::string* out, const char* key, std::string_view text) {
   AppendJsonString(out, text);
 }
 
+void AppendJsonBytesField(std::string* out, const char* key, std::string_view bytes) {
+  out->push_back('"');
+  out->append(key);
+  out->append("\":");
+  if (!zorvcommon::AppendJsonString(out, bytes)) return;
+  out->append(",\"");
+  out->append(key);
+  out->append("_b64\":\"");
+  zorvcommon::AppendBase64(out, bytes);
+  out->push_back('"');
+}
+
 void AppendJsonNumber(std::string* out, const char* key, uint64_t value) {
   char digits[24];
   const char* const end = std::to_chars(digits, digits + sizeof(digits), value).ptr;

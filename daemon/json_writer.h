@@ -18,6 +18,12 @@ void AppendJsonString(std::string* out, std::string_view text);
 // Appends "KEY": and |text| as a JSON string (KEY is written as it is).
 void AppendJsonField(std::string* out, const char* key, std::string_view text);
 
+// Appends "KEY": and |bytes| as a JSON string, as AppendJsonField does;
+// when |bytes| is not valid UTF-8 (a name or path straight from a file
+// system or a queue file), also ,"KEY_b64": and the base64 of the exact
+// bytes, which every reader can decode.  Valid UTF-8 costs no second pass.
+void AppendJsonBytesField(std::string* out, const char* key, std::string_view bytes);
+
 // Appends "KEY": and the decimal |value|.
 void AppendJsonNumber(std::string* out, const char* key, uint64_t value);
 

@@ -29,11 +29,11 @@ QueueLog::QueueLog(QueueType type, std::string file, std::string name, size_t ke
       keep_(keep),
       next_seq_(last_seq + 1) {
   head_ = "{";
-  AppendJsonField(&head_, "queue", name_);
+  AppendJsonBytesField(&head_, "queue", name_);
   head_ += ',';
   AppendJsonField(&head_, "type", zorvcommon::QueueTypeName(type_));
   head_ += ',';
-  AppendJsonField(&head_, "file", file_);
+  AppendJsonBytesField(&head_, "file", file_);
   head_ += ',';
 }
 
@@ -56,7 +56,7 @@ LogRecord& QueueLog::Next(uint64_t order) {
 void QueueLog::AddEvent(const std::string& path, uint32_t mask, uint64_t order, bool offline) {
   std::string& line = Next(order).line;
   line += ',';
-  AppendJsonField(&line, "path", path);
+  AppendJsonBytesField(&line, "path", path);
   line += ',';
   AppendJsonNumber(&line, "mask", mask);
   line += offline ? ",\"offline\":true}\n" : "}\n";
@@ -79,7 +79,7 @@ void QueueLog::AddRescans(uint64_t order) {
 void QueueLog::AddRescan(const std::string& path, uint64_t order) {
   std::string& line = Next(order).line;
   line += ',';
-  AppendJsonField(&line, "rescan", path);
+  AppendJsonBytesField(&line, "rescan", path);
   line += "}\n";
   Keep(records_.back());
 }
@@ -235,11 +235,11 @@ void QueueLogs::AppendStatus(std::string* out) const {
     if (!first) *out += ',';
     first = false;
     *out += '{';
-    AppendJsonField(out, "queue", log->name());
+    AppendJsonBytesField(out, "queue", log->name());
     *out += ',';
     AppendJsonField(out, "type", zorvcommon::QueueTypeName(log->type()));
     *out += ',';
-    AppendJsonField(out, "file", log->file());
+    AppendJsonBytesField(out, "file", log->file());
     *out += ',';
     AppendJsonNumber(out, "first", log->journal()->first_seq());
     *out += ',';

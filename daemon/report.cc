@@ -27,11 +27,11 @@ void Head(const CatalogueQueue& entry, bool json, std::string* line) {
     return;
   }
   *line += '{';
-  AppendJsonField(line, "queue", entry.queue._name);
+  AppendJsonBytesField(line, "queue", entry.queue._name);
   *line += ',';
   AppendJsonField(line, "type", QueueTypeName(entry.type));
   *line += ',';
-  AppendJsonField(line, "file", entry.file);
+  AppendJsonBytesField(line, "file", entry.file);
   *line += ',';
 }
 
@@ -66,7 +66,7 @@ void Reporter::Record(size_t i, const std::string& path, uint32_t mask, uint64_t
   if (stdout_ == Stdout::kNone) return;
   Head(catalogue_[i], stdout_ == Stdout::kJson, &line_);
   if (stdout_ == Stdout::kJson) {
-    AppendJsonField(&line_, "path", path);
+    AppendJsonBytesField(&line_, "path", path);
     line_ += ',';
     AppendJsonNumber(&line_, "mask", mask);
     line_ += offline ? ",\"offline\":true}\n" : "}\n";
@@ -132,7 +132,7 @@ void Reporter::Lost() {
     for (const std::string& tree : log->trees) {
       Head(catalogue_[i], stdout_ == Stdout::kJson, &line_);
       if (stdout_ == Stdout::kJson) {
-        AppendJsonField(&line_, "rescan", tree);
+        AppendJsonBytesField(&line_, "rescan", tree);
         line_ += "}\n";
       } else {
         line_ += "RESCAN " + Printable(tree) + " (inotify queue overflow)\n";
@@ -165,7 +165,7 @@ void Reporter::Rescan(const std::string& path) {
     if (stdout_ == Stdout::kNone) continue;
     Head(catalogue_[i], stdout_ == Stdout::kJson, &line_);
     if (stdout_ == Stdout::kJson) {
-      AppendJsonField(&line_, "rescan", *what);
+      AppendJsonBytesField(&line_, "rescan", *what);
       line_ += "}\n";
     } else {
       line_ += "RESCAN " + Printable(*what) + "\n";

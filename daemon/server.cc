@@ -478,7 +478,7 @@ void Server::Subscribe(Client& client, const Subscription& subscription, bool ha
   *reply += ',';
   AppendJsonField(reply, "journal", logs_.journal_id());
   *reply += ',';
-  AppendJsonField(reply, "queue", subscription.name);
+  AppendJsonBytesField(reply, "queue", subscription.name);
   *reply += ",\"queues\":[";
   bool first = true;
   for (QueueLog* log :
@@ -489,7 +489,7 @@ void Server::Subscribe(Client& client, const Subscription& subscription, bool ha
     *reply += '{';
     AppendJsonField(reply, "type", zorvcommon::QueueTypeName(log->type()));
     *reply += ',';
-    AppendJsonField(reply, "file", log->file());
+    AppendJsonBytesField(reply, "file", log->file());
     *reply += ',';
     AppendJsonNumber(reply, "seq", log->last_seq());
     *reply += '}';

@@ -82,6 +82,8 @@ class ZORVNOTIFYD_EXPORT MonitorQueueSubscription {
   // As above, for the one queue of |type|, |file| and |name|.
   bool Subscribe(const std::string& name, _tag_monitor_queue_type_ type, const std::string& file,
                  uint64_t since);
+  // As above, for the one queue of |type|, |file| and |name|, from now on.
+  bool Subscribe(const std::string& name, _tag_monitor_queue_type_ type, const std::string& file);
 
   // A descriptor that is readable (poll, epoll, select) whenever Next has
   // something to do without waiting: a line received or already read, an
@@ -114,6 +116,15 @@ class ZORVNOTIFYD_EXPORT MonitorQueueSubscription {
   bool Connected() const;
   // What the last failure was; empty when there was none.
   const std::string& LastError() const;
+  // The daemon's line that answered the last Subscribe (its reply, with the
+  // queues it matched and their last numbers, or an {"error":..} line),
+  // without the newline; empty when none came.
+  const std::string& Reply() const;
+  // The daemon's line of the record the last successful Next delivered,
+  // without the newline, for a program that keeps or passes on the
+  // daemon's own form; empty for a RESCAN the object made itself after a
+  // journal change.
+  const std::string& Line() const;
 
  private:
   std::unique_ptr<MonitorQueueSubscriptionData> data_;

@@ -516,7 +516,8 @@ class Client {
     return v;
   }
   // The next line as "queue seq path" ("queue seq KEY" for a notice,
-  // "queue seq rescan PATH", "queue missed N"), "" when none came.
+  // "queue seq rescan PATH", "queue missed N"), "" when none came; a
+  // path's base64 form follows as " b64:B64" when the line has one.
   std::string Line() {
     const Json::Value v = Next();
     if (!v.isObject()) return "";
@@ -527,7 +528,8 @@ class Client {
       if (v.isMember(notice)) return line + " " + notice;
     }
     if (v.isMember("rescan")) return line + " rescan " + v["rescan"].asString();
-    return line + " " + v["path"].asString();
+    line += " " + v["path"].asString();
+    return v.isMember("path_b64") ? line + " b64:" + v["path_b64"].asString() : line;
   }
 
  private:
@@ -597,7 +599,10 @@ TEST_F(DaemonTest, DeliversEachQueueItsEventsToItsSubscribers) {
   Register("b", "/tmp/s/b", kCreate);
   EXPECT_EQ(b.Line(), "b 4 registered");
   ASSERT_TRUE(Put("/tmp/s/b/y", "x"));
-  EXPECT_EQ(b.Line(), "b 5 /tmp/s/b/y");
+  EXPECT_EQ(b.Line(), "b 5 /tmp/s/b/y");  // UTF-8: no base64 beside it
+  ASSERT_TRUE(Put("/tmp/s/b/caf\xe9", "x"));
+  line = b.Line();  // a name that is not UTF-8 comes with its exact bytes
+  EXPECT_EQ(line.substr(line.find(" b64:") + 1), "b64:L3RtcC9zL2IvY2Fm6Q==") << line;
 
   // Root only: by the socket's mode, and by the peer's credentials should
   // the mode be opened up.

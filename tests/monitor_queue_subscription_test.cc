@@ -226,11 +226,14 @@ TEST_F(SubscriptionTest, ReadsWhatTheDaemonSaysAndResumesOrRescans) {
        head +
        R"("seq":205,"path":"/\udc41","mask":1})"
        "\n" +
+       head +
+       R"("seq":205,"path":"/b","path_b64":"L3X=","mask":1})"
+       "\n" +
        R"({"error":"too many"})"
        "\n" +
        R"({"queue":"r","type":"share","file":"g","seq":1,"removed":true})"
        "\n" +
-       R"({"queue":"r","type":"local-etc","file":"g","seq":1,"rescan":"/t"})"
+       R"({"queue":"r","type":"local-etc","file":"g","seq":1,"rescan":"/t","rescan_b64":"L3Xp"})"
        "\n" +
        std::string((1 << 20) + 1, 'x') + "\n" + head +
        R"("seq":300,"path":"/lost","mask":1})"
@@ -276,11 +279,11 @@ TEST_F(SubscriptionTest, ReadsWhatTheDaemonSaysAndResumesOrRescans) {
   EXPECT_EQ(Next(sub), "LOST 203 ");
   EXPECT_EQ(Next(sub), "EVENT 204 /caf\xe9 \xf0\x9f\x98\x80\n 2 offline");
   // Each malformed line skipped (a string number, a mask beyond 32 bits, a
-  // repeated member, a lone surrogate that is no byte), the error line
-  // told.
+  // repeated member, a lone surrogate that is no byte, base64 with bits
+  // beyond its bytes), the error line told.
   EXPECT_EQ(Next(sub), "REMOVED [r 0 g] 1 ");
   EXPECT_EQ(sub.LastError(), "the daemon says: too many");
-  EXPECT_EQ(Next(sub), "RESCAN [r 2 g] 1 /t");
+  EXPECT_EQ(Next(sub), "RESCAN [r 2 g] 1 /u\xe9");  // the base64 bytes win
   // The overlong line ends the connection; the next resumes after 204 and
   // drops it; then a new journal: RESCAN for each followed queue, and the
   // new numbering.

@@ -332,8 +332,8 @@ TEST(ZorvnotifyctlTest, WatchAndStatusAskTheDaemon) {
   EXPECT_EQ(watch.Stop(SIGINT), 0);
 
   // Kept records come first with --since (the first, of the daemon's
-  // first start, asks for a rescan of the tree); the daemon's going away
-  // ends the watch with status 1.
+  // first start, asks for a rescan of the tree); the watch outlives the
+  // daemon and follows it again across a restart.
   zorv_test::ChildProcess json(
       {ZORVNOTIFYCTL_PATH, "--json", "--since", "0", "--socket", socket, "watch", "backup", "nas"},
       nullptr, true);
@@ -347,8 +347,9 @@ TEST(ZorvnotifyctlTest, WatchAndStatusAskTheDaemon) {
   EXPECT_THAT(out, ::testing::ContainsRegex("\nstate +ok\n"));
   EXPECT_THAT(out, ::testing::ContainsRegex("\nbackup \\[etc/nas\\] +1 +3 +[0-9]+ +ok\n"));
   EXPECT_EQ(daemon.Stop(SIGTERM), 0);
-  EXPECT_THAT(json.Read(), ::testing::HasSubstr("zorvnotifyd closed the connection"));
-  EXPECT_EQ(json.Stop(0), 1);
+  EXPECT_EQ(json.Read(),
+            "zorvnotifyctl: zorvnotifyd went away (the daemon closed the connection); "
+            "following again once it is back");
 
   // Across a restart --since resumes where the watch stopped; a journal
   // found cut short makes the queue rescan its tree.
@@ -367,6 +368,9 @@ TEST(ZorvnotifyctlTest, WatchAndStatusAskTheDaemon) {
               ::testing::MatchesRegex("backup \\[etc/nas\\] #[0-9]+ RESCAN /tmp/wd \\(what "
                                       "changed there is not known\\)"));
   EXPECT_EQ(resumed.Stop(SIGINT), 0);
+  EXPECT_EQ(json.Read(), "zorvnotifyctl: zorvnotifyd is back; following again");
+  EXPECT_THAT(json.Read(), ::testing::HasSubstr(R"("rescan":"/tmp/wd")"));
+  EXPECT_EQ(json.Stop(SIGINT), 0);
   EXPECT_EQ(again.Stop(SIGTERM), 0);
 }
 

@@ -3,6 +3,7 @@
 #include "commands.h"
 
 #include <fcntl.h>
+#include <poll.h>
 #include <signal.h>
 #include <sys/signalfd.h>
 #include <sys/stat.h>
@@ -28,6 +29,7 @@
 #include "masks.h"
 #include "monitor_queue.h"
 #include "monitor_queue_index.h"
+#include "monitor_queue_subscription.h"
 #include "queue_file_name.h"
 #include "queue_files.h"
 #include "queue_object.h"
@@ -37,7 +39,9 @@ namespace zorvnotifyctl {
 namespace {
 
 using ZORV::ZORVNOTIFYD::MonitorQueue;
+using ZORV::ZORVNOTIFYD::MonitorQueueEvent;
 using ZORV::ZORVNOTIFYD::MonitorQueueIndex;
+using ZORV::ZORVNOTIFYD::MonitorQueueSubscription;
 using zorvcommon::Quoted;
 
 // Set once an upsert or delete has been stored.
@@ -293,11 +297,8 @@ bool ParseLine(const std::string& line, Json::Value* value) {
 // Connects to the daemon, sends |request| and reads the first line of the
 // answer, parsed into |reply|: an object whose "reply" is |kind|.  A refusal
 // ({"error": ...}) or anything else is reported (exit status 1).
-// When |stop_fd| (see DaemonClient::ReadLine) ends the wait, returns false
-// with |status| 0.
 bool Ask(DaemonClient* client, const Invocation& invocation, const Json::Value& request,
-         const char* kind, int timeout_ms, int stop_fd, Json::Value* reply, std::string* line,
-         int* status) {
+         const char* kind, int timeout_ms, Json::Value* reply, std::string* line, int* status) {
   std::string error;
   if (!client->Connect(invocation.socket, &error)) {
     *status = Fail(kExitRefused, error);
@@ -306,12 +307,9 @@ bool Ask(DaemonClient* client, const Invocation& invocation, const Json::Value& 
   // A refused peer gets its error line and is let go before the request is
   // read: the line is looked for even when sending failed.
   const bool sent = client->Send(JsonLine(request), &error);
-  switch (client->ReadLine(line, timeout_ms, stop_fd, &error)) {
+  switch (client->ReadLine(line, timeout_ms, &error)) {
     case DaemonClient::Read::kLine:
       break;
-    case DaemonClient::Read::kStopped:
-      *status = kExitOk;
-      return false;
     case DaemonClient::Read::kClosed:
       if (sent) error = "zorvnotifyd closed the connection without answering";
       [[fallthrough]];
@@ -348,49 +346,57 @@ bool QueueLabel(const Json::Value& value, std::string* label) {
   return true;
 }
 
-// The readable form of a line of a subscription; the line itself, escaped,
-// when it is not one the tool knows.
-std::string ReadableRecord(const std::string& line) {
-  Json::Value parsed;
-  const Json::Value& value = parsed;  // read only: no member is added
-  std::string label;
-  if (!ParseLine(line, &parsed) || !QueueLabel(value, &label)) return Printable(line);
-  const Json::Value& missed = value["missed"];
-  if (missed.isUInt64()) {
-    return label + " MISSED " + std::to_string(missed.asUInt64()) + " events (no longer kept)";
+// The readable form of a record of a subscription.
+std::string ReadableRecord(const MonitorQueueEvent& event) {
+  std::string label = Printable(event._queue) + " [" + QueueTypeName(event._type) + "/" +
+                      Printable(event._file) + "]";
+  if (event._kind == MonitorQueueEvent::MISSED) {
+    return label + " MISSED " + std::to_string(event._missed) + " events (no longer kept)";
   }
-  const Json::Value& seq = value["seq"];
-  if (!seq.isUInt64()) return Printable(line);
-  label += " #" + std::to_string(seq.asUInt64()) + " ";
-  const Json::Value& path = value["path"];
-  const Json::Value& mask = value["mask"];
-  if (path.isString() && mask.isUInt()) {
-    return label + zorvcommon::MaskNames(mask.asUInt()) + " " + Shown(path) +
-           (value["offline"] == true ? " (offline: changed while zorvnotifyd was not watching)"
-                                     : "");
+  label += " #" + std::to_string(event._seq) + " ";
+  switch (event._kind) {
+    case MonitorQueueEvent::EVENT:
+      return label + zorvcommon::MaskNames(event._mask) + " " + Printable(event._path) +
+             (event._offline ? " (offline: changed while zorvnotifyd was not watching)" : "");
+    case MonitorQueueEvent::RESCAN:
+      return label + "RESCAN " + Printable(event._path) + " (what changed there is not known)";
+    case MonitorQueueEvent::LOST:
+      return label + "LOST events may have been lost (inotify queue overflow)";
+    case MonitorQueueEvent::REMOVED:
+      return label + "removed from the catalogue";
+    default:
+      return label + "registered again";
   }
-  const Json::Value& rescan = value["rescan"];
-  if (rescan.isString()) {
-    return label + "RESCAN " + Shown(rescan) + " (what changed there is not known)";
-  }
-  if (value["lost"] == true) {
-    return label + "LOST events may have been lost (inotify queue overflow)";
-  }
-  if (value["removed"] == true) return label + "removed from the catalogue";
-  if (value["registered"] == true) return label + "registered again";
-  return Printable(line);
+}
+
+// The JSON line of a record the subscription made itself (a RESCAN of the
+// whole trees after the daemon's journal changed), in the daemon's form
+// without "seq".
+std::string MadeRecordLine(const MonitorQueueEvent& event) {
+  std::string line = "{\"queue\":";
+  zorvcommon::AppendJsonString(&line, event._queue);
+  line += ",\"type\":\"";
+  line += QueueTypeName(event._type);
+  line += "\",\"file\":";
+  zorvcommon::AppendJsonString(&line, event._file);
+  line += ",\"rescan\":";
+  zorvcommon::AppendJsonString(&line, event._path);
+  return line + "}";
 }
 
 // "watching QUEUE: TYPE/FILE (last #N), ...; journal ID", from the
 // subscribe reply: with the journal id and the last number, a client
 // resumes with --since after a restart of the daemon.
-std::string ReadableSubscription(const Json::Value& reply, const std::string& name) {
+// Only the queues of |type| are named when it is not null.
+std::string ReadableSubscription(const Json::Value& reply, const std::string& name,
+                                 const char* type_only) {
   std::string queues;
   for (const Json::Value& queue : reply["queues"]) {
     const Json::Value& type = queue["type"];
     const Json::Value& file = queue["file"];
     const Json::Value& seq = queue["seq"];
     if (!type.isString() || !file.isString() || !seq.isUInt64()) continue;
+    if (type_only != nullptr && type != type_only) continue;
     if (!queues.empty()) queues += ", ";
     queues += Shown(type) + "/" + Shown(file) + " (last #" + std::to_string(seq.asUInt64()) + ")";
   }
@@ -619,41 +625,97 @@ int RunShares(const Invocation& invocation) {
   return status;
 }
 
+namespace {
+
+// Why |subscription| lost the daemon, without the time-out Next adds.
+std::string WhyAway(const MonitorQueueSubscription& subscription) {
+  static const std::string kTimedOut = "timed out while reconnecting: ";
+  const std::string& error = subscription.LastError();
+  return Printable(
+      error.compare(0, kTimedOut.size(), kTimedOut) == 0 ? error.substr(kTimedOut.size()) : error);
+}
+
+}  // namespace
+
 int RunWatch(const Invocation& invocation) {
   const std::string& name = invocation.args[0];
   const bool has_file = invocation.args.size() > 1;
   int status = kExitOk;
   if (has_file && !CheckFileName(invocation.args[1], &status)) return status;
-  Json::Value request(Json::objectValue);
-  request["request"] = "subscribe";
-  request["queue"] = name;
-  if (invocation.type_given) request["type"] = QueueTypeName(invocation.type);
-  if (has_file) request["file"] = invocation.args[1];
-  if (invocation.since_given) request["since"] = Json::UInt64(invocation.since);
   const StopSignals stop;
-  DaemonClient client;
-  Json::Value reply;
-  std::string line;
-  if (!Ask(&client, invocation, request, "subscribe", -1, stop.fd, &reply, &line, &status)) {
-    return status;
+  MonitorQueueSubscription subscription(invocation.socket);
+  bool subscribed;
+  if (has_file && invocation.since_given) {
+    subscribed =
+        subscription.Subscribe(name, invocation.type, invocation.args[1], invocation.since);
+  } else if (has_file) {
+    subscribed = subscription.Subscribe(name, invocation.type, invocation.args[1]);
+  } else if (invocation.since_given) {
+    subscribed = subscription.Subscribe(name, invocation.since);
+  } else {
+    subscribed = subscription.Subscribe(name);
   }
-  std::string shown = invocation.json ? line : ReadableSubscription(reply, name);
-  for (;;) {
-    // One line at a time, flushed, so that a reader sees each event as it
-    // comes; a failed write is reported by main().
-    if (!(std::cout << shown << '\n' << std::flush)) return kExitRefused;
-    std::string error;
-    switch (client.ReadLine(&line, -1, stop.fd, &error)) {
-      case DaemonClient::Read::kLine:
-        break;
-      case DaemonClient::Read::kStopped:
-        return kExitOk;
-      case DaemonClient::Read::kClosed:
-        return Fail(kExitRefused, "zorvnotifyd closed the connection");
-      default:
-        return Fail(kExitRefused, error);
+  Json::Value reply;
+  const bool parsed = ParseLine(subscription.Reply(), &reply);
+  if (!subscribed) {
+    const Json::Value& answer = reply;  // read only: no member is added
+    if (parsed && answer["error"].isString()) {
+      return Fail(kExitRefused, "zorvnotifyd refused: " + Shown(answer["error"]));
     }
-    shown = invocation.json ? line : ReadableRecord(line);
+    // The tool's own words for a daemon that is not there or not root's.
+    DaemonClient client;
+    std::string error;
+    if (!subscription.Connected() && !client.Connect(invocation.socket, &error)) {
+      return Fail(kExitRefused, error);
+    }
+    return Fail(kExitRefused, "cannot subscribe: " + Printable(subscription.LastError()));
+  }
+  // With --type and no file every queue of the name is followed, and those
+  // of other types are left out here.
+  const char* type_only =
+      invocation.type_given && !has_file ? QueueTypeName(invocation.type) : nullptr;
+  std::string shown =
+      invocation.json ? subscription.Reply() : ReadableSubscription(reply, name, type_only);
+  // One line at a time, flushed, so that a reader sees each event as it
+  // comes; a failed write is reported by main().
+  if (!(std::cout << shown << '\n' << std::flush)) return kExitRefused;
+  MonitorQueueEvent event;
+  bool connected = true;
+  for (;;) {
+    while (subscription.Next(event, 0)) {
+      if (!connected && subscription.Connected()) {
+        connected = true;
+        std::cerr << "zorvnotifyctl: zorvnotifyd is back; following again" << std::endl;
+      }
+      if (type_only != nullptr && event._type != invocation.type) continue;
+      if (!invocation.json) {
+        shown = ReadableRecord(event);
+      } else if (subscription.Line().empty()) {
+        shown = MadeRecordLine(event);
+      } else {
+        shown = subscription.Line();
+      }
+      if (!(std::cout << shown << '\n' << std::flush)) return kExitRefused;
+    }
+    if (connected != subscription.Connected()) {
+      connected = !connected;
+      std::cerr << "zorvnotifyctl: "
+                << (connected ? "zorvnotifyd is back; following again"
+                              : "zorvnotifyd went away (" + WhyAway(subscription) +
+                                    "); following again once it is back")
+                << std::endl;
+    }
+    // Readable when Next has something to do, the next reconnection
+    // included; a stop signal ends the watch between two records.
+    struct pollfd fds[2] = {{subscription.Fd(), POLLIN, 0}, {stop.fd, POLLIN, 0}};
+    if (fds[0].fd < 0) {
+      return Fail(kExitRefused,
+                  "cannot wait for zorvnotifyd: " + Printable(subscription.LastError()));
+    }
+    if (poll(fds, 2, -1) < 0 && errno != EINTR) {
+      return Fail(kExitRefused, std::string("cannot wait for zorvnotifyd: ") + strerror(errno));
+    }
+    if (fds[1].revents != 0) return kExitOk;
   }
 }
 
@@ -667,7 +729,7 @@ int RunStatus(const Invocation& invocation) {
   Json::Value reply;
   std::string line;
   int status = kExitOk;
-  if (!Ask(&client, invocation, request, "status", kTimeoutMs, -1, &reply, &line, &status)) {
+  if (!Ask(&client, invocation, request, "status", kTimeoutMs, &reply, &line, &status)) {
     return status;
   }
   if (invocation.json) {

@@ -81,8 +81,7 @@ bool DaemonClient::Send(const std::string& line, std::string* error) {
   return true;
 }
 
-DaemonClient::Read DaemonClient::ReadLine(std::string* line, int timeout_ms, int stop_fd,
-                                          std::string* error) {
+DaemonClient::Read DaemonClient::ReadLine(std::string* line, int timeout_ms, std::string* error) {
   using Clock = std::chrono::steady_clock;
   const Clock::time_point deadline = Clock::now() + std::chrono::milliseconds(timeout_ms);
   for (;;) {
@@ -102,14 +101,13 @@ DaemonClient::Read DaemonClient::ReadLine(std::string* line, int timeout_ms, int
           std::chrono::duration_cast<std::chrono::milliseconds>(deadline - Clock::now()).count();
       wait = static_cast<int>(left > 0 ? left : 0);
     }
-    struct pollfd fds[2] = {{fd_, POLLIN, 0}, {stop_fd, POLLIN, 0}};
-    const int ready = poll(fds, stop_fd >= 0 ? 2 : 1, wait);
+    struct pollfd fds = {fd_, POLLIN, 0};
+    const int ready = poll(&fds, 1, wait);
     if (ready < 0 && errno == EINTR) continue;
     if (ready < 0) {
       *error = std::string("cannot wait for zorvnotifyd: ") + strerror(errno);
       return Read::kFailed;
     }
-    if (stop_fd >= 0 && fds[1].revents != 0) return Read::kStopped;
     if (ready == 0) {
       *error = "zorvnotifyd did not answer in time";
       return Read::kTimeout;

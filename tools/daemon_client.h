@@ -16,7 +16,6 @@ class DaemonClient {
 
   enum class Read {
     kLine,     // |line| holds the next line
-    kStopped,  // the stop descriptor became readable
     kTimeout,  // nothing came in time
     kClosed,   // the daemon closed the connection (a partial last line is dropped)
     kFailed,   // a read failed or a line was too long; |error| says which
@@ -38,10 +37,8 @@ class DaemonClient {
   bool Send(const std::string& line, std::string* error);
 
   // Waits for the next whole line, at most |timeout_ms| ms (negative: no
-  // limit).  |stop_fd|, when not negative, is watched too: once it is
-  // readable the wait ends with kStopped (lines already received are still
-  // returned first).
-  Read ReadLine(std::string* line, int timeout_ms, int stop_fd, std::string* error);
+  // limit).
+  Read ReadLine(std::string* line, int timeout_ms, std::string* error);
 
  private:
   int fd_ = -1;

@@ -118,7 +118,9 @@ constexpr CommandInfo kCommands[] = {
      "with --since N, first every event after number N the daemon's journal\n"
      "still keeps, across restarts of the daemon while the journal id stays the\n"
      "same (a new id: rescan, the numbers start afresh).  Runs until SIGINT or SIGTERM\n"
-     "(exit status 0) or until the daemon closes the connection (exit status 1).\n"
+     "(exit status 0); when the daemon goes away it says so on standard error,\n"
+     "connects again (100 ms, doubling up to 5 s) and goes on after the last event\n"
+     "shown of each queue.\n"
      "With --json: the subscription's reply, then the daemon's lines as they are,\n"
      "one JSON object per line.\n"},
     {"status", 0, 0, kDaemon, RunStatus, "",

@@ -34,6 +34,7 @@ What a Subscription guarantees:
 One Subscription is used by one thread at a time.
 """
 
+import base64
 import collections
 import json
 import select
@@ -102,12 +103,30 @@ def _is_int(value) -> bool:
     return isinstance(value, int) and not isinstance(value, bool) and value >= 0
 
 
+def _bytes_member(record: dict, key: str):
+    """record[key], or the exact bytes of its "KEY_b64" form when the daemon
+    sent one (a name that is not UTF-8), as str with surrogateescape.
+
+    Raises _Lost when that form is not standard base64.
+    """
+    encoded = record.get(key + "_b64")
+    if encoded is None:
+        return record.get(key)
+    try:
+        if not isinstance(encoded, str):
+            raise ValueError("not a string")
+        return base64.b64decode(encoded, validate=True).decode("utf-8", "surrogateescape")
+    except ValueError as e:  # binascii.Error is one
+        raise _Lost("a record whose %s_b64 is not base64" % key) from e
+
+
 def _event(record: dict) -> Optional[Event]:
     """The Event a record line holds; None for a kind this module does not know.
 
     Raises _Lost when the record is malformed.
     """
-    queue, type_, file = record.get("queue"), record.get("type"), record.get("file")
+    queue, type_, file = (_bytes_member(record, "queue"), record.get("type"),
+                          _bytes_member(record, "file"))
     seq = record.get("seq")
     if not all(isinstance(v, str) for v in (queue, type_, file)):
         raise _Lost("a record without its queue, type and file")
@@ -120,14 +139,15 @@ def _event(record: dict) -> Optional[Event]:
     if seq is None:
         return None
     if "path" in record:
-        path, mask = record["path"], record.get("mask")
+        path, mask = _bytes_member(record, "path"), record.get("mask")
         if not isinstance(path, str) or not _is_int(mask):
             raise _Lost("an event without its path and mask")
         return Event("event", queue, type_, file, seq, path, mask, record.get("offline") is True)
     if "rescan" in record:
-        if not isinstance(record["rescan"], str):
+        rescan = _bytes_member(record, "rescan")
+        if not isinstance(rescan, str):
             raise _Lost("a rescan record without its path")
-        return Event("rescan", queue, type_, file, seq, record["rescan"])
+        return Event("rescan", queue, type_, file, seq, rescan)
     for kind in ("lost", "removed", "registered"):
         if record.get(kind) is True:
             return Event(kind, queue, type_, file, seq)

@@ -127,7 +127,13 @@ struct MonitorQueueSubscriptionData {
   WireRecord record;
   std::vector<Wanted> wanted;
   std::vector<Followed> followed;
-  std::deque<MonitorQueueEvent> pending;  // delivered before any line
+  // Delivered before any line, each with its line (empty: made here).
+  std::deque<std::pair<MonitorQueueEvent, std::string>> pending;
+  const char* line_data = nullptr;  // the line NextRecord parsed last
+  size_t line_size = 0;
+  std::string line;    // the line of the event Next delivered last
+  std::string answer;  // the reply or error line AwaitReply found last
+  std::string reply;   // the line that answered the last Subscribe
   std::string journal, error, request;
   std::string failure;  // why the connection was lost or could not be made
   bool closed = false;
@@ -331,7 +337,11 @@ struct MonitorQueueSubscriptionData {
     const char* data;
     size_t size;
     while (lines.NextLine(&data, &size)) {
-      if (ParseWireRecord(data, size, &record)) return true;
+      if (ParseWireRecord(data, size, &record)) {
+        line_data = data;
+        line_size = size;
+        return true;
+      }
       error = "a line from the daemon is not well-formed; skipped";
     }
     return false;
@@ -342,15 +352,20 @@ struct MonitorQueueSubscriptionData {
   // (|error| says which).  Records read meanwhile wait in |pending|.
   bool AwaitReply(const char* kind) {
     const int64_t deadline = NowMs() + kReplyWaitMs;
+    answer.clear();
     while (socket.valid()) {
       while (NextRecord()) {
+        if ((record.has_reply && record.reply == kind) || record.has_error) {
+          answer.assign(line_data, line_size);
+        }
         if (record.has_reply && record.reply == kind) return true;
         if (record.has_error) {
           error = "the daemon says: " + record.error;
           return false;
         }
         MonitorQueueEvent event;
-        if (Handle(event)) pending.push_back(std::move(event));
+        if (Handle(event))
+          pending.emplace_back(std::move(event), std::string(line_data, line_size));
       }
       if (!Receive(deadline)) {
         error = std::string("no reply from the daemon to \"") + kind + "\" within 10 s";
@@ -388,7 +403,7 @@ struct MonitorQueueSubscriptionData {
                                 0,
                                 false,
                                 0};
-        pending.push_back(std::move(event));
+        pending.emplace_back(std::move(event), std::string());
         queue.last = 0;
       }
     }
@@ -436,7 +451,9 @@ struct MonitorQueueSubscriptionData {
       Disconnect("");
       return false;
     }
-    if (!AwaitReply("subscribe")) return false;
+    const bool replied = AwaitReply("subscribe");
+    reply.swap(answer);
+    if (!replied) return false;
     if (record.has_journal && journal.empty()) journal = record.journal;
     for (size_t i = 0; i < record.queue_count; ++i) {
       const subscription::WireQueue& listed = record.queues[i];
@@ -475,6 +492,13 @@ bool MonitorQueueSubscription::Subscribe(const std::string& name, uint64_t since
 }
 
 bool MonitorQueueSubscription::Subscribe(const std::string& name, _tag_monitor_queue_type_ type,
+                                         const std::string& file) {
+  const bool ok = data_->Subscribe(name, true, type, file, false, 0);
+  data_->Signal();
+  return ok;
+}
+
+bool MonitorQueueSubscription::Subscribe(const std::string& name, _tag_monitor_queue_type_ type,
                                          const std::string& file, uint64_t since) {
   const bool ok = data_->Subscribe(name, true, type, file, true, since);
   data_->Signal();
@@ -494,7 +518,8 @@ bool MonitorQueueSubscription::Next(MonitorQueueEvent& event, int timeout_ms) {
       return false;
     }
     if (!d.pending.empty()) {
-      event = std::move(d.pending.front());
+      event = std::move(d.pending.front().first);
+      d.line.swap(d.pending.front().second);
       d.pending.pop_front();
       d.Signal();
       return true;
@@ -502,6 +527,7 @@ bool MonitorQueueSubscription::Next(MonitorQueueEvent& event, int timeout_ms) {
     if (d.socket.valid()) {
       while (d.NextRecord()) {
         if (d.Handle(event)) {
+          d.line.assign(d.line_data, d.line_size);
           d.Signal();
           return true;
         }
@@ -541,6 +567,10 @@ void MonitorQueueSubscription::Close() {
 bool MonitorQueueSubscription::Connected() const { return data_->socket.valid(); }
 
 const std::string& MonitorQueueSubscription::LastError() const { return data_->error; }
+
+const std::string& MonitorQueueSubscription::Reply() const { return data_->reply; }
+
+const std::string& MonitorQueueSubscription::Line() const { return data_->line; }
 
 }  // namespace ZORVNOTIFYD
 }  // namespace ZORV

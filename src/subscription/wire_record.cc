@@ -266,6 +266,45 @@ bool ParseQueue(Parser& in, std::string& key, std::string& text, WireQueue* queu
   return type && file && seq;
 }
 
+// The bytes of standard base64 |text| (with its "=" padding) into |out|
+// (cleared first; its capacity is kept); false when |text| is not such.
+bool DecodeBase64(const std::string& text, std::string* out) {
+  out->clear();
+  if (text.size() % 4 != 0) return false;
+  uint32_t group = 0;
+  size_t padding = 0;
+  for (size_t i = 0; i < text.size(); ++i) {
+    const char c = text[i];
+    uint32_t digit;
+    if (c >= 'A' && c <= 'Z') {
+      digit = uint32_t(c - 'A');
+    } else if (c >= 'a' && c <= 'z') {
+      digit = uint32_t(c - 'a') + 26;
+    } else if (c >= '0' && c <= '9') {
+      digit = uint32_t(c - '0') + 52;
+    } else if (c == '+' || c == '/') {
+      digit = c == '+' ? 62 : 63;
+    } else if (c == '=' && i + 2 >= text.size() &&
+               (padding > 0 || i + 1 == text.size() || text[i + 1] == '=')) {
+      digit = 0;
+      ++padding;
+    } else {
+      return false;
+    }
+    if (padding > 0 && c != '=') return false;
+    group = (group << 6) | digit;
+    if (i % 4 == 3) {
+      // The bits after the last byte are 0: one text for each byte string.
+      if (padding > 0 && (group & (padding == 2 ? 0xffff : 0xff)) != 0) return false;
+      out->push_back(char(group >> 16));
+      if (padding < 2) out->push_back(char(group >> 8));
+      if (padding < 1) out->push_back(char(group));
+      group = 0;
+    }
+  }
+  return true;
+}
+
 }  // namespace
 
 bool ParseWireRecord(const char* data, size_t size, WireRecord* out) {
@@ -278,6 +317,9 @@ bool ParseWireRecord(const char* data, size_t size, WireRecord* out) {
   r.type = MONITOR_QUEUE_TYPE_SHARE_DIR;
   r.queue_count = 0;
   bool has_lost = false, has_removed = false, has_registered = false, has_offline = false;
+  // A name's "KEY_b64" holds its exact bytes: it wins over "KEY", in
+  // whichever order the two come.
+  bool queue_b64 = false, file_b64 = false, path_b64 = false, rescan_b64 = false;
 
   Parser in(data, size);
   std::string& name = r.scratch_key;
@@ -294,15 +336,21 @@ bool ParseWireRecord(const char* data, size_t size, WireRecord* out) {
       };
       bool ok;
       if (name == "queue") {
-        ok = once(&r.has_queue) && in.String(&r.queue);
+        ok = once(&r.has_queue) && in.String(queue_b64 ? &text : &r.queue);
+      } else if (name == "queue_b64") {
+        ok = once(&queue_b64) && in.String(&text) && DecodeBase64(text, &r.queue);
       } else if (name == "type") {
         ok = once(&r.has_type) && in.String(&text) && ParseType(text, &r.type);
       } else if (name == "file") {
-        ok = once(&r.has_file) && in.String(&r.file);
+        ok = once(&r.has_file) && in.String(file_b64 ? &text : &r.file);
+      } else if (name == "file_b64") {
+        ok = once(&file_b64) && in.String(&text) && DecodeBase64(text, &r.file);
       } else if (name == "seq") {
         ok = once(&r.has_seq) && in.Unsigned(UINT64_MAX, &r.seq);
       } else if (name == "path") {
-        ok = once(&r.has_path) && in.String(&r.path);
+        ok = once(&r.has_path) && in.String(path_b64 ? &text : &r.path);
+      } else if (name == "path_b64") {
+        ok = once(&path_b64) && in.String(&text) && DecodeBase64(text, &r.path);
       } else if (name == "mask") {
         uint64_t mask = 0;
         ok = once(&r.has_mask) && in.Unsigned(UINT32_MAX, &mask);
@@ -310,7 +358,9 @@ bool ParseWireRecord(const char* data, size_t size, WireRecord* out) {
       } else if (name == "missed") {
         ok = once(&r.has_missed) && in.Unsigned(UINT64_MAX, &r.missed);
       } else if (name == "rescan") {
-        ok = once(&r.has_rescan) && in.String(&r.rescan);
+        ok = once(&r.has_rescan) && in.String(rescan_b64 ? &text : &r.rescan);
+      } else if (name == "rescan_b64") {
+        ok = once(&rescan_b64) && in.String(&text) && DecodeBase64(text, &r.rescan);
       } else if (name == "lost") {
         ok = once(&has_lost) && in.Bool(&r.lost);
       } else if (name == "removed") {

@@ -45,8 +45,10 @@ struct WireRecord {
 // "missed" whole numbers, "mask" one of 32 bits, the notices booleans,
 // "type" "share", "etc" or "local-etc"); unknown members of any JSON type
 // are skipped (nested at most 16 levels).  A \udcXY escape stands for the
-// byte XY; other lone surrogates are refused.  False when the text is not
-// such an object.
+// byte XY; other lone surrogates are refused.  "queue_b64", "file_b64",
+// "path_b64" and "rescan_b64", standard base64 of a name's exact bytes,
+// take the place of their member's text.  False when the text is not such
+// an object.
 bool ParseWireRecord(const char* data, size_t size, WireRecord* out);
 
 }  // namespace subscription
