@@ -30,8 +30,8 @@
 #include <unistd.h>
 
 #include <algorithm>
-#include <array>
 
+#include "checksum.h"
 #include "text.h"
 
 namespace zorvnotifyd {
@@ -44,22 +44,6 @@ constexpr size_t kRecordHead = 8;  // length and checksum
 // Garbage a file may hold beyond twice its live records before it is
 // written afresh: small trees are not rewritten for every few changes.
 constexpr uint64_t kCompactSlack = 1 << 20;
-
-// CRC-32 (the polynomial of zlib and Ethernet) of |size| bytes at |data|.
-uint32_t Crc32(const char* data, size_t size) {
-  static const std::array<uint32_t, 256> table = [] {
-    std::array<uint32_t, 256> t{};
-    for (uint32_t i = 0; i < 256; ++i) {
-      uint32_t c = i;
-      for (int k = 0; k < 8; ++k) c = (c & 1) ? 0xEDB88320u ^ (c >> 1) : c >> 1;
-      t[i] = c;
-    }
-    return t;
-  }();
-  uint32_t crc = 0xFFFFFFFFu;
-  for (size_t i = 0; i < size; ++i) crc = table[(crc ^ uint8_t(data[i])) & 0xFF] ^ (crc >> 8);
-  return crc ^ 0xFFFFFFFFu;
-}
 
 template <typename T>
 void Append(std::string* out, T value) {
@@ -113,7 +97,7 @@ std::string FileName(const std::string& root) {
 // length and checksum go in the 8 bytes before it.
 void Seal(std::string* out, size_t start) {
   const uint32_t size = uint32_t(out->size() - start);
-  const uint32_t crc = Crc32(out->data() + start, size);
+  const uint32_t crc = Crc32(0, out->data() + start, size);
   for (int i = 0; i < 4; ++i) {
     (*out)[start - 8 + i] = char(size >> (8 * i));
     (*out)[start - 4 + i] = char(crc >> (8 * i));
@@ -330,7 +314,7 @@ Snapshot::Known Snapshot::Load(TreeSnapshot* tree) {
       break;
     }
     const char* payload = data.data() + at + kRecordHead;
-    if (Crc32(payload, size) != crc) {
+    if (Crc32(0, payload, size) != crc) {
       why = "a record does not match its checksum";
       break;
     }
