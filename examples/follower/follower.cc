@@ -3,11 +3,15 @@
 // not printable ASCII as \xXY.  The subscription reconnects by itself when
 // the daemon restarts and goes on after the last event printed.
 //
-//   follower [--socket PATH] [--for SECONDS] QUEUE
+//   follower [--socket PATH] [--since SEQ] [--for SECONDS] QUEUE
+//
+// With --since it starts after record SEQ of the queue's journal (0: every
+// record the journal still holds) instead of from now on.
 //
 // Exits 1 when it cannot subscribe (no daemon, a socket not served by
 // root), 0 after SECONDS; without --for it runs until it is stopped.
 
+#include <cstdint>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -38,10 +42,13 @@ static std::string Escaped(const std::string& text) {
 int main(int argc, char** argv) {
   std::string socket = "/run/zorvnotifyd/zorvnotifyd.sock";
   long seconds = -1;
+  long long since = -1;
   int i = 1;
   for (; i + 1 < argc && argv[i][0] == '-'; i += 2) {
     if (std::strcmp(argv[i], "--socket") == 0) {
       socket = argv[i + 1];
+    } else if (std::strcmp(argv[i], "--since") == 0) {
+      since = std::atoll(argv[i + 1]);
     } else if (std::strcmp(argv[i], "--for") == 0) {
       seconds = std::atol(argv[i + 1]);
     } else {
@@ -49,11 +56,13 @@ int main(int argc, char** argv) {
     }
   }
   if (i + 1 != argc) {
-    std::fprintf(stderr, "usage: follower [--socket PATH] [--for SECONDS] QUEUE\n");
+    std::fprintf(stderr, "usage: follower [--socket PATH] [--since SEQ] [--for SECONDS] QUEUE\n");
     return 2;
   }
   MonitorQueueSubscription subscription(socket);
-  if (!subscription.Subscribe(argv[i])) {
+  const bool subscribed = since < 0 ? subscription.Subscribe(argv[i])
+                                    : subscription.Subscribe(argv[i], uint64_t(since));
+  if (!subscribed) {
     std::fprintf(stderr, "follower: %s\n", Escaped(subscription.LastError()).c_str());
     return 1;
   }
