@@ -21,8 +21,9 @@
 // Each row measures, from just before the load until the last event has
 // been read (or has not come for a second):
 //  - cpu_ns_per_event: CPU time (user + system) of the watcher's process
-//    per inotify event (the daemon with its journal, its default; the rows
-//    "no journal" run it with --journal-size 0);
+//    per inotify event (the daemon with its journal and its coalescing
+//    window, its defaults; the rows "no journal" run it with
+//    --journal-size 0, those "no coalescing" with --coalesce 0);
 //  - with_client_cpu_ns_per_event: the daemon's CPU plus that of the
 //    client's thread, per event;
 //  - events_lost: the events the client (or inotifywait's output, or the
@@ -661,8 +662,9 @@ void TimeLoad(benchmark::State& state, Load load, const std::function<int64_t()>
 }
 
 // The daemon with one client following q0; each queue's records in its
-// journal (the default), or, without |journal|, in memory only.
-void DaemonLoad(benchmark::State& state, int queues, Load load, bool journal) {
+// journal (the default), or, without |journal|, in memory only; with its
+// default coalescing window, or, without |coalesce|, --coalesce 0.
+void DaemonLoad(benchmark::State& state, int queues, Load load, bool journal, bool coalesce) {
   const Catalogue* catalogue = UseCatalogue(queues);
   if (catalogue == nullptr) {
     state.SkipWithError("cannot write the catalogue");
@@ -671,6 +673,7 @@ void DaemonLoad(benchmark::State& state, int queues, Load load, bool journal) {
   // The periodic look at the trees every 10 minutes, not in the load.
   std::vector<std::string> args = {ZORVNOTIFYD_PATH, "--socket", kSocket, "--retry", "600"};
   if (!journal) args.insert(args.end(), {"--journal-size", "0"});
+  if (!coalesce) args.insert(args.end(), {"--coalesce", "0"});
   Child daemon(args);
   const std::string ready = daemon.WaitFor("ready:", std::chrono::seconds(60));
   if (ready.find("watching " + std::to_string(catalogue->directories) + " directories") ==
@@ -931,12 +934,16 @@ int main(int argc, char** argv) {
       const std::string name = std::string("zorvnotifyd/") +
                                (load == Load::kBurst ? "burst" : "paced 1,000 files/s") + ", " +
                                Thousands(queues) + (queues == 1 ? " queue" : " queues");
-      benchmark::RegisterBenchmark(("lib/" + name).c_str(), DaemonLoad, queues, load, true)
+      benchmark::RegisterBenchmark(("lib/" + name).c_str(), DaemonLoad, queues, load, true, true)
+          ->Iterations(1)
+          ->ComputeStatistics("max", Max);
+      benchmark::RegisterBenchmark(("lib/" + name + ", no coalescing").c_str(), DaemonLoad, queues,
+                                   load, true, false)
           ->Iterations(1)
           ->ComputeStatistics("max", Max);
       if (load == Load::kBurst) {
         benchmark::RegisterBenchmark(("lib/" + name + ", no journal").c_str(), DaemonLoad, queues,
-                                     load, false)
+                                     load, false, true)
             ->Iterations(1)
             ->ComputeStatistics("max", Max);
       }
