@@ -1,32 +1,43 @@
-// The daemon zorvnotifyd beside a bare inotify reader process
-// (bare_inotify_reader) that watches the same directories with the same
-// masks and only reads the events.
+// The daemon zorvnotifyd beside its peer, inotifywait -m -r, and beside
+// the floor, a bare inotify reader process (bare_inotify_reader) that
+// watches the same directories with the same masks and only reads the
+// events.  The three run one after another, in random order within each
+// round of repetitions (script/bench interleaves them).
 //
-// The catalogue: N queues (10, 100, 1,000) of 8 configurations each, with
-// 2-3 ignore patterns.  Queue i watches /tmp/bench/share/q<i>/d<j>, except
-// that 8 queues spread over the catalogue have their last configuration on
-// the hot directory /tmp/bench/share/hot, with masks of which some take the
-// burst's event kinds and some do not, and patterns of which some ignore
-// the burst's files.  The trees hold 10 directories per queue (10,000 at
-// 1,000 queues): the configured ones, two below each queue's first, seven
-// below the hot one.  Every queue has a client subscribed on the daemon's
-// socket, read by a thread of this program.
+// The catalogue: N queues (1, 100, 1,000).  Queue q0 wants the four kinds
+// of the load (created, written, closed after writing, removed) on the
+// tree /tmp/bench/tree of 100 directories, with three ignore patterns that
+// let every file through.  The other queues have 8 configurations each on
+// directories of their own (/tmp/bench/share/q<i>/d<j>, 10 directories per
+// queue), except that 8 of them, spread over the catalogue, have their
+// last configuration on the tree too, with masks or ignore patterns that
+// take none of the load's events: the index has work on every event while
+// q0 alone gets records.  One client, a MonitorQueueSubscription in a
+// thread of this program, follows q0 and reads every record.
 //
-// Burst: one process creates, writes and removes 20,000 files in the hot
-// directory as fast as it can (80,000 inotify events).  The row is the CPU
-// time (user + system) of the daemon's process, or of the bare reader's,
-// from just before the burst until the last event has reached the clients
-// (or has been read), per inotify event.  The events lost are the event
-// lines the clients did not get (of those the catalogue wants, worked out
-// with MonitorQueueIndex), or the events the bare reader did not read.
-// The daemon runs with each queue's journal (its default) and, in the rows
-// "no journal", with --journal-size 0: the difference is what journaling
-// costs per event.  Its state is in the sandbox's /var/lib, a tmpfs: the
-// rows count the CPU of the writes and syncs, not the disk's latency.
+// Burst: 20,000 files created, written, closed and removed, file n in
+// directory d<n % 100>, as fast as one process can (80,000 inotify
+// events).  Paced: 2,000 files at 1,000 files per second (8,000 events).
+// Each row measures, from just before the load until the last event has
+// been read (or has not come for a second):
+//  - cpu_ns_per_event: CPU time (user + system) of the watcher's process
+//    per inotify event (the daemon with its journal and its coalescing
+//    window, its defaults; the rows "no journal" run it with
+//    --journal-size 0, those "no coalescing" with --coalesce 0);
+//  - with_client_cpu_ns_per_event: the daemon's CPU plus that of the
+//    client's thread, per event;
+//  - events_lost: the events the client (or inotifywait's output, or the
+//    bare reader) did not get; a client counts a rescan or a "missed"
+//    notice as losses too;
+//  - latency_p50_ns, latency_p99_ns (paced rows but the bare reader's):
+//    from just before a file's close to its IN_CLOSE_WRITE record in the
+//    client (or its line from inotifywait).
+// The daemon's state is in the sandbox's /var/lib, a tmpfs: the rows count
+// the CPU of the journal's writes and syncs, not the disk's latency.
 //
 // Start-up: wall time from exec to the daemon's "ready" log line at 1,000
-// queues, beside the bare reader's time to walk the same 10,000 directories
-// and add their watches.
+// queues, beside the bare reader's time to walk the same directories and
+// add their watches.
 //
 // Start-up comparison (run last: it replaces the catalogue): one queue on a
 // tree of 10,000 directories holding 100,000 files, the daemon started with
@@ -36,20 +47,19 @@
 // and the size of the saved snapshot per entry.
 //
 // With two CPUs or more, the writer has one to itself and the reading side
-// (the daemon and its clients' thread, or the bare reader) another, so that
-// where the scheduler puts them does not change the batches the readers
-// find (each wake-up costs the same whatever it brings).
+// (the watcher and the client's thread) another, so that where the
+// scheduler puts them does not change the batches the readers find.
 //
 // Runs in the test sandbox (root): the catalogue is in /usr/zorv, the trees
-// in /tmp.
+// in /tmp.  Without inotifywait (package inotify-tools) its rows say so and
+// are skipped.
 
 #include <errno.h>
 #include <fcntl.h>
+#include <pthread.h>
 #include <sched.h>
 #include <signal.h>
 #include <spawn.h>
-#include <sys/epoll.h>
-#include <sys/eventfd.h>
 #include <sys/inotify.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
@@ -70,6 +80,7 @@
 #include <cstring>
 #include <filesystem>
 #include <fstream>
+#include <functional>
 #include <iterator>
 #include <memory>
 #include <mutex>
@@ -84,6 +95,7 @@
 
 #include "monitor_queue.h"
 #include "monitor_queue_index.h"
+#include "monitor_queue_subscription.h"
 #include "support/sandbox.h"
 
 extern char** environ;
@@ -91,43 +103,51 @@ extern char** environ;
 namespace {
 
 using ZORV::ZORVNOTIFYD::MonitorQueue;
+using ZORV::ZORVNOTIFYD::MonitorQueueEvent;
 using ZORV::ZORVNOTIFYD::MonitorQueueIndex;
+using ZORV::ZORVNOTIFYD::MonitorQueueSubscription;
 using Clock = std::chrono::steady_clock;
 
 constexpr int kConfigs = 8;
 constexpr int kHotQueues = 8;
 constexpr int kMaxQueues = 1000;
+constexpr int kTreeDirs = 100;
 constexpr int kFiles = 20000;
+constexpr int kPacedFiles = 2000;
+constexpr int kPacedPerSecond = 1000;
 // Created, modified, closed after writing, deleted.
-constexpr uint32_t kBurstKinds[] = {IN_CREATE, IN_MODIFY, IN_CLOSE_WRITE, IN_DELETE};
-constexpr uint64_t kKernelEvents = uint64_t(kFiles) * std::size(kBurstKinds);
+constexpr uint32_t kLoadKinds[] = {IN_CREATE, IN_MODIFY, IN_CLOSE_WRITE, IN_DELETE};
+constexpr uint32_t kLoadMask = IN_CREATE | IN_MODIFY | IN_CLOSE_WRITE | IN_DELETE;
 // The kinds the daemon watches on every directory to keep its tree.
 constexpr uint32_t kTreeKeeping =
     IN_CREATE | IN_MOVED_TO | IN_MOVED_FROM | IN_DELETE | IN_MOVE_SELF | IN_DELETE_SELF;
 
 const std::string kRoot = "/tmp/bench";
 const std::string kShare = kRoot + "/share";
-const std::string kHotDir = kShare + "/hot";
+const std::string kTree = kRoot + "/tree";
 // A socket's directory must be root's and writable by root alone.
 const std::string kSocketDir = "/tmp/zorvrun";
 const std::string kSocket = kSocketDir + "/zorvnotifyd.sock";
-const std::string kRootsFile = kRoot + "/roots";
+const std::string kRootsFile = kRoot + "/roots";         // "MASK PATH" lines, the bare reader's
+const std::string kPlainRoots = kRoot + "/roots.plain";  // "PATH" lines, inotifywait's
+const char kInotifywait[] = "/usr/bin/inotifywait";
 
-// The configurations on the hot directory, one per hot queue.
+// The configurations on the tree of the queues other than q0, none of
+// which takes an event of the load.
 struct HotConfig {
   uint32_t mask;
   std::vector<const char*> ignore;
 };
 const std::vector<const char*> kIgnore = {"\\.tmp$", "/\\.#[^/]*$", "~$"};
 const HotConfig kHot[kHotQueues] = {
-    {IN_CLOSE_WRITE, kIgnore},                           // every file, closed
-    {IN_CREATE | IN_DELETE, kIgnore},                    // every file, twice
-    {IN_MOVED_FROM | IN_MOVED_TO, kIgnore},              // no kind of the burst
-    {IN_ATTRIB, kIgnore},                                // no kind of the burst
-    {IN_MODIFY | IN_CLOSE_WRITE, {"\\.dat$", "~$"}},     // ignores every file
-    {IN_MODIFY, kIgnore},                                // every file, written
-    {IN_DELETE_SELF | IN_MOVE_SELF, kIgnore},            // no kind of the burst
-    {IN_CREATE, {"/f[0-9]*[13579]\\.dat$", "\\.tmp$"}},  // half the files
+    {IN_MOVED_FROM | IN_MOVED_TO, kIgnore},                   // no kind of the load
+    {IN_ATTRIB, kIgnore},                                     // no kind of the load
+    {IN_MODIFY | IN_CLOSE_WRITE, {"\\.dat$", "~$"}},          // ignores every file
+    {IN_DELETE_SELF | IN_MOVE_SELF, kIgnore},                 // no kind of the load
+    {IN_CREATE | IN_DELETE, {"\\.tmp$", "/f[0-9]*\\.dat$"}},  // ignores every file
+    {IN_CLOSE_WRITE, {"~$", "/d[0-9]*/f[^/]*$"}},             // ignores every file
+    {IN_MODIFY, {"\\.(dat|tmp)$"}},                           // ignores every file
+    {IN_CREATE, {"[0-9]\\.dat$", "\\.tmp$"}},                 // ignores every file
 };
 // The masks of the other configurations, by position.
 constexpr uint32_t kMasks[4] = {IN_CLOSE_WRITE | IN_MOVED_TO,
@@ -170,15 +190,18 @@ std::string Thousands(long n) {
 
 std::string QueueDir(int i) { return kShare + "/q" + std::to_string(i); }
 
-// The position of hot queue |k| in a catalogue of |queues|.
-int HotQueue(int queues, int k) { return k * queues / kHotQueues; }
+// The position of hot queue |k| in a catalogue of |queues| (> 1): never 0.
+int HotQueue(int queues, int k) { return 1 + k * (queues - 1) / kHotQueues; }
 
-// Creates every directory of the largest catalogue: q<i>/d0..d7, two
-// subdirectories of each d0, and seven of the hot directory; and the
+// Creates every directory of the largest catalogue: the tree's d0..d99,
+// and for each queue q<i>/d0..d7 and two subdirectories of d0; and the
 // socket's directory.
 bool MakeTrees() {
   std::error_code error;
-  for (int i = 0; i < kMaxQueues && !error; ++i) {
+  for (int d = 0; d < kTreeDirs && !error; ++d) {
+    std::filesystem::create_directories(kTree + "/d" + std::to_string(d), error);
+  }
+  for (int i = 1; i < kMaxQueues && !error; ++i) {
     for (int j = 0; j < kConfigs; ++j) {
       std::filesystem::create_directories(QueueDir(i) + "/d" + std::to_string(j), error);
     }
@@ -186,41 +209,39 @@ bool MakeTrees() {
       std::filesystem::create_directories(QueueDir(i) + sub, error);
     }
   }
-  for (int h = 0; h < 7; ++h) {
-    std::filesystem::create_directories(kHotDir + "/h" + std::to_string(h), error);
-  }
   mkdir(kSocketDir.c_str(), 0755);
   return !error && chmod(kSocketDir.c_str(), 0755) == 0;
 }
 
-// The burst's files.
-const std::vector<std::string>& BurstPaths() {
+// The load's files: file n in directory d<n % 100>.
+const std::vector<std::string>& LoadPaths() {
   static const std::vector<std::string> paths = [] {
     std::vector<std::string> list;
-    for (int n = 0; n < kFiles; ++n) list.push_back(kHotDir + "/f" + std::to_string(n) + ".dat");
+    for (int n = 0; n < kFiles; ++n) {
+      list.push_back(kTree + "/d" + std::to_string(n % kTreeDirs) + "/f" + std::to_string(n) +
+                     ".dat");
+    }
     return list;
   }();
   return paths;
 }
 
-// Creates, writes, closes and removes every file of the burst.
-void Burst() {
-  static const char kData[] = "burst\n";
-  for (const std::string& path : BurstPaths()) {
-    const int fd = open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600);
-    if (fd < 0) continue;
-    if (write(fd, kData, sizeof(kData) - 1) < 0) perror("daemon_bench: write");
-    close(fd);
-    unlink(path.c_str());
-  }
+// The file number in a path of the load, or -1.
+long FileNumber(std::string_view path) {
+  const size_t at = path.rfind("/f");
+  if (at == std::string_view::npos) return -1;
+  char* end = nullptr;
+  const long n = std::strtol(path.data() + at + 2, &end, 10);
+  return end != path.data() + at + 2 && n >= 0 && n < kFiles ? n : -1;
 }
 
-// The catalogue in use: its queue file, the bare reader's roots file, and
-// what the clients should get from a burst.
+// The catalogue in use: its queue file, the roots files of the bare reader
+// and inotifywait, and what q0's client should get per file of the load.
 struct Catalogue {
   int queues = 0;
-  size_t directories = 0;       // watched, as the daemon should say when ready
-  uint64_t expected_lines = 0;  // event lines for the clients, over all queues
+  size_t directories = 0;         // watched, as the daemon should say when ready
+  uint64_t records_per_file = 0;  // q0's records for one file of the load
+  uint64_t other_records = 0;     // records of the other queues over a burst (0)
 };
 
 const Catalogue* UseCatalogue(int queues) {
@@ -230,7 +251,17 @@ const Catalogue* UseCatalogue(int queues) {
   std::vector<MonitorQueue> catalogue;
   std::vector<std::string> roots;
   std::set<std::string> seen;
-  for (int i = 0; i < queues; ++i) {
+  {
+    Json::Value value(Json::objectValue);
+    value["queue"] = "q0";
+    value["config"][0]["path"] = kTree;
+    value["config"][0]["mask"] = kLoadMask;
+    for (const char* pattern : kIgnore) value["config"][0]["ignore"].append(pattern);
+    catalogue.emplace_back(value);
+    roots.push_back(kTree);
+    seen.insert(kTree);
+  }
+  for (int i = 1; i < queues; ++i) {
     int hot = -1;
     for (int k = 0; k < kHotQueues; ++k) {
       if (HotQueue(queues, k) == i) hot = k;
@@ -239,10 +270,10 @@ const Catalogue* UseCatalogue(int queues) {
     value["queue"] = "q" + std::to_string(i);
     for (int j = 0; j < kConfigs; ++j) {
       Json::Value config(Json::objectValue);
-      const bool on_hot = hot >= 0 && j == kConfigs - 1;
-      config["path"] = on_hot ? kHotDir : QueueDir(i) + "/d" + std::to_string(j);
-      config["mask"] = on_hot ? kHot[hot].mask : kMasks[j % 4];
-      for (const char* pattern : on_hot ? kHot[hot].ignore : kIgnore) {
+      const bool on_tree = hot >= 0 && j == kConfigs - 1;
+      config["path"] = on_tree ? kTree : QueueDir(i) + "/d" + std::to_string(j);
+      config["mask"] = on_tree ? kHot[hot].mask : kMasks[j % 4];
+      for (const char* pattern : on_tree ? kHot[hot].ignore : kIgnore) {
         config["ignore"].append(pattern);
       }
       value["config"].append(config);
@@ -255,27 +286,35 @@ const Catalogue* UseCatalogue(int queues) {
   // The bare reader watches each tree with the mask the daemon gives it.
   const MonitorQueueIndex index(catalogue);
   std::ofstream file(kRootsFile, std::ios::trunc);
+  std::ofstream plain(kPlainRoots, std::ios::trunc);
   for (const std::string& root : roots) {
     file << "0x" << std::hex << ((index.GetWatchMask(root) & IN_ALL_EVENTS) | kTreeKeeping)
          << std::dec << ' ' << root << '\n';
+    plain << root << '\n';
   }
-  if (!file.flush()) return nullptr;
+  if (!file.flush() || !plain.flush()) return nullptr;
   std::vector<size_t> matches;
-  for (const std::string& path : BurstPaths()) {
-    for (uint32_t kind : kBurstKinds) {
+  for (const std::string& path : LoadPaths()) {
+    for (uint32_t kind : kLoadKinds) {
       index.Match(path, kind, matches);
-      current.expected_lines += matches.size();
+      for (size_t position : matches) {
+        if (position == 0 && &path == &LoadPaths()[0]) ++current.records_per_file;
+        if (position != 0) ++current.other_records;
+      }
     }
   }
-  current.directories = roots.size() + 2 * static_cast<size_t>(queues) + 7;
+  // The tree, each other configured directory, and two below each d0.
+  current.directories = 1 + kTreeDirs + (seen.size() - 1) + 2 * static_cast<size_t>(queues - 1);
   current.queues = queues;
   return &current;
 }
 
-// A child process, its standard output and error read by a thread.
+// A child process, its standard output and error read by a thread, which
+// also hands each piece read to |output| when one is given.
 class Child {
  public:
-  explicit Child(const std::vector<std::string>& args) {
+  explicit Child(const std::vector<std::string>& args,
+                 std::function<void(const char*, size_t)> output = nullptr) {
     int out[2];
     int in[2];
     if (pipe2(out, O_CLOEXEC) != 0) return;
@@ -300,9 +339,10 @@ class Child {
     close(out[1]);
     close(in[0]);
     input_ = in[1];
-    reader_ = std::thread([this, fd = out[0]] {
-      char buffer[4096];
+    reader_ = std::thread([this, fd = out[0], output = std::move(output)] {
+      char buffer[64 * 1024];
       for (ssize_t n; (n = read(fd, buffer, sizeof(buffer))) > 0;) {
+        if (output) output(buffer, static_cast<size_t>(n));
         std::lock_guard<std::mutex> lock(mutex_);
         output_.append(buffer, static_cast<size_t>(n));
         changed_.notify_all();
@@ -379,127 +419,6 @@ class Child {
   size_t seen_ = 0;
 };
 
-// One client per queue, each subscribed to its queue, read by one thread
-// that counts what arrives.
-class Subscribers {
- public:
-  std::atomic<uint64_t> replies{0}, events{0}, missed{0}, rescans{0}, other{0};
-
-  Subscribers() {
-    epoll_ = epoll_create1(EPOLL_CLOEXEC);
-    stop_ = eventfd(0, EFD_CLOEXEC);
-    struct epoll_event event = {};
-    event.events = EPOLLIN;
-    event.data.u64 = ~uint64_t(0);
-    epoll_ctl(epoll_, EPOLL_CTL_ADD, stop_, &event);
-  }
-  Subscribers(const Subscribers&) = delete;
-  Subscribers& operator=(const Subscribers&) = delete;
-  ~Subscribers() {
-    if (thread_.joinable()) {
-      const uint64_t one = 1;
-      if (write(stop_, &one, sizeof(one)) < 0) perror("daemon_bench: eventfd");
-      thread_.join();
-    }
-    for (const Client& client : clients_) close(client.fd);
-    close(stop_);
-    close(epoll_);
-  }
-
-  // Connects |queues| clients, client i subscribing to queue "q<i>".
-  bool Connect(int queues) {
-    clients_.resize(static_cast<size_t>(queues));
-    thread_ = std::thread([this] {
-      RunOn(g_cpus.reader);
-      Run();
-    });
-    for (int i = 0; i < queues; ++i) {
-      const int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-      struct sockaddr_un address = {};
-      address.sun_family = AF_UNIX;
-      kSocket.copy(address.sun_path, sizeof(address.sun_path) - 1);
-      const std::string request =
-          "{\"request\":\"subscribe\",\"queue\":\"q" + std::to_string(i) + "\"}\n";
-      if (fd < 0 || connect(fd, reinterpret_cast<struct sockaddr*>(&address), sizeof(address)) ||
-          send(fd, request.data(), request.size(), MSG_NOSIGNAL) !=
-              static_cast<ssize_t>(request.size()) ||
-          fcntl(fd, F_SETFL, O_NONBLOCK) != 0) {
-        if (fd >= 0) close(fd);
-        return false;
-      }
-      clients_[static_cast<size_t>(i)].fd = fd;
-      struct epoll_event event = {};
-      event.events = EPOLLIN;
-      event.data.u64 = static_cast<uint64_t>(i);
-      if (epoll_ctl(epoll_, EPOLL_CTL_ADD, fd, &event) != 0) return false;
-    }
-    return true;
-  }
-
- private:
-  struct Client {
-    int fd = -1;
-    std::string partial;  // the start of a line not complete yet
-  };
-
-  void Run() {
-    struct epoll_event ready[64];
-    std::vector<char> buffer(256 * 1024);
-    for (;;) {
-      const int n = epoll_wait(epoll_, ready, 64, -1);
-      for (int e = 0; e < n; ++e) {
-        if (ready[e].data.u64 == ~uint64_t(0)) return;
-        Client& client = clients_[ready[e].data.u64];
-        for (;;) {
-          const ssize_t got = read(client.fd, buffer.data(), buffer.size());
-          if (got <= 0) {
-            if (got == 0) epoll_ctl(epoll_, EPOLL_CTL_DEL, client.fd, nullptr);
-            break;
-          }
-          Take(client, buffer.data(), static_cast<size_t>(got));
-        }
-      }
-    }
-  }
-
-  // Counts the complete lines of |data| (after what |client| kept).
-  void Take(Client& client, const char* data, size_t size) {
-    const char* end = data + size;
-    const char* start = data;
-    for (const char* nl; (nl = static_cast<const char*>(memchr(start, '\n', end - start)));
-         start = nl + 1) {
-      if (client.partial.empty()) {
-        Count(start, nl);
-      } else {
-        client.partial.append(start, nl);
-        Count(client.partial.data(), client.partial.data() + client.partial.size());
-        client.partial.clear();
-      }
-    }
-    client.partial.append(start, end);
-  }
-
-  void Count(const char* begin, const char* end) {
-    const std::string_view line(begin, static_cast<size_t>(end - begin));
-    if (line.rfind("{\"reply\":", 0) == 0) {
-      ++replies;
-    } else if (const size_t at = line.find("\"missed\":"); at != std::string_view::npos) {
-      missed += std::strtoull(begin + at + 9, nullptr, 10);
-    } else if (line.find("\"rescan\":") != std::string_view::npos) {
-      ++rescans;
-    } else if (line.find("\"path\":") != std::string_view::npos) {
-      ++events;
-    } else {
-      ++other;
-    }
-  }
-
-  int epoll_ = -1;
-  int stop_ = -1;
-  std::vector<Client> clients_;
-  std::thread thread_;
-};
-
 // The daemon's answer to a status request, or a null value.
 Json::Value Status() {
   Json::Value status;
@@ -523,6 +442,169 @@ Json::Value Status() {
   return status;
 }
 
+// The load: a burst as fast as one process can, or a paced stream.
+enum class Load { kBurst, kPaced };
+
+int Files(Load load) { return load == Load::kBurst ? kFiles : kPacedFiles; }
+uint64_t KernelEvents(Load load) { return uint64_t(Files(load)) * std::size(kLoadKinds); }
+
+int64_t NowNs() {
+  return std::chrono::duration_cast<std::chrono::nanoseconds>(Clock::now().time_since_epoch())
+      .count();
+}
+
+// When each file of the load was closed (0: not yet), and how long its
+// IN_CLOSE_WRITE took to reach the reader (0: it did not).
+std::vector<std::atomic<int64_t>> g_closed(kFiles);
+std::vector<std::atomic<int64_t>> g_latency(kFiles);
+
+// Called by a reader on the IN_CLOSE_WRITE of |path|.
+void Arrived(std::string_view path) {
+  const long n = FileNumber(path);
+  if (n < 0) return;
+  const int64_t closed = g_closed[size_t(n)].load(std::memory_order_acquire);
+  if (closed > 0) g_latency[size_t(n)].store(NowNs() - closed, std::memory_order_relaxed);
+}
+
+// Creates, writes, closes and removes every file of |load|; paced, file n
+// starts n milliseconds after the first.
+void RunLoad(Load load) {
+  static const char kData[] = "load\n";
+  const int files = Files(load);
+  for (int n = 0; n < files; ++n) {
+    g_closed[size_t(n)].store(0, std::memory_order_relaxed);
+    g_latency[size_t(n)].store(0, std::memory_order_relaxed);
+  }
+  struct timespec next;
+  clock_gettime(CLOCK_MONOTONIC, &next);
+  for (int n = 0; n < files; ++n) {
+    if (load == Load::kPaced) {
+      next.tv_nsec += 1000000000 / kPacedPerSecond;
+      if (next.tv_nsec >= 1000000000) {
+        next.tv_nsec -= 1000000000;
+        ++next.tv_sec;
+      }
+      while (clock_nanosleep(CLOCK_MONOTONIC, TIMER_ABSTIME, &next, nullptr) == EINTR) {
+      }
+    }
+    const std::string& path = LoadPaths()[size_t(n)];
+    const int fd = open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600);
+    if (fd < 0) continue;
+    if (write(fd, kData, sizeof(kData) - 1) < 0) perror("daemon_bench: write");
+    g_closed[size_t(n)].store(NowNs(), std::memory_order_release);
+    close(fd);
+    unlink(path.c_str());
+  }
+}
+
+// The latencies of |load|'s files that arrived, in nanoseconds, sorted.
+std::vector<int64_t> Latencies(Load load) {
+  std::vector<int64_t> found;
+  for (int n = 0; n < Files(load); ++n) {
+    const int64_t latency = g_latency[size_t(n)].load(std::memory_order_relaxed);
+    if (latency > 0) found.push_back(latency);
+  }
+  std::sort(found.begin(), found.end());
+  return found;
+}
+
+// The |q| quantile of sorted |values|, or 0.
+double Quantile(const std::vector<int64_t>& values, double q) {
+  return values.empty() ? 0 : double(values[size_t(q * double(values.size() - 1))]);
+}
+
+// A MonitorQueueSubscription following q0 on its own thread, reading every
+// record and counting what comes.
+class Follower {
+ public:
+  std::atomic<uint64_t> events{0}, missed{0}, rescans{0};
+
+  Follower() : subscription_(kSocket) {}
+  Follower(const Follower&) = delete;
+  Follower& operator=(const Follower&) = delete;
+  ~Follower() {
+    stop_ = true;
+    if (thread_.joinable()) thread_.join();
+  }
+
+  // Subscribes (waiting for the daemon's reply) and starts reading; false
+  // when the daemon refused or did not answer.
+  bool Start() {
+    if (!subscription_.Subscribe("q0")) return false;
+    thread_ = std::thread([this] {
+      RunOn(g_cpus.reader);
+      MonitorQueueEvent event;
+      while (!stop_) {
+        if (!subscription_.Next(event, 50)) continue;
+        if (event._kind == MonitorQueueEvent::EVENT) {
+          ++events;
+          if (event._mask & IN_CLOSE_WRITE) Arrived(event._path);
+        } else if (event._kind == MonitorQueueEvent::MISSED) {
+          missed += event._missed;
+        } else if (event._kind == MonitorQueueEvent::RESCAN ||
+                   event._kind == MonitorQueueEvent::LOST) {
+          ++rescans;
+        }
+      }
+    });
+    return true;
+  }
+
+  // CPU time of the reading thread so far, in nanoseconds.
+  int64_t CpuNs() {
+    clockid_t clock;
+    struct timespec now;
+    if (pthread_getcpuclockid(thread_.native_handle(), &clock) != 0 ||
+        clock_gettime(clock, &now) != 0) {
+      return 0;
+    }
+    return int64_t(now.tv_sec) * 1000000000 + now.tv_nsec;
+  }
+
+ private:
+  MonitorQueueSubscription subscription_;
+  std::atomic<bool> stop_{false};
+  std::thread thread_;
+};
+
+// Counts inotifywait's event lines ("PATH EVENTS") as its reader thread
+// gets them.
+class LineTally {
+ public:
+  std::atomic<uint64_t> events{0};
+
+  void Take(const char* data, size_t size) {
+    const char* end = data + size;
+    for (const char* start = data;;) {
+      const char* nl = static_cast<const char*>(memchr(start, '\n', size_t(end - start)));
+      if (nl == nullptr) {
+        partial_.append(start, end);
+        return;
+      }
+      if (partial_.empty()) {
+        Line(std::string_view(start, size_t(nl - start)));
+      } else {
+        partial_.append(start, nl);
+        Line(partial_);
+        partial_.clear();
+      }
+      start = nl + 1;
+    }
+  }
+
+ private:
+  void Line(std::string_view line) {
+    if (line.compare(0, kTree.size(), kTree) != 0) return;  // a set-up message
+    ++events;
+    const size_t space = line.rfind(' ');
+    if (space != std::string_view::npos && line.find("CLOSE_WRITE", space) != line.npos) {
+      Arrived(line.substr(0, space));
+    }
+  }
+
+  std::string partial_;
+};
+
 // Waits until |count| reaches |expected| or has not moved for a second.
 void WaitCount(const std::atomic<uint64_t>& count, uint64_t expected) {
   uint64_t last = count;
@@ -536,50 +618,62 @@ void WaitCount(const std::atomic<uint64_t>& count, uint64_t expected) {
   }
 }
 
-std::string BurstLabel(int queues) {
-  return Thousands(queues) + " queues of 8 configurations, 8 of them on the burst's directory; " +
-         Thousands(static_cast<long>(queues) * 10) +
-         " directories; a client per queue; 20,000 files created, written, removed (80,000 "
-         "events)";
+std::string LoadLabel(int queues, Load load) {
+  std::string label = Thousands(queues) + (queues == 1 ? " queue" : " queues") +
+                      ", q0 on 100 directories and followed by one client; ";
+  if (load == Load::kBurst) {
+    return label + "a burst of 20,000 files created, written, removed (80,000 events)";
+  }
+  return label + "2,000 files created, written, removed at 1,000 files/s (8,000 events)";
 }
 
-// Runs the burst once per iteration, |wait_for_end| returning once |child|
-// has every event, and reports |child|'s CPU time over the last one: per
-// event, in all, the user share, and the wall time.
+// Runs |load| once per iteration, |wait_for_end| returning once the reader
+// has every event, and reports the CPU time over the last one of the
+// watcher (|watcher_cpu|) and, when given, of the client (|client_cpu|):
+// per event, in all, and the wall time; and, paced, the latencies.
 template <typename WaitForEnd>
-void TimeBurst(benchmark::State& state, const Child& child, WaitForEnd wait_for_end) {
-  int64_t cpu_ns = 0;
-  long user0 = 0, system0 = 0, user1 = 0, system1 = 0;
+void TimeLoad(benchmark::State& state, Load load, const std::function<int64_t()>& watcher_cpu,
+              const std::function<int64_t()>& client_cpu, WaitForEnd wait_for_end) {
+  int64_t cpu_ns = 0, client_ns = 0;
   double wall = 0;
   for (auto _ : state) {
-    child.Ticks(&user0, &system0);
-    const int64_t cpu0 = child.CpuNs();
+    const int64_t cpu0 = watcher_cpu();
+    const int64_t client0 = client_cpu ? client_cpu() : 0;
     const auto start = Clock::now();
-    Burst();
+    RunLoad(load);
     wait_for_end();
-    cpu_ns = child.CpuNs() - cpu0;
+    cpu_ns = watcher_cpu() - cpu0;
+    client_ns = client_cpu ? client_cpu() - client0 : 0;
     wall = std::chrono::duration<double>(Clock::now() - start).count();
-    child.Ticks(&user1, &system1);
   }
-  const long user = user1 - user0, system = system1 - system0;
-  state.counters["cpu_ns_per_event"] = double(cpu_ns) / double(kKernelEvents);
+  const double events = double(KernelEvents(load));
+  state.counters["cpu_ns_per_event"] = double(cpu_ns) / events;
+  if (client_cpu) {
+    state.counters["with_client_cpu_ns_per_event"] = double(cpu_ns + client_ns) / events;
+  }
   state.counters["cpu_ms"] = double(cpu_ns) / 1e6;
-  state.counters["user_share"] = user + system > 0 ? double(user) / double(user + system) : 0;
   state.counters["wall_ms"] = wall * 1e3;
+  // Readers that see paths (the client, inotifywait) time them.
+  const std::vector<int64_t> latencies = Latencies(load);
+  if (load == Load::kPaced && !latencies.empty()) {
+    state.counters["latency_p50_ns"] = Quantile(latencies, 0.5);
+    state.counters["latency_p99_ns"] = Quantile(latencies, 0.99);
+  }
 }
 
-// The daemon's CPU time over a burst, its clients subscribed; each queue's
-// records in its journal (the default), or, without |journal|, in memory
-// only.
-void DaemonBurst(benchmark::State& state, int queues, bool journal) {
+// The daemon with one client following q0; each queue's records in its
+// journal (the default), or, without |journal|, in memory only; with its
+// default coalescing window, or, without |coalesce|, --coalesce 0.
+void DaemonLoad(benchmark::State& state, int queues, Load load, bool journal, bool coalesce) {
   const Catalogue* catalogue = UseCatalogue(queues);
   if (catalogue == nullptr) {
     state.SkipWithError("cannot write the catalogue");
     return;
   }
-  // The periodic look at the trees every 10 minutes, not in the burst.
+  // The periodic look at the trees every 10 minutes, not in the load.
   std::vector<std::string> args = {ZORVNOTIFYD_PATH, "--socket", kSocket, "--retry", "600"};
   if (!journal) args.insert(args.end(), {"--journal-size", "0"});
+  if (!coalesce) args.insert(args.end(), {"--coalesce", "0"});
   Child daemon(args);
   const std::string ready = daemon.WaitFor("ready:", std::chrono::seconds(60));
   if (ready.find("watching " + std::to_string(catalogue->directories) + " directories") ==
@@ -587,58 +681,85 @@ void DaemonBurst(benchmark::State& state, int queues, bool journal) {
     state.SkipWithError(("the daemon did not start as expected: " + daemon.Output()).c_str());
     return;
   }
-  Subscribers clients;
-  const bool connected = clients.Connect(queues);
-  WaitCount(clients.replies, static_cast<uint64_t>(queues));
-  if (!connected || clients.replies != static_cast<uint64_t>(queues)) {
-    state.SkipWithError("the clients could not subscribe");
+  Follower client;
+  if (!client.Start()) {
+    state.SkipWithError("the client could not subscribe");
     return;
   }
+  const uint64_t expected = catalogue->records_per_file * uint64_t(Files(load));
   const Json::Value before = Status();
-  TimeBurst(state, daemon, [&] { WaitCount(clients.events, catalogue->expected_lines); });
+  TimeLoad(
+      state, load, [&] { return daemon.CpuNs(); }, [&] { return client.CpuNs(); },
+      [&] { WaitCount(client.events, expected); });
   const Json::Value after = Status();
-  state.counters["events_lost"] =
-      double(catalogue->expected_lines) -
-      double(std::min<uint64_t>(clients.events, catalogue->expected_lines));
-  state.counters["lines"] = double(clients.events);
-  state.counters["expected_lines"] = double(catalogue->expected_lines);
-  state.counters["missed"] = double(clients.missed);
-  state.counters["rescan_records"] = double(clients.rescans);
+  state.counters["events_lost"] = double(expected) -
+                                  double(std::min<uint64_t>(client.events, expected)) +
+                                  double(client.missed) + double(client.rescans);
+  state.counters["records"] = double(client.events);
+  state.counters["expected_records"] = double(expected);
+  state.counters["other_queues_records"] = double(catalogue->other_records);
   state.counters["kernel_events"] = after["events"].asDouble() - before["events"].asDouble();
   state.counters["overflows"] = after["overflows"].asDouble() - before["overflows"].asDouble();
-  state.SetLabel(BurstLabel(queues));
+  state.SetLabel(LoadLabel(queues, load));
 }
 
-// The bare reader's CPU time over the same burst.
-void BareBurst(benchmark::State& state, int queues) {
-  const Catalogue* catalogue = UseCatalogue(queues);
-  if (catalogue == nullptr) {
+// inotifywait -m -r on the same directories, for the load's four kinds,
+// one line per event on a pipe that a thread of this program reads.
+void PeerLoad(benchmark::State& state, int queues, Load load) {
+  if (access(kInotifywait, X_OK) != 0) {
+    state.SkipWithError("inotifywait is not installed (package inotify-tools): row skipped");
+    return;
+  }
+  if (UseCatalogue(queues) == nullptr) {
     state.SkipWithError("cannot write the roots file");
     return;
   }
-  Child bare({BARE_READER_PATH, kRootsFile, std::to_string(kKernelEvents)});
-  if (bare.WaitFor("ready " + std::to_string(catalogue->directories) + "\n",
-                   std::chrono::seconds(60))
-          .empty()) {
+  LineTally lines;
+  Child peer({kInotifywait, "-m", "-r", "-e", "create", "-e", "modify", "-e", "close_write", "-e",
+              "delete", "--format", "%w%f %e", "--fromfile", kPlainRoots},
+             [&lines](const char* data, size_t size) { lines.Take(data, size); });
+  if (peer.WaitFor("Watches established", std::chrono::seconds(60)).empty()) {
+    state.SkipWithError(("inotifywait did not start as expected: " + peer.Output()).c_str());
+    return;
+  }
+  const uint64_t expected = KernelEvents(load);
+  TimeLoad(
+      state, load, [&] { return peer.CpuNs(); }, nullptr,
+      [&] { WaitCount(lines.events, expected); });
+  state.counters["events_lost"] =
+      double(expected) - double(std::min<uint64_t>(lines.events, expected));
+  state.SetLabel("inotifywait -m -r, the same directories, the four kinds, a line per event");
+}
+
+// The bare reader over the same load.
+void BareLoad(benchmark::State& state, int queues, Load load) {
+  if (UseCatalogue(queues) == nullptr) {
+    state.SkipWithError("cannot write the roots file");
+    return;
+  }
+  const uint64_t expected = KernelEvents(load);
+  Child bare({BARE_READER_PATH, kRootsFile, std::to_string(expected)});
+  if (bare.WaitFor("ready ", std::chrono::seconds(60)).empty()) {
     state.SkipWithError(("the bare reader did not start as expected: " + bare.Output()).c_str());
     return;
   }
   std::string done;
-  TimeBurst(state, bare, [&] {
-    done = bare.WaitFor("done ", std::chrono::seconds(1));
-    // Not every event came: stop it (SIGUSR1 ends its read).
-    for (int tries = 0; done.empty() && tries < 50; ++tries) {
-      kill(bare.pid(), SIGUSR1);
-      done = bare.WaitFor("done ", std::chrono::milliseconds(100));
-    }
-  });
+  TimeLoad(
+      state, load, [&] { return bare.CpuNs(); }, nullptr,
+      [&] {
+        done = bare.WaitFor("done ", std::chrono::seconds(1));
+        // Not every event came: stop it (SIGUSR1 ends its read).
+        for (int tries = 0; done.empty() && tries < 50; ++tries) {
+          kill(bare.pid(), SIGUSR1);
+          done = bare.WaitFor("done ", std::chrono::milliseconds(100));
+        }
+      });
   unsigned long count = 0, overflows = 0;
   if (std::sscanf(done.c_str(), "done %lu %lu", &count, &overflows) != 2) {
     state.SkipWithError("the bare reader did not say what it read");
     return;
   }
-  state.counters["events_lost"] = double(kKernelEvents - std::min<uint64_t>(count, kKernelEvents));
-  state.counters["kernel_events"] = double(count);
+  state.counters["events_lost"] = double(expected - std::min<uint64_t>(count, expected));
   state.counters["overflows"] = double(overflows);
   state.SetLabel("bare inotify reader process, the same watches and masks: read and count");
 }
@@ -808,18 +929,31 @@ int main(int argc, char** argv) {
     std::fprintf(stderr, "daemon_bench: cannot make the trees\n");
     return 1;
   }
-  for (int queues : {10, 100, 1000}) {
-    const std::string name = "zorvnotifyd/burst, " + Thousands(queues) + " queues";
-    benchmark::RegisterBenchmark(("lib/" + name).c_str(), DaemonBurst, queues, true)
-        ->Iterations(1)
-        ->ComputeStatistics("max", Max);
-    benchmark::RegisterBenchmark(("lib/" + name + ", no journal").c_str(), DaemonBurst, queues,
-                                 false)
-        ->Iterations(1)
-        ->ComputeStatistics("max", Max);
-    benchmark::RegisterBenchmark(("base/" + name).c_str(), BareBurst, queues)
-        ->Iterations(1)
-        ->ComputeStatistics("max", Max);
+  for (int queues : {1, 100, 1000}) {
+    for (const Load load : {Load::kBurst, Load::kPaced}) {
+      const std::string name = std::string("zorvnotifyd/") +
+                               (load == Load::kBurst ? "burst" : "paced 1,000 files/s") + ", " +
+                               Thousands(queues) + (queues == 1 ? " queue" : " queues");
+      benchmark::RegisterBenchmark(("lib/" + name).c_str(), DaemonLoad, queues, load, true, true)
+          ->Iterations(1)
+          ->ComputeStatistics("max", Max);
+      benchmark::RegisterBenchmark(("lib/" + name + ", no coalescing").c_str(), DaemonLoad, queues,
+                                   load, true, false)
+          ->Iterations(1)
+          ->ComputeStatistics("max", Max);
+      if (load == Load::kBurst) {
+        benchmark::RegisterBenchmark(("lib/" + name + ", no journal").c_str(), DaemonLoad, queues,
+                                     load, false, true)
+            ->Iterations(1)
+            ->ComputeStatistics("max", Max);
+      }
+      benchmark::RegisterBenchmark(("peer/" + name).c_str(), PeerLoad, queues, load)
+          ->Iterations(1)
+          ->ComputeStatistics("max", Max);
+      benchmark::RegisterBenchmark(("base/" + name).c_str(), BareLoad, queues, load)
+          ->Iterations(1)
+          ->ComputeStatistics("max", Max);
+    }
   }
   benchmark::RegisterBenchmark("lib/zorvnotifyd/start-up, exec to ready", DaemonStartup)
       ->Iterations(1)

@@ -3,7 +3,6 @@
 #include "json_bytes.h"
 
 #include <cstdint>
-#include <cstdio>
 #include <utility>
 
 namespace zorvcommon {
@@ -42,49 +41,66 @@ size_t Utf8SequenceLength(std::string_view text) {
   return length;
 }
 
+// One pass: runs of bytes that pass unchanged (printable ASCII but '"' and
+// '\', and whole valid UTF-8 sequences) are appended at once, and each
+// byte that needs an escape ends a run.
 bool AppendJsonString(std::string* out, std::string_view text) {
+  static const char kHex[] = "0123456789abcdef";
   bool raw = false;
   out->push_back('"');
-  for (size_t i = 0; i < text.size();) {
-    const auto byte = static_cast<unsigned char>(text[i]);
-    const size_t length = Utf8SequenceLength(text.substr(i));
-    if (length > 1 || (length == 1 && byte >= 0x20 && byte != '"' && byte != '\\')) {
-      out->append(text.substr(i, length));
-      i += length;
+  const char* const end = text.data() + text.size();
+  const char* run = text.data();
+  for (const char* p = run; p < end;) {
+    const auto byte = static_cast<unsigned char>(*p);
+    if (byte >= 0x20 && byte < 0x80 && byte != '"' && byte != '\\') {
+      ++p;
       continue;
     }
-    ++i;
-    switch (byte) {
-      case '"':
-        out->append("\\\"");
-        break;
-      case '\\':
-        out->append("\\\\");
-        break;
-      case '\n':
-        out->append("\\n");
-        break;
-      case '\t':
-        out->append("\\t");
-        break;
-      case '\r':
-        out->append("\\r");
-        break;
-      case '\b':
-        out->append("\\b");
-        break;
-      case '\f':
-        out->append("\\f");
-        break;
-      default: {
-        // A control byte as \u00XX; a byte outside UTF-8 as \udcXY.
-        raw = raw || byte >= 0x80;
-        char escaped[7];
-        snprintf(escaped, sizeof(escaped), "\\u%s%02x", byte < 0x80 ? "00" : "dc", byte);
-        out->append(escaped);
+    if (byte >= 0x80) {
+      const size_t length = Utf8SequenceLength(std::string_view(p, size_t(end - p)));
+      if (length > 1) {
+        p += length;
+        continue;
       }
     }
+    out->append(run, size_t(p - run));
+    run = ++p;
+    const char* escape = nullptr;
+    switch (byte) {
+      case '"':
+        escape = "\\\"";
+        break;
+      case '\\':
+        escape = "\\\\";
+        break;
+      case '\n':
+        escape = "\\n";
+        break;
+      case '\t':
+        escape = "\\t";
+        break;
+      case '\r':
+        escape = "\\r";
+        break;
+      case '\b':
+        escape = "\\b";
+        break;
+      case '\f':
+        escape = "\\f";
+        break;
+    }
+    if (escape != nullptr) {
+      out->append(escape, 2);
+      continue;
+    }
+    // A control byte as \u00XX; a byte outside UTF-8 as \udcXY.
+    raw = raw || byte >= 0x80;
+    const char escaped[6] = {
+        '\\',           'u', byte < 0x80 ? '0' : 'd', byte < 0x80 ? '0' : 'c', kHex[byte >> 4],
+        kHex[byte & 15]};
+    out->append(escaped, sizeof(escaped));
   }
+  out->append(run, size_t(end - run));
   out->push_back('"');
   return raw;
 }

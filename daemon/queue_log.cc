@@ -38,29 +38,29 @@ QueueLog::QueueLog(QueueType type, std::string file, std::string name, size_t ke
 }
 
 LogRecord& QueueLog::Next(uint64_t order) {
-  // The oldest record's string is reused for the newest, so a full log
-  // stops allocating once its lines have grown to size.
-  LogRecord record;
-  if (records_.size() >= keep_ && !records_.empty()) {
-    record = std::move(records_.front());
-    records_.pop_front();
+  LogRecord* record;
+  if (records_.size() < keep_) {
+    record = &records_.emplace_back();
+  } else {
+    record = &records_[oldest_];
+    oldest_ = (oldest_ + 1) % records_.size();
   }
-  record.seq = next_seq_;
-  record.order = order;
-  record.line.assign(head_);
-  AppendJsonNumber(&record.line, "seq", next_seq_++);
-  records_.push_back(std::move(record));
-  return records_.back();
+  record->seq = next_seq_;
+  record->order = order;
+  record->line.assign(head_);
+  AppendJsonNumber(&record->line, "seq", next_seq_++);
+  return *record;
 }
 
 void QueueLog::AddEvent(const std::string& path, uint32_t mask, uint64_t order, bool offline) {
-  std::string& line = Next(order).line;
+  LogRecord& record = Next(order);
+  std::string& line = record.line;
   line += ',';
   AppendJsonBytesField(&line, "path", path);
   line += ',';
   AppendJsonNumber(&line, "mask", mask);
   line += offline ? ",\"offline\":true}\n" : "}\n";
-  Keep(records_.back());
+  Keep(record);
 }
 
 void QueueLog::Keep(const LogRecord& record) {
@@ -77,19 +77,21 @@ void QueueLog::AddRescans(uint64_t order) {
 }
 
 void QueueLog::AddRescan(const std::string& path, uint64_t order) {
-  std::string& line = Next(order).line;
+  LogRecord& record = Next(order);
+  std::string& line = record.line;
   line += ',';
   AppendJsonBytesField(&line, "rescan", path);
   line += "}\n";
-  Keep(records_.back());
+  Keep(record);
 }
 
 void QueueLog::AddNotice(const char* key, uint64_t order) {
-  std::string& line = Next(order).line;
+  LogRecord& record = Next(order);
+  std::string& line = record.line;
   line += ",\"";
   line += key;
   line += "\":true}\n";
-  Keep(records_.back());
+  Keep(record);
 }
 
 void QueueLogs::UseJournals(int dir, uint64_t size, std::string boot,

@@ -50,7 +50,9 @@ class QueueLog {
   // none is kept).
   uint64_t first_seq() const { return next_seq_ - records_.size(); }
   // The record numbered |seq|, first_seq() <= seq <= last_seq().
-  const LogRecord& at(uint64_t seq) const { return records_[seq - first_seq()]; }
+  const LogRecord& at(uint64_t seq) const {
+    return records_[(oldest_ + (seq - first_seq())) % records_.size()];
+  }
 
   // Appends to |out| the records from |seq| on that the journal holds, up
   // to about |max_bytes|; nothing without a journal.
@@ -112,7 +114,11 @@ class QueueLog {
   QueueType type_;
   std::string file_, name_, head_;
   size_t keep_;
-  std::deque<LogRecord> records_;
+  // A ring of the last |keep_| records, the oldest at |oldest_|: once
+  // full, each new record takes the oldest one's place and its string's
+  // storage, so that recording allocates nothing.
+  std::vector<LogRecord> records_;
+  size_t oldest_ = 0;
   uint64_t next_seq_ = 1;
   std::unique_ptr<Journal> journal_;
   std::vector<QueueLog*>* written_ = nullptr;

@@ -4,6 +4,7 @@
 
 #include <errno.h>
 #include <fcntl.h>
+#include <limits.h>
 #include <poll.h>
 #include <string.h>
 #include <sys/inotify.h>
@@ -197,6 +198,8 @@ bool WatchTree::Fill(bool* failed) {
     *failed = true;
     return false;
   }
+  // Room left for the largest event: the kernel's queue was empty.
+  drained_ = size_t(n) + sizeof(struct inotify_event) + NAME_MAX + 1 <= sizeof(buffer);
   for (const char* p = buffer; p < buffer + n;) {
     const auto* event = reinterpret_cast<const struct inotify_event*>(p);
     p += sizeof(struct inotify_event) + event->len;
@@ -211,8 +214,11 @@ bool WatchTree::ReadEvents(EventSink& sink) {
   bool failed = false;
   // At most kReadsPerRound buffers before the caller polls again, so that a
   // steady flood of events cannot keep it from stop signals and reloads.
+  drained_ = false;
   for (int reads = 0; reads < kReadsPerRound; ++reads) {
-    if (pending_.empty() && !Fill(&failed)) break;
+    // A read after one that emptied the queue would only say EAGAIN: the
+    // caller's poll tells when more come.
+    if (pending_.empty() && (drained_ || !Fill(&failed))) break;
     while (!pending_.empty()) {
       const RawEvent event = std::move(pending_.front());
       pending_.pop_front();
@@ -631,17 +637,23 @@ void WatchTree::Relist() {
     std::string path;
   };
   std::vector<std::string> work = snapshot_->TakeDirty();
+  std::string root;  // each ancestor of a path, shortest first
   while (!work.empty()) {
     std::unordered_map<uint64_t, Place> left;
     std::vector<std::pair<uint64_t, Place>> came;
     for (const std::string& path : work) {
       SnapshotListing listing;
       bool listed = false;
-      for (auto& [root, tree] : snapshot_->trees()) {
-        if (path.compare(0, root.size(), root) != 0 ||
-            (path.size() != root.size() && path[root.size()] != '/')) {
+      // The trees holding |path| are those rooted at it or at an ancestor:
+      // looked up one by one, not found by walking every tree.
+      for (size_t end = path.find('/', 1);; end = path.find('/', end + 1)) {
+        root.assign(path, 0, end == std::string::npos ? path.size() : end);
+        const auto found = snapshot_->trees().find(root);
+        if (found == snapshot_->trees().end()) {
+          if (end == std::string::npos) break;  // |path| itself, the last
           continue;
         }
+        const std::unique_ptr<TreeSnapshot>& tree = found->second;
         if (!listed && !(listed = ListWatched(path, &listing))) break;
         auto& dirs = tree->dirs();
         const auto old = dirs.find(path);
@@ -664,6 +676,7 @@ void WatchTree::Relist() {
           }
         }
         tree->Put(path, listing);
+        if (end == std::string::npos) break;
       }
     }
     work.clear();

@@ -237,6 +237,7 @@ class WatchTree {
   std::map<std::string, std::string> missing_;       // unwatched roots and why
   std::map<std::string, size_t> limited_;            // roots the watch limit kept partly unwatched
   std::deque<RawEvent> pending_;                     // events read but not yet handled
+  bool drained_ = false;                             // the last read left the kernel's queue empty
   std::set<uint32_t> moves_;  // cookies of directory moves within the trees, already done
   std::string entry_path_;    // Handle's buffer for the path of an event's entry
   Snapshot* snapshot_ = nullptr;
