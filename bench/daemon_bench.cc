@@ -31,7 +31,7 @@
 // each beside the bare reader's time to walk the same 10,000 directories
 // and add their watches.
 //
-// Start-up comparison (run last: it replaces the catalogue): one queue on a
+// Start-up comparison (a catalogue of its own): one queue on a
 // tree of 10,000 directories holding 100,000 files.  The daemon is ready
 // once its walk has set the watches (exec to "ready", beside the bare
 // reader's walk), and then compares the tree with what was saved: exec to
@@ -232,9 +232,26 @@ struct Catalogue {
   uint64_t expected_lines = 0;  // event lines for the clients, over all queues
 };
 
+std::string g_installed;  // the queue file in place
+
+// Puts the queue file |name| ("bench" or "snap", kept in kRoot as NAME.queues)
+// in the configuration directory, the other one out: benchmarks that run
+// interleaved each find their own catalogue.
+bool InstallQueueFile(const std::string& name) {
+  if (g_installed == name) return true;
+  const std::string dir = MonitorQueue::GetConfDir(ZORV::ZORVNOTIFYD::MONITOR_QUEUE_TYPE_ETC_DIR);
+  std::error_code error;
+  std::filesystem::remove(dir + "/" + (name == "bench" ? "snap" : "bench"), error);
+  std::filesystem::copy_file(kRoot + "/" + name + ".queues", dir + "/" + name,
+                             std::filesystem::copy_options::overwrite_existing, error);
+  if (error) return false;
+  g_installed = name;
+  return true;
+}
+
 const Catalogue* UseCatalogue(int queues) {
   static Catalogue current;
-  if (current.queues == queues) return &current;
+  if (current.queues == queues) return InstallQueueFile("bench") ? &current : nullptr;
   current = Catalogue();
   std::vector<MonitorQueue> catalogue;
   std::vector<std::string> roots;
@@ -259,8 +276,10 @@ const Catalogue* UseCatalogue(int queues) {
     }
     catalogue.emplace_back(value);
   }
-  const std::string dir = MonitorQueue::GetConfDir(ZORV::ZORVNOTIFYD::MONITOR_QUEUE_TYPE_ETC_DIR);
-  if (!MonitorQueue::SaveToFile(catalogue, dir + "/bench")) return nullptr;
+  g_installed.clear();  // another catalogue of that name
+  if (!MonitorQueue::SaveToFile(catalogue, kRoot + "/bench.queues") || !InstallQueueFile("bench")) {
+    return nullptr;
+  }
   // The bare reader watches each tree with the mask the daemon gives it.
   const MonitorQueueIndex index(catalogue);
   std::ofstream file(kRootsFile, std::ios::trunc);
@@ -753,9 +772,7 @@ constexpr int kSnapDirs = 10000, kSnapFilesPerDir = 10;
 // files in every one) and a catalogue of one queue on it.  False on failure.
 bool UseSnapshotTree() {
   static bool made = false;
-  if (made) return true;
-  const std::string conf = MonitorQueue::GetConfDir(ZORV::ZORVNOTIFYD::MONITOR_QUEUE_TYPE_ETC_DIR);
-  std::filesystem::remove(conf + "/bench");
+  if (made) return InstallQueueFile("snap");
   std::vector<std::string> dirs;
   for (int i = 0; i < 100; ++i) {
     const std::string top = kSnapTree + "/t" + std::to_string(i);
@@ -776,7 +793,10 @@ bool UseSnapshotTree() {
   value["queue"] = "snap";
   value["config"][0]["path"] = kSnapTree;
   value["config"][0]["mask"] = IN_CREATE | IN_CLOSE_WRITE | IN_DELETE;
-  if (!MonitorQueue::SaveToFile({MonitorQueue(value)}, conf + "/snap")) return false;
+  if (!MonitorQueue::SaveToFile({MonitorQueue(value)}, kRoot + "/snap.queues") ||
+      !InstallQueueFile("snap")) {
+    return false;
+  }
   std::ofstream roots(kSnapRoots, std::ios::trunc);
   roots << "0x" << std::hex << (IN_CREATE | IN_CLOSE_WRITE | IN_DELETE | kTreeKeeping) << std::dec
         << ' ' << kSnapTree << '\n';
@@ -906,7 +926,7 @@ int main(int argc, char** argv) {
         ->UseManualTime()
         ->Unit(benchmark::kMillisecond);
   }
-  // Last: these replace the catalogue.  The comparison beside the walk
+  // On a catalogue of their own.  The comparison beside the walk
   // that only sets the watches (exec to "ready"), and that walk beside the
   // bare reader's.
   for (const bool saved : {true, false}) {
