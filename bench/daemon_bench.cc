@@ -36,14 +36,19 @@
 // the CPU of the journal's writes and syncs, not the disk's latency.
 //
 // Start-up: wall time from exec to the daemon's "ready" log line at 1,000
-// queues, beside the bare reader's time to walk the same directories and
-// add their watches.
+// queues, a later start (the state of an earlier one) and the first (no
+// state: it makes every journal and gives each tree a rescan record), and
+// inotifywait -m -r over the same trees to its "Watches established.",
+// each beside the bare reader's time to walk the same 10,000 directories
+// and add their watches.
 //
-// Start-up comparison (run last: it replaces the catalogue): one queue on a
-// tree of 10,000 directories holding 100,000 files, the daemon started with
-// the snapshot a first start saved (every directory compared, nothing
-// changed) and with none (the first start, which lists the tree for its
-// first snapshot), beside the bare reader's walk of the same directories;
+// Start-up comparison (a catalogue of its own): one queue on a
+// tree of 10,000 directories holding 100,000 files.  The daemon is ready
+// once its walk has set the watches (exec to "ready", beside the bare
+// reader's walk), and then compares the tree with what was saved: exec to
+// its "compared" log line, with the snapshot a first start saved (every
+// directory compared, nothing changed), beside exec to "ready", and with
+// none (the first start, which lists the tree for its first snapshot);
 // and the size of the saved snapshot per entry.
 //
 // With two CPUs or more, the writer has one to itself and the reading side
@@ -99,6 +104,10 @@
 #include "support/sandbox.h"
 
 extern char** environ;
+
+#ifndef INOTIFYWAIT_PATH
+#define INOTIFYWAIT_PATH "/usr/bin/inotifywait"  // inotify-tools
+#endif
 
 namespace {
 
@@ -244,9 +253,26 @@ struct Catalogue {
   uint64_t other_records = 0;     // records of the other queues over a burst (0)
 };
 
+std::string g_installed;  // the queue file in place
+
+// Puts the queue file |name| ("bench" or "snap", kept in kRoot as NAME.queues)
+// in the configuration directory, the other one out: benchmarks that run
+// interleaved each find their own catalogue.
+bool InstallQueueFile(const std::string& name) {
+  if (g_installed == name) return true;
+  const std::string dir = MonitorQueue::GetConfDir(ZORV::ZORVNOTIFYD::MONITOR_QUEUE_TYPE_ETC_DIR);
+  std::error_code error;
+  std::filesystem::remove(dir + "/" + (name == "bench" ? "snap" : "bench"), error);
+  std::filesystem::copy_file(kRoot + "/" + name + ".queues", dir + "/" + name,
+                             std::filesystem::copy_options::overwrite_existing, error);
+  if (error) return false;
+  g_installed = name;
+  return true;
+}
+
 const Catalogue* UseCatalogue(int queues) {
   static Catalogue current;
-  if (current.queues == queues) return &current;
+  if (current.queues == queues) return InstallQueueFile("bench") ? &current : nullptr;
   current = Catalogue();
   std::vector<MonitorQueue> catalogue;
   std::vector<std::string> roots;
@@ -281,8 +307,10 @@ const Catalogue* UseCatalogue(int queues) {
     }
     catalogue.emplace_back(value);
   }
-  const std::string dir = MonitorQueue::GetConfDir(ZORV::ZORVNOTIFYD::MONITOR_QUEUE_TYPE_ETC_DIR);
-  if (!MonitorQueue::SaveToFile(catalogue, dir + "/bench")) return nullptr;
+  g_installed.clear();  // another catalogue of that name
+  if (!MonitorQueue::SaveToFile(catalogue, kRoot + "/bench.queues") || !InstallQueueFile("bench")) {
+    return nullptr;
+  }
   // The bare reader watches each tree with the mask the daemon gives it.
   const MonitorQueueIndex index(catalogue);
   std::ofstream file(kRootsFile, std::ios::trunc);
@@ -307,6 +335,18 @@ const Catalogue* UseCatalogue(int queues) {
   current.directories = 1 + kTreeDirs + (seen.size() - 1) + 2 * static_cast<size_t>(queues - 1);
   current.queues = queues;
   return &current;
+}
+
+// |args| run under the profiler named by $DAEMON_BENCH_PROFILE (words
+// split on spaces, e.g. "perf record -g -o /abs/perf.data --"), for the
+// start-ups measured; as they are without it.
+std::vector<std::string> Profiled(std::vector<std::string> args) {
+  const char* profiler = std::getenv("DAEMON_BENCH_PROFILE");
+  if (profiler == nullptr) return args;
+  std::istringstream words(profiler);
+  std::vector<std::string> command(std::istream_iterator<std::string>(words), {});
+  command.insert(command.end(), args.begin(), args.end());
+  return command;
 }
 
 // A child process, its standard output and error read by a thread, which
@@ -764,16 +804,29 @@ void BareLoad(benchmark::State& state, int queues, Load load) {
   state.SetLabel("bare inotify reader process, the same watches and masks: read and count");
 }
 
-// From exec to the daemon's "ready" line.
-void DaemonStartup(benchmark::State& state) {
+const std::string kStateDir = kRoot + "/state";
+
+// From exec to the daemon's "ready" line at 1,000 queues, journals on: the
+// first start (|first|: no state yet, so it makes every journal and gives
+// each tree a rescan record) or a later one (the state of an earlier start).
+void DaemonStartup(benchmark::State& state, bool first) {
   const Catalogue* catalogue = UseCatalogue(kMaxQueues);
   if (catalogue == nullptr) {
     state.SkipWithError("cannot write the catalogue");
     return;
   }
+  const std::vector<std::string> args = {ZORVNOTIFYD_PATH, "--socket", kSocket, "--state-dir",
+                                         kStateDir,        "--retry",  "600"};
   for (auto _ : state) {
+    state.PauseTiming();
+    std::filesystem::remove_all(kStateDir);
+    if (!first) {
+      Child earlier(args);  // saves its state as it stops
+      earlier.WaitFor("ready:", std::chrono::seconds(60));
+    }
+    state.ResumeTiming();
     const auto start = Clock::now();
-    Child daemon({ZORVNOTIFYD_PATH, "--socket", kSocket});
+    Child daemon(Profiled(args));
     const std::string ready = daemon.WaitFor("ready:", std::chrono::seconds(60));
     state.SetIterationTime(std::chrono::duration<double>(Clock::now() - start).count());
     if (ready.find("watching " + std::to_string(catalogue->directories) + " directories") ==
@@ -783,7 +836,33 @@ void DaemonStartup(benchmark::State& state) {
     }
   }
   state.SetLabel(Thousands(kMaxQueues) + " queues of 8 configurations, " +
-                 Thousands(static_cast<long>(catalogue->directories)) + " directories");
+                 Thousands(static_cast<long>(catalogue->directories)) + " directories, " +
+                 (first ? "first start (journals made)" : "later start"));
+}
+
+// From exec to inotifywait's "Watches established." over the same trees
+// (inotifywait -m -r, every tree from a file).
+void InotifywaitStartup(benchmark::State& state) {
+  const Catalogue* catalogue = UseCatalogue(kMaxQueues);
+  const std::string list = kRoot + "/roots-inotifywait";
+  std::ifstream roots(kRootsFile);
+  std::ofstream paths(list, std::ios::trunc);
+  for (std::string mask, path; roots >> mask >> path;) paths << path << '\n';
+  if (catalogue == nullptr || !paths.flush()) {
+    state.SkipWithError("cannot write the list of trees");
+    return;
+  }
+  for (auto _ : state) {
+    const auto start = Clock::now();
+    Child watcher({INOTIFYWAIT_PATH, "-m", "-r", "--fromfile", list});
+    const std::string ready = watcher.WaitFor("Watches established.", std::chrono::seconds(60));
+    state.SetIterationTime(std::chrono::duration<double>(Clock::now() - start).count());
+    if (ready.empty()) {
+      state.SkipWithError(("inotifywait did not start as expected: " + watcher.Output()).c_str());
+      return;
+    }
+  }
+  state.SetLabel("inotifywait -m -r, the same trees");
 }
 
 // From exec to the bare reader's "ready" line: every watch added.
@@ -807,7 +886,6 @@ void BareStartup(benchmark::State& state) {
 }
 
 const std::string kSnapTree = kRoot + "/snap";
-const std::string kStateDir = kRoot + "/state";
 const std::string kSnapRoots = kRoot + "/snap-roots";
 constexpr int kSnapDirs = 10000, kSnapFilesPerDir = 10;
 
@@ -815,9 +893,7 @@ constexpr int kSnapDirs = 10000, kSnapFilesPerDir = 10;
 // files in every one) and a catalogue of one queue on it.  False on failure.
 bool UseSnapshotTree() {
   static bool made = false;
-  if (made) return true;
-  const std::string conf = MonitorQueue::GetConfDir(ZORV::ZORVNOTIFYD::MONITOR_QUEUE_TYPE_ETC_DIR);
-  std::filesystem::remove(conf + "/bench");
+  if (made) return InstallQueueFile("snap");
   std::vector<std::string> dirs;
   for (int i = 0; i < 100; ++i) {
     const std::string top = kSnapTree + "/t" + std::to_string(i);
@@ -838,7 +914,10 @@ bool UseSnapshotTree() {
   value["queue"] = "snap";
   value["config"][0]["path"] = kSnapTree;
   value["config"][0]["mask"] = IN_CREATE | IN_CLOSE_WRITE | IN_DELETE;
-  if (!MonitorQueue::SaveToFile({MonitorQueue(value)}, conf + "/snap")) return false;
+  if (!MonitorQueue::SaveToFile({MonitorQueue(value)}, kRoot + "/snap.queues") ||
+      !InstallQueueFile("snap")) {
+    return false;
+  }
   std::ofstream roots(kSnapRoots, std::ios::trunc);
   roots << "0x" << std::hex << (IN_CREATE | IN_CLOSE_WRITE | IN_DELETE | kTreeKeeping) << std::dec
         << ' ' << kSnapTree << '\n';
@@ -853,9 +932,10 @@ double SnapshotBytesPerEntry() {
   return double(bytes) / double(kSnapDirs - 1 + kSnapDirs * kSnapFilesPerDir);
 }
 
-// From exec to "ready" on the comparison's tree, with the snapshot of an
-// earlier start (|saved|) or none.
-void SnapshotStartup(benchmark::State& state, bool saved) {
+// From exec to "ready" on the comparison's tree (the walk that sets the
+// watches), or with |compared| to the end of the comparison that follows,
+// with the snapshot of an earlier start (|saved|) or none.
+void SnapshotStartup(benchmark::State& state, bool saved, bool compared) {
   if (!UseSnapshotTree()) {
     state.SkipWithError("cannot make the tree");
     return;
@@ -868,22 +948,24 @@ void SnapshotStartup(benchmark::State& state, bool saved) {
     std::filesystem::remove_all(kStateDir);
     if (saved) {
       Child first(args);  // saves its snapshot as it stops
-      first.WaitFor("ready:", std::chrono::seconds(60));
+      first.WaitFor("compared ", std::chrono::seconds(60));
     }
     state.ResumeTiming();
     const auto start = Clock::now();
-    Child daemon(args);
+    Child daemon(Profiled(args));
     const std::string ready = daemon.WaitFor("ready:", std::chrono::seconds(60));
+    const bool done = !compared || !daemon.WaitFor("compared ", std::chrono::seconds(60)).empty();
     state.SetIterationTime(std::chrono::duration<double>(Clock::now() - start).count());
-    if (ready.find(expected) == std::string::npos) {
+    if (ready.find(expected) == std::string::npos || !done) {
       state.SkipWithError(("the daemon did not start as expected: " + daemon.Output()).c_str());
       return;
     }
   }
   state.counters["snapshot_bytes_per_entry"] = SnapshotBytesPerEntry();
   state.SetLabel("1 queue on 10,000 directories of 100,000 files, " +
-                 std::string(saved ? "each compared with the saved snapshot"
-                                   : "no snapshot yet (first start)"));
+                 std::string(!compared ? "the walk that sets the watches"
+                             : saved   ? "each compared with the saved snapshot"
+                                       : "no snapshot yet (first start)"));
 }
 
 // From exec to the bare reader's "ready" on the comparison's tree.
@@ -955,25 +1037,49 @@ int main(int argc, char** argv) {
           ->ComputeStatistics("max", Max);
     }
   }
-  benchmark::RegisterBenchmark("lib/zorvnotifyd/start-up, exec to ready", DaemonStartup)
-      ->Iterations(1)
-      ->UseManualTime()
-      ->Unit(benchmark::kMillisecond);
-  benchmark::RegisterBenchmark("base/zorvnotifyd/start-up, exec to ready", BareStartup)
-      ->Iterations(1)
-      ->UseManualTime()
-      ->Unit(benchmark::kMillisecond);
-  // Last: these replace the catalogue.
-  for (const bool saved : {true, false}) {
-    benchmark::RegisterBenchmark(
-        saved ? "lib/zorvnotifyd/start-up compared with a snapshot, exec to ready"
-              : "lib/zorvnotifyd/start-up without a snapshot, exec to ready",
-        SnapshotStartup, saved)
+  for (const bool first : {false, true}) {
+    benchmark::RegisterBenchmark(first ? "lib/zorvnotifyd/first start-up, exec to ready"
+                                       : "lib/zorvnotifyd/start-up, exec to ready",
+                                 DaemonStartup, first)
         ->Iterations(3)
         ->UseManualTime()
         ->Unit(benchmark::kMillisecond);
   }
-  benchmark::RegisterBenchmark("base/zorvnotifyd/start-up compared with a snapshot, exec to ready",
+  // inotifywait beside the same baseline: the two ratios compare.
+  if (access(INOTIFYWAIT_PATH, X_OK) == 0) {
+    benchmark::RegisterBenchmark("lib/inotifywait/start-up, exec to ready", InotifywaitStartup)
+        ->Iterations(3)
+        ->UseManualTime()
+        ->Unit(benchmark::kMillisecond);
+  }
+  for (const char* name : {"base/zorvnotifyd/start-up, exec to ready",
+                           "base/zorvnotifyd/first start-up, exec to ready",
+                           "base/inotifywait/start-up, exec to ready"}) {
+    benchmark::RegisterBenchmark(name, BareStartup)
+        ->Iterations(3)
+        ->UseManualTime()
+        ->Unit(benchmark::kMillisecond);
+  }
+  // On a catalogue of their own.  The comparison beside the walk
+  // that only sets the watches (exec to "ready"), and that walk beside the
+  // bare reader's.
+  for (const bool saved : {true, false}) {
+    benchmark::RegisterBenchmark(
+        saved ? "lib/zorvnotifyd/start-up compared with a snapshot, exec to compared"
+              : "lib/zorvnotifyd/start-up without a snapshot, exec to compared",
+        SnapshotStartup, saved, true)
+        ->Iterations(3)
+        ->UseManualTime()
+        ->Unit(benchmark::kMillisecond);
+  }
+  for (const char* name : {"base/zorvnotifyd/start-up compared with a snapshot, exec to compared",
+                           "lib/zorvnotifyd/start-up on the snapshot's tree, exec to ready"}) {
+    benchmark::RegisterBenchmark(name, SnapshotStartup, true, false)
+        ->Iterations(3)
+        ->UseManualTime()
+        ->Unit(benchmark::kMillisecond);
+  }
+  benchmark::RegisterBenchmark("base/zorvnotifyd/start-up on the snapshot's tree, exec to ready",
                                BareSnapshotStartup)
       ->Iterations(3)
       ->UseManualTime()

@@ -16,12 +16,22 @@ OfflineChanges::OfflineChanges(TreeSnapshot* tree) : tree_(tree), saved_(std::mo
   tree_->RewriteAll();
 }
 
-void OfflineChanges::Add(const std::string& dir, const SnapshotEntry& entry, uint32_t mask) {
+void OfflineChanges::Add(const std::string& dir, const SnapshotEntry& entry, uint32_t mask,
+                         const LiveNames* live) {
+  if (live != nullptr) {
+    const auto seen = live->find(entry.name);
+    const uint32_t told = seen == live->end() ? 0 : seen->second;
+    const uint32_t same = mask == IN_CREATE   ? IN_CREATE | IN_MOVED_TO
+                          : mask == IN_DELETE ? IN_DELETE | IN_MOVED_FROM
+                                              : kChanged;
+    if (told & same) return;
+  }
   changes_.push_back({dir + "/" + entry.name, mask | (entry.is_dir ? IN_ISDIR : 0u), entry.ino,
                       entry.size, entry.mtime_ns});
 }
 
-const SnapshotListing& OfflineChanges::Directory(const std::string& path, SnapshotListing listing) {
+const SnapshotListing& OfflineChanges::Directory(const std::string& path, SnapshotListing listing,
+                                                 const LiveNames* live) {
   // The saved listing of this directory: at the same path when it is the
   // same directory (or the tree's root, whatever its inode), else where
   // the same inode was (it moved), else none.
@@ -47,18 +57,18 @@ const SnapshotListing& OfflineChanges::Directory(const std::string& path, Snapsh
                       : b == listing.entries.end() ? -1
                                                    : a->name.compare(b->name);
     if (order < 0) {
-      Add(path, *a++, IN_DELETE);
+      Add(path, *a++, IN_DELETE, live);
     } else if (order > 0) {
-      Add(path, *b++, IN_CREATE);
+      Add(path, *b++, IN_CREATE, live);
     } else if (a->ino != b->ino || a->is_dir != b->is_dir) {
-      Add(path, *a++, IN_DELETE);
-      Add(path, *b++, IN_CREATE);
+      Add(path, *a++, IN_DELETE, live);
+      Add(path, *b++, IN_CREATE, live);
     } else {
       // A directory's own times change with its entries, which are
       // compared in turn.
       if (!b->is_dir &&
           (a->size != b->size || a->mtime_ns != b->mtime_ns || a->ctime_ns != b->ctime_ns)) {
-        Add(path, *b, kChanged);
+        Add(path, *b, kChanged, live);
       }
       ++a;
       ++b;
@@ -74,7 +84,8 @@ void OfflineChanges::Finish(EventSink& sink) {
   // Directories not met again went with their parents: all they held is
   // gone (their parents' comparison told of the directories themselves).
   for (const auto& [dir, listing] : saved_) {
-    for (const SnapshotEntry& entry : listing.entries) Add(dir, entry, IN_DELETE);
+    const LiveNames* live = live_ ? live_(dir) : nullptr;
+    for (const SnapshotEntry& entry : listing.entries) Add(dir, entry, IN_DELETE, live);
   }
   saved_.clear();
   // An inode deleted at one path and created at another moved.

@@ -6,6 +6,7 @@
 #define ZORVNOTIFYD_DAEMON_OFFLINE_CHANGES_H_
 
 #include <cstdint>
+#include <functional>
 #include <map>
 #include <string>
 #include <unordered_map>
@@ -27,8 +28,18 @@ class OfflineChanges {
   // (sorted by name).  Compares it with the saved listing of that path, or
   // with that of the same directory at another path (it moved), in one
   // pass over both; the entries of a directory never seen before are
-  // created.  Returns the listing as now kept in the tree.
-  const SnapshotListing& Directory(const std::string& path, SnapshotListing listing);
+  // created.  A change of an entry whose name |live| holds with an event of
+  // the same kind (created or moved in; deleted or moved away; written)
+  // is left out: that event tells it.  Returns the listing as now kept in
+  // the tree.
+  const SnapshotListing& Directory(const std::string& path, SnapshotListing listing,
+                                   const LiveNames* live = nullptr);
+
+  // For Finish: the events of the directory at |path| (its path when the
+  // walk began), or nullptr.
+  void set_live(std::function<const LiveNames*(const std::string& path)> live) {
+    live_ = std::move(live);
+  }
 
   // Tells |sink| every change found (Offline), directories the walk did
   // not meet again counting as deleted with everything they held; an
@@ -44,14 +55,16 @@ class OfflineChanges {
     int64_t mtime_ns;
   };
   // Records change |mask| (IN_ISDIR added for a directory) of |entry| of
-  // directory |dir|.
-  void Add(const std::string& dir, const SnapshotEntry& entry, uint32_t mask);
+  // directory |dir|, unless |live| told it.
+  void Add(const std::string& dir, const SnapshotEntry& entry, uint32_t mask,
+           const LiveNames* live);
 
   TreeSnapshot* tree_;
   std::map<std::string, SnapshotListing> saved_;            // not met again yet
   std::unordered_map<uint64_t, std::string> saved_by_ino_;  // made on the first need
   bool indexed_ = false;
   std::vector<Change> changes_;
+  std::function<const LiveNames*(const std::string&)> live_;
 };
 
 }  // namespace zorvnotifyd

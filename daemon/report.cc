@@ -35,13 +35,6 @@ void Head(const CatalogueQueue& entry, bool json, std::string* line) {
   *line += ',';
 }
 
-// True when the tree at |root| holds |path|: the same path, or one below
-// it.
-bool Holds(const std::string& root, const std::string& path) {
-  return path.compare(0, root.size(), root) == 0 &&
-         (path.size() == root.size() || path[root.size()] == '/' || root == "/");
-}
-
 }  // namespace
 
 void Reporter::Use(Catalogue catalogue, std::vector<QueueLog*>* created) {
@@ -52,6 +45,12 @@ void Reporter::Use(Catalogue catalogue, std::vector<QueueLog*>* created) {
   logs_.Follow(catalogue, &logs_by_position_, created);
   catalogue_ = std::move(catalogue);
   found_wanted_.assign(catalogue_.size(), 0);
+  trees_.clear();
+  for (size_t i = 0; i < catalogue_.size(); ++i) {
+    const auto& configs = catalogue_[i].queue._configs;
+    for (size_t j = 0; j < configs.size(); ++j) trees_.emplace_back(configs[j]._path, i, j);
+  }
+  std::sort(trees_.begin(), trees_.end());
 }
 
 void Reporter::Record(size_t i, const std::string& path, uint32_t mask, uint64_t order,
@@ -144,18 +143,31 @@ void Reporter::Lost() {
 
 void Reporter::Rescan(const std::string& path) {
   const uint64_t order = logs_.NextOrder();
-  for (size_t i = 0; i < catalogue_.size(); ++i) {
-    // The narrower of |path| and the queue's tree: the queue hears of
-    // nothing outside its trees.
-    const std::string* what = nullptr;
-    for (const auto& config : catalogue_[i].queue._configs) {
-      if (Holds(config._path, path)) {
-        what = &path;
-        break;
-      }
-      if (what == nullptr && Holds(path, config._path)) what = &config._path;
+  // Per queue, the narrower of |path| and the queue's tree: |path| when a
+  // tree holds it, else the first of its trees (in its order) below it;
+  // the queue hears of nothing outside its trees.  (queue, rank, tree):
+  // rank 0 for a tree holding |path|, 1 + position for one below it.
+  std::vector<std::tuple<size_t, size_t, const std::string*>> hits;
+  const auto add = [&](const std::string& tree, bool holds) {
+    auto it =
+        std::lower_bound(trees_.begin(), trees_.end(), tree,
+                         [](const auto& a, const std::string& b) { return std::get<0>(a) < b; });
+    for (; it != trees_.end() && std::get<0>(*it).compare(0, tree.size(), tree) == 0; ++it) {
+      const std::string& found = std::get<0>(*it);
+      if (holds && found.size() != tree.size()) break;
+      hits.emplace_back(std::get<1>(*it), holds ? 0 : 1 + std::get<2>(*it), holds ? &path : &found);
     }
-    if (what == nullptr) continue;
+  };
+  for (size_t i = 1; i <= path.size(); ++i) {
+    if (i == path.size() || path[i] == '/') add(path.substr(0, i), true);
+  }
+  if (path.size() > 1 && path[0] == '/') add("/", true);
+  add(path == "/" ? path : path + "/", false);
+  std::sort(hits.begin(), hits.end());
+  for (size_t h = 0; h < hits.size(); ++h) {
+    const size_t i = std::get<0>(hits[h]);
+    if (h > 0 && std::get<0>(hits[h - 1]) == i) continue;
+    const std::string* what = std::get<2>(hits[h]);
     QueueLog* log = logs_by_position_[i];
     if (log->last_order != order) {
       log->last_order = order;

@@ -7,6 +7,7 @@
 #include <cstdint>
 #include <functional>
 #include <string>
+#include <tuple>
 #include <vector>
 
 #include "catalogue.h"
@@ -82,7 +83,11 @@ class Reporter : public EventSink {
   ZORV::ZORVNOTIFYD::MonitorQueueIndex index_{{}};
   std::vector<size_t> matches_;         // reused by every event
   std::vector<uint32_t> found_wanted_;  // per queue, for Found
-  std::string line_;                    // reused for standard output
+  // Every configured tree as (path, queue, position in the queue), sorted:
+  // a rescan finds the queues it concerns by its path's prefixes and the
+  // trees below it, not by a pass over every configuration.
+  std::vector<std::tuple<std::string, size_t, size_t>> trees_;
+  std::string line_;  // reused for standard output
   uint64_t events_ = 0;
   uint64_t overflows_ = 0;
 };

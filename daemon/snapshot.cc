@@ -44,6 +44,9 @@ constexpr size_t kRecordHead = 8;  // length and checksum
 // Garbage a file may hold beyond twice its live records before it is
 // written afresh: small trees are not rewritten for every few changes.
 constexpr uint64_t kCompactSlack = 1 << 20;
+// Trees written whole in one save from which one syncfs of the state's
+// file system is cheaper than a fdatasync per file.
+constexpr size_t kSyncTogether = 16;
 
 template <typename T>
 void Append(std::string* out, T value) {
@@ -187,9 +190,8 @@ void TreeSnapshot::Encode(const std::string& path, std::string* out) const {
   Seal(out, start);
 }
 
-bool TreeSnapshot::WriteWhole(int dir) {
-  const std::string name = FileName(root_);
-  const std::string temporary = "." + name + ".tmp";
+UniqueFd TreeSnapshot::WriteTemporary(int dir) {
+  const std::string temporary = "." + FileName(root_) + ".tmp";
   std::string data(kMagic, sizeof(kMagic));
   data.append(kRecordHead, '\0');
   const size_t start = data.size();
@@ -200,20 +202,32 @@ bool TreeSnapshot::WriteWhole(int dir) {
   // A name planted where the temporary file goes is removed, never
   // followed: the file is made anew.
   unlinkat(dir, temporary.c_str(), 0);
-  const UniqueFd out(
+  UniqueFd out(
       openat(dir, temporary.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0600));
-  if (out.get() < 0 || !WriteAll(out.get(), data) || fdatasync(out.get()) != 0 ||
-      renameat(dir, temporary.c_str(), dir, name.c_str()) != 0 || fsync(dir) != 0) {
+  if (out.get() < 0 || !WriteAll(out.get(), data)) {
+    syslog(LOG_ERR, "cannot save the snapshot of tree %s: %s", Quoted(root_).c_str(),
+           strerror(errno));
+    unlinkat(dir, temporary.c_str(), 0);
+    return UniqueFd();
+  }
+  file_bytes_ = live_bytes_ = data.size();
+  return out;
+}
+
+bool TreeSnapshot::Install(int dir) {
+  const std::string name = FileName(root_);
+  const std::string temporary = "." + name + ".tmp";
+  if (renameat(dir, temporary.c_str(), dir, name.c_str()) != 0) {
     syslog(LOG_ERR, "cannot save the snapshot of tree %s: %s", Quoted(root_).c_str(),
            strerror(errno));
     unlinkat(dir, temporary.c_str(), 0);
     return false;
   }
-  file_bytes_ = live_bytes_ = data.size();
+  rewrite_ = false;
   return true;
 }
 
-bool TreeSnapshot::Save(int dir) {
+bool TreeSnapshot::AppendQueued(int dir) {
   if (!rewrite_ && file_bytes_ > 2 * live_bytes_ + kCompactSlack) {
     // The estimate may be stale: count the live records exactly.
     std::string record;
@@ -225,11 +239,7 @@ bool TreeSnapshot::Save(int dir) {
     }
     rewrite_ = file_bytes_ > 2 * live_bytes_ + kCompactSlack;
   }
-  if (rewrite_) {
-    queued_.clear();
-    rewrite_ = !WriteWhole(dir);
-    return !rewrite_;
-  }
+  if (rewrite_) return false;
   if (queued_.empty()) return true;
   std::sort(queued_.begin(), queued_.end());
   queued_.erase(std::unique(queued_.begin(), queued_.end()), queued_.end());
@@ -243,11 +253,11 @@ bool TreeSnapshot::Save(int dir) {
       uint64_t(st.st_size) != file_bytes_ || !WriteAll(out.get(), data) ||
       fdatasync(out.get()) != 0) {
     // Whatever happened to the file (a write cut short, or it was changed
-    // behind the daemon's back), the next save writes it whole.
+    // behind the daemon's back), it is written whole.
     syslog(LOG_WARNING, "cannot append to the snapshot of tree %s (%s): writing it afresh",
            Quoted(root_).c_str(), out.get() < 0 ? strerror(errno) : "changed or short write");
-    rewrite_ = !WriteWhole(dir);
-    return !rewrite_;
+    rewrite_ = true;
+    return false;
   }
   file_bytes_ += data.size();
   return true;
@@ -374,8 +384,38 @@ std::vector<std::string> Snapshot::TakeDirty() {
 
 void Snapshot::Save() {
   if (dir_.get() < 0) return;
+  std::vector<std::pair<TreeSnapshot*, UniqueFd>> whole;
   for (auto& [root, tree] : trees_) {
-    if (tree->rewrite_ || !tree->queued_.empty()) tree->Save(dir_.get());
+    if (!tree->rewrite_ && tree->queued_.empty()) continue;
+    if (tree->AppendQueued(dir_.get())) continue;
+    tree->queued_.clear();
+    UniqueFd file = tree->WriteTemporary(dir_.get());
+    if (file.get() >= 0) whole.emplace_back(tree.get(), std::move(file));
+  }
+  if (whole.empty()) return;
+  // Each file is durable before it replaces the old one, so a crash
+  // leaves either whole.  Many new files are synced at once: one commit
+  // of the file system instead of one per file.
+  bool synced = whole.size() >= kSyncTogether && syncfs(dir_.get()) == 0;
+  for (auto it = whole.begin(); it != whole.end();) {
+    if (synced || fdatasync(it->second.get()) == 0) {
+      ++it;
+      continue;
+    }
+    syslog(LOG_ERR, "cannot save the snapshot of tree %s: %s", Quoted(it->first->root()).c_str(),
+           strerror(errno));
+    unlinkat(dir_.get(), ("." + FileName(it->first->root()) + ".tmp").c_str(), 0);
+    it = whole.erase(it);
+  }
+  bool installed = false;
+  for (auto& [tree, file] : whole) {
+    file.Reset();
+    installed |= tree->Install(dir_.get());
+  }
+  if (installed && fsync(dir_.get()) != 0) {
+    // The renames may not be durable yet: the next save writes them again.
+    syslog(LOG_ERR, "cannot sync the snapshot directory: %s", strerror(errno));
+    for (auto& [tree, file] : whole) tree->RewriteAll();
   }
 }
 

@@ -60,11 +60,11 @@ class TreeSnapshot {
   // From now on the next Save writes the whole tree afresh.
   void RewriteAll() { rewrite_ = true; }
 
-  // Appends the queued records to the tree's file in |dir| (or writes it
-  // whole when needed: first save, after a rewrite was asked, or once the
-  // file holds more than twice the live records), then fdatasync()s it.
-  // False on a failed write (logged; the next Save writes the whole file).
-  bool Save(int dir);
+  // Appends the queued records to the tree's file in |dir| and
+  // fdatasync()s it.  False when the file must be written whole instead:
+  // first save, after a rewrite was asked, once the file holds more than
+  // twice the live records, or when appending failed (logged).
+  bool AppendQueued(int dir);
   // The bytes the live records take on disk.
   uint64_t live_bytes() const { return live_bytes_; }
 
@@ -73,8 +73,12 @@ class TreeSnapshot {
   // Appends the record of |path| (its listing, or "forgotten" when it has
   // none) to |out|.
   void Encode(const std::string& path, std::string* out) const;
-  // Writes every listing to a new file and renames it over the old one.
-  bool WriteWhole(int dir);
+  // Writes every listing to a new temporary file in |dir|, not synced;
+  // its descriptor, or an empty one (logged, the temporary removed).
+  UniqueFd WriteTemporary(int dir);
+  // Renames the temporary file, synced by the caller, over the tree's
+  // file; false (logged) on failure.
+  bool Install(int dir);
 
   std::string root_;
   std::map<std::string, SnapshotListing> dirs_;
@@ -114,7 +118,10 @@ class Snapshot {
   // Takes the set of directories marked since the last call.
   std::vector<std::string> TakeDirty();
 
-  // Saves every tree with queued changes (see TreeSnapshot::Save).
+  // Saves every tree with queued changes: appends where it can, and
+  // writes the other trees' files whole, synced together (one syncfs when
+  // there are many, else one fdatasync each), renamed in place and the
+  // directory synced once.
   void Save();
 
   // The most bytes a tree's file may hold: a larger one is not read.

@@ -11,6 +11,7 @@
 #include <syslog.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <utility>
 
 #include "directory.h"
@@ -152,6 +153,7 @@ void WatchTree::Sync(const std::vector<std::string>& roots,
   }
   NoteUnwatched(std::vector<std::string>(tops.begin(), tops.end()));
   reloading_ = false;
+  compare_later_ = false;
 }
 
 void WatchTree::NoteUnwatched(const std::vector<std::string>& tops) {
@@ -205,6 +207,9 @@ bool WatchTree::Fill(bool* failed) {
     p += sizeof(struct inotify_event) + event->len;
     pending_.push_back(
         {event->wd, event->mask, event->cookie, event->len > 0 ? event->name : std::string()});
+    if (reading_ahead_ && !pending_.back().name.empty()) {
+      live_[event->wd][pending_.back().name] |= event->mask;
+    }
   }
   return true;
 }
@@ -236,6 +241,90 @@ bool WatchTree::ReadEvents(EventSink& sink) {
     }
   }
   return !failed;
+}
+
+size_t WatchTree::Compare() {
+  const std::vector<std::string> roots = std::move(to_compare_);
+  to_compare_.clear();
+  if (snapshot_ == nullptr || sink_ == nullptr) return 0;
+  size_t compared = 0;
+  reading_ahead_ = true;
+  for (const std::string& root : roots) {
+    // A tree gone or replaced since its walk is watched afresh by Tick,
+    // which compares it then.
+    const auto watched = by_path_.find(root);
+    UniqueFd dir = OpenConfiguredDir(root);
+    struct stat st;
+    if (watched == by_path_.end() || dir.get() < 0 || fstat(dir.get(), &st) != 0 ||
+        watches_.at(watched->second).dev != st.st_dev ||
+        watches_.at(watched->second).ino != st.st_ino) {
+      continue;
+    }
+    Snapshot::Known known;
+    OfflineChanges changes(snapshot_->Tree(root, &known));
+    // A directory not met again is known by the path it was watched at:
+    // its events are not handled yet.
+    changes.set_live([this](const std::string& path) -> const LiveNames* {
+      const auto at = by_path_.find(path);
+      const auto names = at == by_path_.end() ? live_.end() : live_.find(at->second);
+      return names == live_.end() ? nullptr : &names->second;
+    });
+    std::vector<std::pair<dev_t, ino_t>> ancestors;
+    CompareDir(dir.get(), root, changes, ancestors);
+    ++compared;
+    if (known == Snapshot::Known::kSaved) {
+      changes.Finish(*sink_);
+    } else {
+      sink_->Rescan(root);  // nothing saved of it: what happened before is unknown
+    }
+  }
+  reading_ahead_ = false;
+  live_.clear();
+  // The events read ahead are told now, after the changes: the kernel's
+  // queue may be empty, and polling it would not wake for them.
+  if (!pending_.empty()) ReadEvents(*sink_);
+  return compared;
+}
+
+void WatchTree::ReadAhead() {
+  // As many as the kernel's own queue holds by default: under a flood the
+  // rest stays in the kernel, and at worst a change is told twice.
+  constexpr size_t kMaxAhead = 16384;
+  bool failed = false;
+  while (pending_.size() < kMaxAhead && Fill(&failed)) {
+  }
+}
+
+void WatchTree::CompareDir(int dir, const std::string& path, OfflineChanges& changes,
+                           std::vector<std::pair<dev_t, ino_t>>& ancestors) {
+  struct stat st;
+  if (fstat(dir, &st) != 0) return;
+  const std::pair<dev_t, ino_t> id(st.st_dev, st.st_ino);
+  for (const auto& ancestor : ancestors) {
+    if (ancestor == id) return;  // a bind mount of a directory inside itself
+  }
+  SnapshotListing listing;
+  listing.ino = st.st_ino;
+  ListWithStatus(dir, &listing);
+  // Every event of this directory from before its listing is read now.
+  ReadAhead();
+  const auto watch = by_inode_.find(id);
+  const auto names = watch == by_inode_.end() ? live_.end() : live_.find(watch->second);
+  const LiveNames* live = names == live_.end() ? nullptr : &names->second;
+  const SnapshotListing& seen = changes.Directory(path, std::move(listing), live);
+  ancestors.push_back(id);
+  for (const SnapshotEntry& entry : seen.entries) {
+    if (!entry.is_dir) continue;
+    // Made since its parent was watched: its event scans it.
+    const auto told = live == nullptr ? LiveNames::const_iterator() : live->find(entry.name);
+    if (live != nullptr && told != live->end() && (told->second & (IN_CREATE | IN_MOVED_TO)) &&
+        by_inode_.count({st.st_dev, ino_t(entry.ino)}) == 0) {
+      continue;
+    }
+    UniqueFd sub = OpenSubdir(dir, entry.name);
+    if (sub.get() >= 0) CompareDir(sub.get(), path + "/" + entry.name, changes, ancestors);
+  }
+  ancestors.pop_back();
 }
 
 void WatchTree::Clear() {
@@ -366,6 +455,11 @@ bool WatchTree::WatchRootTree(const std::string& root, WalkContext& context, std
     Walk(dir.get(), root, context);
     return true;
   }
+  if (compare_later_ && context.found == nullptr) {
+    Walk(dir.get(), root, context);
+    to_compare_.push_back(root);
+    return true;
+  }
   Snapshot::Known known;
   OfflineChanges changes(snapshot_->Tree(root, &known));
   EventSink* found = std::exchange(context.found, nullptr);
@@ -435,7 +529,14 @@ void WatchTree::Walk(int dir, const std::string& path, WalkContext& context) {
       if (entry.is_dir) descend(entry.name, path + "/" + entry.name);
     }
   } else {
-    for (const DirEntry& entry : ListDir(dir)) {
+    std::vector<DirEntry> entries = ListDir(dir);
+    // In name order, as a comparison walks: the same directories are
+    // watched first whichever walk meets them under the watch limit.
+    if (context.found == nullptr) {
+      std::sort(entries.begin(), entries.end(),
+                [](const DirEntry& a, const DirEntry& b) { return a.name < b.name; });
+    }
+    for (const DirEntry& entry : entries) {
       const std::string child = path + "/" + entry.name;
       if (context.found != nullptr) context.found->Found(child, entry.is_dir);
       if (entry.is_dir) descend(entry.name, child);

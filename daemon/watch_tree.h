@@ -53,6 +53,11 @@ class EventSink {
   virtual void Rescan(const std::string& path) = 0;
 };
 
+// The kinds of the events the kernel reported, since a directory was
+// watched, for each name in it: a comparison made after the watch leaves
+// out what these already told.
+using LiveNames = std::unordered_map<std::string, uint32_t>;
+
 // The watches of one inotify instance over a set of trees.  Paths are byte
 // strings built from the roots as configured: a child's path is its
 // directory's path, "/" and its name.  One directory reached through
@@ -126,6 +131,19 @@ class WatchTree {
     snapshot_ = snapshot;
     sink_ = sink;
   }
+  // The next Sync only sets the watches of the trees it would compare
+  // with the snapshot, leaving the comparisons to Compare: a start is
+  // ready once its watches are in place.
+  void CompareLater() { compare_later_ = true; }
+  // Compares each tree the last Sync left to compare with the snapshot
+  // (see UseSnapshot), tree by tree, telling the sink what changed.
+  // Events the kernel reports meanwhile are read (a bounded number) and
+  // left for ReadEvents: an entry changed after its directory was watched
+  // but before it was compared is told by its event alone, never also as
+  // an offline change of the same kind.  A directory created since its
+  // parent was watched is left to that event, which scans it.  Returns
+  // the number of trees compared.
+  size_t Compare();
   // Saves the snapshot as it stands in memory.
   void SaveSnapshot();
   // Lists again every directory whose entries events changed since the
@@ -194,6 +212,13 @@ class WatchTree {
   // entries as Found; with |compare| and a snapshot, compares it with the
   // snapshot instead.  False (with |why|) when the root cannot be opened.
   bool WatchRootTree(const std::string& root, WalkContext& context, std::string* why, bool compare);
+  // Compares the open directory |dir| at |path| and those below it, for
+  // Compare, without following links.
+  void CompareDir(int dir, const std::string& path, OfflineChanges& changes,
+                  std::vector<std::pair<dev_t, ino_t>>& ancestors);
+  // Reads the events queued now into pending_ (up to a bound), noting the
+  // kinds of each name in live_.
+  void ReadAhead();
   // Tells sink_ to rescan each of |tops| not told already.
   void NoteUnwatched(const std::vector<std::string>& tops);
   // Lists the watched directory |path| into |listing|; false when it is
@@ -241,10 +266,14 @@ class WatchTree {
   std::set<uint32_t> moves_;  // cookies of directory moves within the trees, already done
   std::string entry_path_;    // Handle's buffer for the path of an event's entry
   Snapshot* snapshot_ = nullptr;
-  EventSink* sink_ = nullptr;             // where comparisons and rescans go
-  std::set<std::string> unwatched_tops_;  // told to rescan, over the watch limit
-  bool synced_ = false;                   // Sync ran before
-  bool reloading_ = false;                // within a Sync that is not the first
+  EventSink* sink_ = nullptr;                // where comparisons and rescans go
+  std::set<std::string> unwatched_tops_;     // told to rescan, over the watch limit
+  bool synced_ = false;                      // Sync ran before
+  bool compare_later_ = false;               // the next Sync leaves comparisons to Compare
+  std::vector<std::string> to_compare_;      // roots Compare compares
+  bool reading_ahead_ = false;               // Fill notes names in live_
+  std::unordered_map<int, LiveNames> live_;  // by watch: what events told, while comparing
+  bool reloading_ = false;                   // within a Sync that is not the first
   double retry_seconds_;
 };
 

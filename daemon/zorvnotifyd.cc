@@ -136,6 +136,18 @@ UniqueFd OpenSignals() {
   return fd;
 }
 
+// Compares the trees that the start's walk watched with what was saved of
+// them, after READY: a start is ready once its watches are in place, and
+// the changes found are numbered before any event that came meanwhile.
+void CompareAfterReady(WatchTree& tree) {
+  const int64_t start = NowMs();
+  const size_t trees = tree.Compare();
+  if (trees > 0) {
+    syslog(LOG_INFO, "compared %zu trees with their snapshot in %lld ms", trees,
+           (long long)(NowMs() - start));
+  }
+}
+
 // READY=1 with the status line the service manager shows for the daemon.
 std::string ReadyState(size_t directories, size_t queues) {
   return "READY=1\nSTATUS=watching " + std::to_string(directories) + " directories for " +
@@ -246,10 +258,12 @@ int Serve(const Options& options) {
     tree.Sync(roots, reporter.index());
     server.FollowNew(created);
   };
+  tree.CompareLater();
   load();
-  sync.Wrote(NowMs());  // the views of the trees walked
   syslog(LOG_INFO, "ready: watching %zu directories for %zu queues", tree.size(), reporter.size());
   NotifyServiceManager(ReadyState(tree.size(), reporter.size()));
+  CompareAfterReady(tree);
+  sync.Wrote(NowMs());  // the views of the trees compared
   const int64_t retry_ms = std::max<int64_t>(1, int64_t(options.retry_seconds * 1000));
   int64_t next_tick = NowMs() + retry_ms;
   struct pollfd fds[] = {{signals.get(), POLLIN, 0},

@@ -895,15 +895,16 @@ TEST_F(DaemonTest, ReportsWhatChangedWhileItWasStopped) {
       IN_CREATE | IN_MODIFY | IN_CLOSE_WRITE | IN_DELETE | IN_MOVED_FROM | IN_MOVED_TO;
   Register("o", "/tmp/o", kAll);
   // Each run: the records after |seq| until one ending in |last|, |seq|
-  // moved to the last one; |log| is a line the daemon must log first;
+  // moved to the last one; |log| is a line the daemon must log after "ready";
   // with |out| the daemon is left running there.
   std::string journal;
   int seq = 0;
   auto run = [&journal, &seq](const std::string& last, const std::string& log = "",
                               std::unique_ptr<Daemon>* out = nullptr) {
     auto daemon = std::make_unique<Daemon>(Lines{"--retry", "0.05"});
-    EXPECT_TRUE(log.empty() || daemon->Logged(log)) << log;
+    // Ready once the watches are in place: the comparison comes after.
     EXPECT_TRUE(daemon->Logged("ready: watching"));
+    EXPECT_TRUE(log.empty() || daemon->Logged(log)) << log;
     Client client;
     const std::string id = Subscribe(client, "o", seq)["journal"].asString();
     EXPECT_EQ(id, journal.empty() ? id : journal);
@@ -994,6 +995,39 @@ TEST_F(DaemonTest, ReportsWhatChangedWhileItWasStopped) {
                    line(n + 7, "new", IN_DELETE), line(n + 8, "newdir", IN_DELETE | IN_ISDIR),
                    line(n + 9, "same", IN_DELETE), line(n + 10, "d/moved", IN_DELETE),
                    line(n + 11, "d3/inner", IN_DELETE | IN_ISDIR)}));
+
+  // A file made after "ready", while a large tree compared first keeps the
+  // comparison from /tmp/o, is told once, by its events: the comparison
+  // that then lists it leaves it out.
+  ASSERT_EQ(mkdir("/tmp/n", 0755), 0);
+  for (int i = 0; i < 20000; ++i) {
+    ASSERT_EQ(close(open(("/tmp/n/" + std::to_string(i)).c_str(), O_CREAT | O_WRONLY, 0644)), 0);
+  }
+  Register("slow", "/tmp/n", IN_DELETE_SELF);
+  {
+    Daemon first(Lines{});  // saves /tmp/n
+    ASSERT_TRUE(first.Logged("compared 2 trees with their snapshot"));
+    EXPECT_EQ(first.Stop(SIGTERM), 0);
+  }
+  // No periodic look: only the events themselves wake the daemon.
+  Daemon daemon2(Lines{"--retry", "600"});
+  ASSERT_TRUE(daemon2.Logged("ready: watching"));
+  ASSERT_TRUE(Put("/tmp/o/late", "x"));
+  ASSERT_TRUE(daemon2.Logged("compared 2 trees with their snapshot"));
+  Client client;
+  Subscribe(client, "o", seq);
+  Lines got;
+  const auto until = [&client, &got](const std::string& last) {
+    while (got.size() < 10 && (got.empty() || got.back() != last)) {
+      const std::string record = Record(client);
+      if (record.empty()) return;
+      got.push_back(record.substr(record.find(' ') + 1));
+    }
+  };
+  until("/tmp/o/late 8");
+  ASSERT_TRUE(Put("/tmp/o/end", ""));
+  until("/tmp/o/end 256");
+  EXPECT_EQ(got, Lines({"/tmp/o/late 256", "/tmp/o/late 2", "/tmp/o/late 8", "/tmp/o/end 256"}));
 }
 
 // The status reply of the daemon on the default socket.
