@@ -27,8 +27,10 @@ std::string RandomPath(std::mt19937& random, int max) {
 }
 
 std::vector<MonitorQueue> RandomCatalogue(std::mt19937& random, int queues) {
-  // Patterns that match, do not, are anchored, and do not compile.
-  static const char* const kPatterns[] = {"a$", "^/a/", "b", "[", "/$", "^/b", "(a"};
+  // Patterns that match, do not, are anchored, and do not compile; literal
+  // shapes and a near miss.
+  static const char* const kPatterns[] = {"a$",  "^/a/", "b",       "[",  "/$",
+                                          "^/b", "(a",   "/a(/|$)", "a.b"};
   std::vector<MonitorQueue> catalogue;
   for (int q = 0; q < queues; ++q) {
     Json::Value json;
@@ -37,7 +39,7 @@ std::vector<MonitorQueue> RandomCatalogue(std::mt19937& random, int queues) {
       Json::Value config;
       config["path"] = RandomPath(random, 4);
       config["mask"] = Json::UInt(random() % 8);
-      for (int p = int(random() % 3); p > 0; --p) config["ignore"].append(kPatterns[random() % 7]);
+      for (int p = int(random() % 3); p > 0; --p) config["ignore"].append(kPatterns[random() % 9]);
       json["config"].append(config);
     }
     catalogue.emplace_back(json);
