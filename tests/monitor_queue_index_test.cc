@@ -41,6 +41,7 @@ std::vector<MonitorQueue> RandomCatalogue(std::mt19937& random, int queues) {
       config["mask"] = Json::UInt(random() % 8);
       for (int p = int(random() % 3); p > 0; --p) config["ignore"].append(kPatterns[random() % 9]);
       json["config"].append(config);
+      if (random() % 3 == 0) json["config"].append(config);  // twice in one queue
     }
     catalogue.emplace_back(json);
   }
