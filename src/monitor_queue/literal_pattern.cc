@@ -13,18 +13,39 @@ namespace ZORVNOTIFYD {
 
 namespace {
 
-// True when |c| stands for itself unescaped in an extended regular
-// expression.  Control bytes and bytes above 0x7F are refused: their
-// meaning depends on the locale.
-bool IsPlainByte(char c) {
-  return c >= 0x20 && c < 0x7f && std::strchr(".[]()*+?{}|^$\\", c) == nullptr;
-}
+// What a byte of a pattern is to Parse.
+enum ByteClass : unsigned char {
+  kOther,    // ends the literal shapes
+  kPlain,    // stands for itself
+  kEscaped,  // punctuation that stands for itself after "\" (but not alone)
+  kBoth,     // punctuation that stands for itself either way
+};
 
-// True when "\" followed by |c| stands for |c|: ASCII punctuation, except
-// the four escapes glibc reads as anchors (word edges, buffer edges).
-// Letters and digits are refused (classes and back-references).
-bool IsEscapedByte(char c) {
-  return c != '\0' && std::strchr("!\"#$%&()*+,-./:;=?@[\\]^_{|}~", c) != nullptr;
+// The class of every byte.  Plain: printable ASCII other than the
+// operators . [ ] ( ) * + ? { } | ^ $ \; control bytes and bytes above 0x7F
+// mean what the locale makes of them.  Escaped: ASCII punctuation except
+// the four escapes glibc reads as anchors (< > ` ': word and buffer
+// edges); letters and digits are classes and back-references.
+struct ByteClasses {
+  ByteClass of[256] = {};
+  constexpr ByteClasses() {
+    for (int c = 0x20; c < 0x7f; ++c) of[c] = kPlain;
+    for (const char* p = ".[]()*+?{}|^$\\"; *p; ++p) of[static_cast<unsigned char>(*p)] = kOther;
+    for (const char* p = "!\"#$%&()*+,-./:;=?@[\\]^_{|}~"; *p; ++p) {
+      ByteClass& c = of[static_cast<unsigned char>(*p)];
+      c = c == kPlain ? kBoth : kEscaped;
+    }
+  }
+};
+constexpr ByteClasses kClasses;
+
+// True when |p| is "(/|$)" or "($|/)" and nothing after it.  Each byte is
+// read only after the one before it proved not to be the final NUL.
+bool IsSlashOrEnd(const char* p) {
+  return p[0] == '(' &&
+         ((p[1] == '/' && p[2] == '|' && p[3] == '$') ||
+          (p[1] == '$' && p[2] == '|' && p[3] == '/')) &&
+         p[4] == ')' && p[5] == '\0';
 }
 
 // The first position at or after |from| where the |size| bytes at |needle|
@@ -43,20 +64,22 @@ bool LiteralPattern::Parse(const char* pattern) {
   if (at_start_) ++pattern;
   end_ = End::kAnywhere;
   for (;;) {
-    if (*pattern == '\0') break;
-    if (pattern[0] == '$' && pattern[1] == '\0') {
+    const unsigned char c = static_cast<unsigned char>(pattern[0]);
+    if (c == '\0') break;
+    if (c == '$' && pattern[1] == '\0') {
       end_ = End::kAtEnd;
       break;
     }
-    if (std::strcmp(pattern, "(/|$)") == 0 || std::strcmp(pattern, "($|/)") == 0) {
+    if (IsSlashOrEnd(pattern)) {
       end_ = End::kAtSlashOrEnd;
       break;
     }
     char byte;
-    if (IsPlainByte(pattern[0])) {
+    const ByteClass here = kClasses.of[c];
+    if (here == kPlain || here == kBoth) {
       byte = pattern[0];
       pattern += 1;
-    } else if (pattern[0] == '\\' && IsEscapedByte(pattern[1])) {
+    } else if (c == '\\' && kClasses.of[static_cast<unsigned char>(pattern[1])] >= kEscaped) {
       byte = pattern[1];
       pattern += 2;
     } else {

@@ -32,16 +32,10 @@ bool IsAtOrBelow(const std::string& path, const std::string& dir) {
   return BeginsWith(path, dir) && (path.size() == dir.size() || path[dir.size()] == '/');
 }
 
-// The body of MonitorQueueConfig::IsMonitoring.  The queue form calls it
-// directly: the member functions are exported and therefore interposable,
-// so a call through them would not be inlined.
-inline bool ConfigWants(MonitorQueue::MonitorQueueConfig& config, const std::string& path,
-                        unsigned int mask) {
-  // Cheapest test first: the mask, then the path, and only then the
-  // patterns, which are compiled here on the first call that reaches them.
-  if ((mask & config._mask) == 0) return false;
-  if (!IsAtOrBelow(path, config._path)) return false;
-  if (!config._prepared) config.PrepareRegex();
+// True when an ignore pattern of the prepared |config| matches |path|.
+// Kept out of line, so that the mask and path tests before it stay small.
+__attribute__((noinline)) bool Ignored(const MonitorQueue::MonitorQueueConfig& config,
+                                       const std::string& path) {
   // When every pattern compiled, _regexes[i] is _ignore[i] compiled, and a
   // pattern of a literal shape is answered from its text, as regexec would;
   // otherwise the correspondence is unknown and regexec answers them all.
@@ -57,15 +51,28 @@ inline bool ConfigWants(MonitorQueue::MonitorQueueConfig& config, const std::str
         length = LiteralAnswersHere() ? std::strlen(path.c_str()) : kByRegexec;
       }
       if (length != kByRegexec) {
-        if (literal.Matches(path.c_str(), length)) return false;
+        if (literal.Matches(path.c_str(), length)) return true;
         continue;
       }
     }
     // Any result other than 0 (a match) counts as no match, so a regexec
     // failure leaves the path monitored.
-    if (regexec(&config._regexes[i], path.c_str(), 0, nullptr, 0) == 0) return false;
+    if (regexec(&config._regexes[i], path.c_str(), 0, nullptr, 0) == 0) return true;
   }
-  return true;
+  return false;
+}
+
+// The body of MonitorQueueConfig::IsMonitoring.  The queue form calls it
+// directly: the member functions are exported and therefore interposable,
+// so a call through them would not be inlined.
+inline bool ConfigWants(MonitorQueue::MonitorQueueConfig& config, const std::string& path,
+                        unsigned int mask) {
+  // Cheapest test first: the mask, then the path, and only then the
+  // patterns, which are compiled here on the first call that reaches them.
+  if ((mask & config._mask) == 0) return false;
+  if (!IsAtOrBelow(path, config._path)) return false;
+  if (!config._prepared) config.PrepareRegex();
+  return config._regexes.empty() || !Ignored(config, path);
 }
 
 // The body of MonitorQueueConfig::IsDirMonitoring, shared with the queue
