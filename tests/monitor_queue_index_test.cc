@@ -90,6 +90,19 @@ TEST(MonitorQueueIndexTest, AnswersExactlyAsThePlainCalls) {
       ASSERT_EQ(index.GetWatchMask(path), watch_mask) << path;
     }
   }
+  // More distinct patterns on one path than Match remembers answers for:
+  // the last ones, past the memo, still decide.
+  Json::Value json;
+  json["config"][0]["path"] = "/p";
+  json["config"][0]["mask"] = 1;
+  for (int p = 0; p < 600; ++p) json["config"][0]["ignore"].append("x" + std::to_string(p) + "$");
+  std::vector<MonitorQueue> many = {MonitorQueue(json), MonitorQueue(json)};
+  many[1]._configs[0]._ignore.push_back("a$");
+  std::vector<size_t> got;
+  for (const char* path : {"/p/a", "/p/x599", "/p/x5990", "/p/x0"}) {
+    MonitorQueueIndex(many).Match(path, 1, got);
+    EXPECT_EQ(got, Loop(many, path, 1)) << path;
+  }
 }
 
 // One index, and copies of it, asked from several threads at once (the
