@@ -105,6 +105,26 @@ std::vector<MonitorQueue> MakeCatalogue(int queues) {
   return catalogue;
 }
 
+// The catalogue of MakeCatalogue(queues) where 80 queues spread over it
+// have their last configuration on "/vol/share/hot", in four kinds of 20:
+// wanting kWatched with kIgnore, wanting another kind, wanting an event
+// kind none asks, and wanting kWatched with other patterns.
+std::vector<MonitorQueue> MakeHotCatalogue(int queues) {
+  std::vector<MonitorQueue> catalogue = MakeCatalogue(queues);
+  const std::vector<std::string> ignore(std::begin(kIgnore), std::end(kIgnore));
+  const struct {
+    unsigned int mask;
+    std::vector<std::string> ignore;
+  } kinds[] = {{kWatched, ignore}, {0x4, ignore}, {0x100, ignore}, {kWatched, {"\\.dat$", "~$"}}};
+  for (int k = 0; k < 80; ++k) {
+    MonitorQueue::MonitorQueueConfig& config = catalogue[k * queues / 80]._configs.back();
+    config._path = "/vol/share/hot";
+    config._mask = kinds[k % 4].mask;
+    config._ignore = kinds[k % 4].ignore;
+  }
+  return catalogue;
+}
+
 // The daemon's question without the index.
 void Loop(std::vector<MonitorQueue>& queues, const std::string& path, unsigned int mask,
           std::vector<size_t>& out) {
@@ -150,7 +170,7 @@ int main(int argc, char** argv) {
   // the benchmarks hold references to them).
   static std::vector<std::vector<MonitorQueue>> catalogues;
   const int sizes[] = {10, 100, 1000, 10000};
-  catalogues.reserve(std::size(sizes));
+  catalogues.reserve(std::size(sizes) + 1);
   for (int n : sizes) {
     catalogues.push_back(MakeCatalogue(n));
     std::vector<MonitorQueue>& queues = catalogues.back();
@@ -190,6 +210,35 @@ int main(int argc, char** argv) {
         benchmark::DoNotOptimize(out->data());
       });
     }
+  }
+
+  // 80 configurations on the event's directory, in four kinds.
+  {
+    catalogues.push_back(MakeHotCatalogue(1000));
+    std::vector<MonitorQueue>& queues = catalogues.back();
+    const MonitorQueueIndex index(queues);
+    const std::string path = "/vol/share/hot/report.txt";
+    std::vector<size_t> got, matched;
+    Loop(queues, path, kWatched, got);
+    index.Match(path, kWatched, matched);
+    if (got.size() != 40 || matched != got) {
+      std::fprintf(stderr, "index_bench: unexpected answer for %s\n", path.c_str());
+      return 1;
+    }
+    const std::string name = "Match/1,000 queues, 80 on the path's directory, path wanted by 40";
+    const std::string setup =
+        "index; queues of 8 configurations, 80 of them with their last on the event's directory "
+        "(4 kinds of mask and patterns)";
+    const auto out = std::make_shared<std::vector<size_t>>();
+    Register("lib/" + name, setup, [index, path, out] {
+      index.Match(path, kWatched, *out);
+      benchmark::DoNotOptimize(out->data());
+    });
+    Register("base/" + name, "IsMonitoring asked of every queue, the queues prepared",
+             [&queues, path, out] {
+               Loop(queues, path, kWatched, *out);
+               benchmark::DoNotOptimize(out->data());
+             });
   }
 
   // Memory of the compiled patterns: the index over 10 and over 1,000

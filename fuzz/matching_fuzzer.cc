@@ -7,14 +7,20 @@
 // often, with any other byte now and then.  Every answer of the library is
 // compared with the reference, and so is the prepared state of every
 // configuration (compiled on the first call that passes the mask and path
-// tests, never earlier).
+// tests, never earlier).  A third of the patterns have the shapes that
+// LiteralPattern answers without the regex engine, or nearly: each question
+// also sets LiteralPattern against regexec on every pattern of the queue and
+// the question's path.  Inputs of odd length run in the C.UTF-8 locale,
+// the others in the C locale.
 
+#include <locale.h>
 #include <regex.h>
 
 #include <cstddef>
 #include <cstdint>
 #include <cstdio>
 #include <cstdlib>
+#include <cstring>
 #include <set>
 #include <string>
 #include <vector>
@@ -23,6 +29,7 @@
 
 #include "fuzz_common.h"
 #include "monitor_queue.h"
+#include "monitor_queue/literal_pattern.h"
 
 using ZORV::ZORVNOTIFYD::MonitorQueue;
 using Config = ZORV::ZORVNOTIFYD::MonitorQueue::MonitorQueueConfig;
@@ -97,12 +104,40 @@ void RefShares(const MonitorQueue& queue, std::set<std::string>& shares) {
 
 std::string Path(FuzzedDataProvider& input) { return zorv_fuzz::Path(input, 24); }
 
+// A pattern of a literal shape or a near miss, chosen by the bytes of |raw|:
+// an optional "^", a piece per byte (literal bytes, escapes glibc reads as
+// the byte and escapes it reads as anchors or classes, operators, a byte of
+// UTF-8, a control byte) and an ending.  No group nests and at most two
+// operators repeat, so it compiles quickly.
+std::string LiteralShaped(const std::string& raw) {
+  static const char* const kPieces[] = {
+      "a",    "b",   "/",   "~",   "-",   "\\.", "\\\\", "\\$", "\\^",  "\\(",
+      "\\/",  "\\<", "\\'", "\\w", "\\b", ".",   "*",    "+",   "[ab]", "\xc3\xa9",
+      "\x01", "$",   "^",   "|",   " ",   "ab",  "/a",   "\\{", "{",    ")",
+  };
+  static const char* const kEndings[] = {"",    "$",     "(/|$)", "($|/)", "(/|$)a",
+                                         "(/)", "(/|^)", "\\",    "$$",    "(/|$"};
+  const auto byte = [&raw](size_t i) { return static_cast<unsigned char>(raw[i]); };
+  std::string pattern = (byte(0) / 3) % 2 ? "^" : "";
+  int operators = 0;
+  for (size_t i = 1; i + 1 < raw.size(); ++i) {
+    const char* piece = kPieces[byte(i) % (sizeof kPieces / sizeof kPieces[0])];
+    if (std::strchr("*+{", piece[0]) && ++operators > 2) piece = "a";
+    pattern += piece;
+  }
+  return pattern + kEndings[byte(raw.size() - 1) % (sizeof kEndings / sizeof kEndings[0])];
+}
+
 // Patterns of up to twelve bytes from an alphabet without "{" and "\\", with at most two
 // repetition operators and one group: glibc's regcomp takes time exponential in nested
 // repetitions ("((a*)*)*..."), which would report a slow compile, not a fault, as a timeout.
+// A third of them (by their first byte) are literal shapes instead.
 std::string Pattern(FuzzedDataProvider& input) {
   static const char kAlphabet[] = "ab/.*+?|()[]^$-";
   std::string pattern = input.ConsumeRandomLengthString(12);
+  if (!pattern.empty() && static_cast<unsigned char>(pattern[0]) % 3 == 0) {
+    return LiteralShaped(pattern);
+  }
   int repetitions = 0;
   int groups = 0;
   for (char& c : pattern) {
@@ -122,6 +157,23 @@ MonitorQueue Queue(FuzzedDataProvider& input) {
   std::fprintf(stderr, "%s(\"%s\"): library %ld, reference %ld\n", question, argument.c_str(), got,
                expected);
   std::abort();
+}
+
+// When LiteralPattern takes |pattern|, its answer on |path| must be regexec's
+// on the same pattern compiled as the library compiles it.
+void CheckLiteral(const std::string& pattern, const std::string& path) {
+  ZORV::ZORVNOTIFYD::LiteralPattern literal;
+  if (!literal.Parse(pattern.c_str())) return;
+  if (!ZORV::ZORVNOTIFYD::LiteralAnswersHere()) Mismatch("LiteralAnswersHere", pattern, 0, 1);
+  regex_t regex;
+  if (regcomp(&regex, pattern.c_str(), REG_EXTENDED) != 0) {
+    Mismatch("regcomp of a literal pattern", pattern, 1, 0);
+  }
+  const bool expected = regexec(&regex, path.c_str(), 0, nullptr, 0) == 0;
+  regfree(&regex);
+  const bool got = literal.Matches(path.c_str(), std::strlen(path.c_str()));
+  if (got != expected)
+    Mismatch(("LiteralPattern \"" + pattern + "\"").c_str(), path, got, expected);
 }
 
 // The prepared state the library must show, tracked beside each queue.
@@ -154,6 +206,9 @@ void CheckPrepared(const Tracked& tracked) {
 }  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
+  static const locale_t utf8 = newlocale(LC_ALL_MASK, "C.UTF-8", nullptr);
+  zorv_fuzz::Check(utf8 != nullptr, "the C.UTF-8 locale is installed");
+  uselocale(size % 2 ? utf8 : LC_GLOBAL_LOCALE);
   FuzzedDataProvider input(data, size);
   std::vector<Tracked> tracked;
   const int queues = input.ConsumeIntegralInRange(1, 4);
@@ -168,6 +223,9 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     Tracked& one = tracked[input.ConsumeIntegralInRange<size_t>(0, tracked.size() - 1)];
     MonitorQueue& queue = one.queue;
     const std::string path = Path(input);
+    for (const Config& config : queue._configs) {
+      for (const std::string& pattern : config._ignore) CheckLiteral(pattern, path);
+    }
     switch (which) {
       case 0: {  // IsMonitoring, queue form: the first configuration that wants it decides
         const unsigned mask = zorv_fuzz::Mask(input);

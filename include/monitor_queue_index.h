@@ -44,9 +44,10 @@ class ZORVNOTIFYD_EXPORT MonitorQueueIndex {
   // Clears |out|, then fills it with the positions, in ascending order and
   // each once, of the queues for which queues[i].IsMonitoring(path, mask)
   // is true.  Looks only at the configurations whose path is |path| or one
-  // of its ancestors by IsMonitoring's boundary rule, and runs each ignore
-  // pattern at most once on |path|.  Allocates nothing once |out| and the
-  // calling thread's scratch space have grown to their size.
+  // of its ancestors by IsMonitoring's boundary rule; those with the same
+  // path, mask and ignore patterns answer as one.  Runs each ignore pattern
+  // at most once on |path| (when those configurations name at most 512
+  // distinct patterns).  Allocates nothing once |out| has grown to its size.
   void Match(const std::string& path, unsigned int mask, std::vector<size_t>& out) const;
 
   // The OR of queues[i].GetUnionMask(dir) over every queue: the masks of

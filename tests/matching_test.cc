@@ -74,7 +74,47 @@ TEST(MatchingTest, IgnorePatternsCompileOnceAndMatchTheWholePath) {
   }
   // A configuration whose only pattern does not compile monitors what its path admits.
   EXPECT_TRUE(broken.IsMonitoring("/c/x", 1) && broken._prepared && broken._regexes.empty());
+  // Once a pattern is dropped, the compiled ones no longer line up with the texts.
+  Config shifted = MakeQueue({{"/c", 1}})._configs[0];
+  shifted._ignore = {"(", "y$", "x$"};
+  EXPECT_FALSE(shifted.IsMonitoring("/c/x", 1));
   EXPECT_EQ(zorv_test::DumpLogs(), "");  // dropped silently
+}
+
+TEST(MatchingTest, LiteralPatternsAnswerAsTheRegexEngine) {
+  // A pattern, a path below "/x" and whether the pattern ignores it: literal
+  // shapes, and near misses whose operators, classes and anchors only the
+  // regex engine reads right.
+  const std::tuple<const char*, std::string, bool> rows[] = {
+      {"\\.tmp$", "/x/a.tmp", true},
+      {"\\.tmp$", "/x/a.tmp/b", false},
+      {"\\.tmp$", std::string("/x/a.tmp\0b", 10), true},  // regexec stops at NUL
+      {"~$", "/x/a~b", false},
+      {"^/x/a(/|$)", "/x/a/b", true},
+      {"^/x/a(/|$)", "/x/ab", false},
+      {"/\\.git(/|$)", "/x/.github/.git", true},
+      {"/\\.git($|/)", "/x/.github", false},
+      {"a\\$b", "/x/a$b", true},
+      {"node_modules", "/x/node_modules/y", true},
+      {"a.c$", "/x/abc", true},
+      {"\\.$", "/x/ab", false},
+      {"(^|/)y$", "/x/y", true},
+      {"(^|/)y$", "/x/ay", false},
+      {"[.]tmp$", "/x/atmp", false},
+      {"ab*$", "/x/a", true},
+      {"/a+$", "/x/aaa", true},
+      {"ab?$", "/x/a", true},
+      {"a{2}$", "/x/aa", true},
+      {"q|a$", "/x/a", true},
+      {"\\<b$", "/x/b", true},
+      {"\\w$", "/x/a", true},
+      {"^", "/x/a", true},
+  };
+  for (const auto& [pattern, path, ignored] : rows) {
+    Config config = MakeQueue({{"/x", 1}})._configs[0];
+    config._ignore = {pattern};
+    EXPECT_EQ(config.IsMonitoring(path, 1), !ignored) << pattern << " on " << path;
+  }
 }
 
 TEST(MatchingTest, QueueQueriesAskTheirConfigurationsInOrder) {

@@ -27,8 +27,10 @@ std::string RandomPath(std::mt19937& random, int max) {
 }
 
 std::vector<MonitorQueue> RandomCatalogue(std::mt19937& random, int queues) {
-  // Patterns that match, do not, are anchored, and do not compile.
-  static const char* const kPatterns[] = {"a$", "^/a/", "b", "[", "/$", "^/b", "(a"};
+  // Patterns that match, do not, are anchored, and do not compile; literal
+  // shapes and a near miss.
+  static const char* const kPatterns[] = {"a$",  "^/a/", "b",       "[",  "/$",
+                                          "^/b", "(a",   "/a(/|$)", "a.b"};
   std::vector<MonitorQueue> catalogue;
   for (int q = 0; q < queues; ++q) {
     Json::Value json;
@@ -37,8 +39,9 @@ std::vector<MonitorQueue> RandomCatalogue(std::mt19937& random, int queues) {
       Json::Value config;
       config["path"] = RandomPath(random, 4);
       config["mask"] = Json::UInt(random() % 8);
-      for (int p = int(random() % 3); p > 0; --p) config["ignore"].append(kPatterns[random() % 7]);
+      for (int p = int(random() % 3); p > 0; --p) config["ignore"].append(kPatterns[random() % 9]);
       json["config"].append(config);
+      if (random() % 3 == 0) json["config"].append(config);  // twice in one queue
     }
     catalogue.emplace_back(json);
   }
@@ -86,6 +89,19 @@ TEST(MonitorQueueIndexTest, AnswersExactlyAsThePlainCalls) {
       ASSERT_EQ(index.IsDirMonitoring(path), MonitorQueue::IsDirMonitoring(queues, path)) << path;
       ASSERT_EQ(index.GetWatchMask(path), watch_mask) << path;
     }
+  }
+  // More distinct patterns on one path than Match remembers answers for:
+  // the last ones, past the memo, still decide.
+  Json::Value json;
+  json["config"][0]["path"] = "/p";
+  json["config"][0]["mask"] = 1;
+  for (int p = 0; p < 600; ++p) json["config"][0]["ignore"].append("x" + std::to_string(p) + "$");
+  std::vector<MonitorQueue> many = {MonitorQueue(json), MonitorQueue(json)};
+  many[1]._configs[0]._ignore.push_back("a$");
+  std::vector<size_t> got;
+  for (const char* path : {"/p/a", "/p/x599", "/p/x5990", "/p/x0"}) {
+    MonitorQueueIndex(many).Match(path, 1, got);
+    EXPECT_EQ(got, Loop(many, path, 1)) << path;
   }
 }
 

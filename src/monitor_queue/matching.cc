@@ -8,7 +8,10 @@
 
 #include "monitor_queue.h"
 
+#include <cstdint>
 #include <cstring>
+
+#include "monitor_queue/literal_pattern.h"
 
 namespace ZORV {
 namespace ZORVNOTIFYD {
@@ -29,6 +32,36 @@ bool IsAtOrBelow(const std::string& path, const std::string& dir) {
   return BeginsWith(path, dir) && (path.size() == dir.size() || path[dir.size()] == '/');
 }
 
+// True when an ignore pattern of the prepared |config| matches |path|.
+// Kept out of line, so that the mask and path tests before it stay small.
+__attribute__((noinline)) bool Ignored(const MonitorQueue::MonitorQueueConfig& config,
+                                       const std::string& path) {
+  // When every pattern compiled, _regexes[i] is _ignore[i] compiled, and a
+  // pattern of a literal shape is answered from its text, as regexec would;
+  // otherwise the correspondence is unknown and regexec answers them all.
+  const bool by_text = config._regexes.size() == config._ignore.size();
+  // The bytes regexec reads (up to a NUL byte), measured on the first
+  // literal pattern; kByRegexec when the locale leaves literals to regexec.
+  constexpr size_t kUnmeasured = SIZE_MAX, kByRegexec = SIZE_MAX - 1;
+  size_t length = kUnmeasured;
+  for (size_t i = 0; i < config._regexes.size(); ++i) {
+    LiteralPattern literal;
+    if (by_text && length != kByRegexec && literal.Parse(config._ignore[i].c_str())) {
+      if (length == kUnmeasured) {
+        length = LiteralAnswersHere() ? std::strlen(path.c_str()) : kByRegexec;
+      }
+      if (length != kByRegexec) {
+        if (literal.Matches(path.c_str(), length)) return true;
+        continue;
+      }
+    }
+    // Any result other than 0 (a match) counts as no match, so a regexec
+    // failure leaves the path monitored.
+    if (regexec(&config._regexes[i], path.c_str(), 0, nullptr, 0) == 0) return true;
+  }
+  return false;
+}
+
 // The body of MonitorQueueConfig::IsMonitoring.  The queue form calls it
 // directly: the member functions are exported and therefore interposable,
 // so a call through them would not be inlined.
@@ -39,12 +72,7 @@ inline bool ConfigWants(MonitorQueue::MonitorQueueConfig& config, const std::str
   if ((mask & config._mask) == 0) return false;
   if (!IsAtOrBelow(path, config._path)) return false;
   if (!config._prepared) config.PrepareRegex();
-  // Any result other than 0 (a match) counts as no match, so a regexec
-  // failure leaves the path monitored.
-  for (const regex_t& regex : config._regexes) {
-    if (regexec(&regex, path.c_str(), 0, nullptr, 0) == 0) return false;
-  }
-  return true;
+  return config._regexes.empty() || !Ignored(config, path);
 }
 
 // The body of MonitorQueueConfig::IsDirMonitoring, shared with the queue

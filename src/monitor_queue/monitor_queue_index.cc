@@ -9,7 +9,11 @@
 #include <algorithm>
 #include <cstdint>
 #include <cstring>
+#include <map>
 #include <unordered_map>
+#include <utility>
+
+#include "monitor_queue/literal_pattern.h"
 
 namespace ZORV {
 namespace ZORVNOTIFYD {
@@ -30,77 +34,97 @@ uint64_t Hash(const std::string& text) {
   return hash;
 }
 
-// One compiled pattern, freed exactly once.
+// One compiled pattern, freed exactly once, and its literal form when it has
+// one (then byte comparisons answer in place of regexec).
 class Pattern {
  public:
   // Compiles |text| as PrepareRegex does; ok() tells whether it compiled.
   explicit Pattern(const std::string& text)
-      : ok_(regcomp(&regex_, text.c_str(), REG_EXTENDED) == 0) {}
+      : ok_(regcomp(&regex_, text.c_str(), REG_EXTENDED) == 0),
+        literal_ok_(ok_ && literal_.Parse(text.c_str())) {}
   ~Pattern() {
     if (ok_) regfree(&regex_);
   }
   Pattern(const Pattern&) = delete;
   Pattern& operator=(const Pattern&) = delete;
   bool ok() const { return ok_; }
-  // True when the pattern matches |path| (regexec result 0).
-  bool Matches(const char* path) const { return regexec(&regex_, path, 0, nullptr, 0) == 0; }
+  // True when the pattern matches |subject| (regexec result 0).
+  template <typename Subject>
+  bool Matches(Subject& subject) const {
+    if (literal_ok_ && subject.LiteralsAnswer()) {
+      return literal_.Matches(subject.path.c_str(), subject.length);
+    }
+    return regexec(&regex_, subject.path.c_str(), 0, nullptr, 0) == 0;
+  }
 
  private:
   regex_t regex_;
   bool ok_;
+  LiteralPattern literal_;
+  bool literal_ok_;
 };
 
-// Per-thread scratch of Match: which patterns ran and which queues matched
-// during the current call, stamped with the call's number so that nothing
-// needs clearing between calls.
-struct Scratch {
-  std::vector<uint32_t> pattern_stamp;
-  std::vector<uint8_t> pattern_matched;
-  std::vector<uint32_t> queue_stamp;
-  uint32_t call = 0;
+// The asked path as the patterns see it: the bytes regexec reads (up to a
+// NUL byte), measured once, on the first literal pattern that runs.
+struct Subject {
+  static constexpr size_t kUnmeasured = SIZE_MAX, kByRegexec = SIZE_MAX - 1;
+  const std::string& path;
+  size_t length = kUnmeasured;
 
-  // Starts a call over |patterns| patterns and |queues| queues.
-  void Begin(size_t patterns, size_t queues) {
-    if (++call == 0) {  // wrapped: old stamps could look current
-      std::fill(pattern_stamp.begin(), pattern_stamp.end(), 0);
-      std::fill(queue_stamp.begin(), queue_stamp.end(), 0);
-      call = 1;
+  // True when literal patterns may answer in the calling thread's locale;
+  // |length| is then measured.
+  bool LiteralsAnswer() {
+    if (length == kUnmeasured) {
+      length = LiteralAnswersHere() ? std::strlen(path.c_str()) : kByRegexec;
     }
-    if (pattern_stamp.size() < patterns) {
-      pattern_stamp.resize(patterns, 0);
-      pattern_matched.resize(patterns, 0);
-    }
-    if (queue_stamp.size() < queues) queue_stamp.resize(queues, 0);
+    return length != kByRegexec;
   }
 };
 
-thread_local Scratch g_match_scratch;
+// Match remembers the answers of at most this many patterns per call, on the
+// stack; a pattern beyond them runs once per group that names it.
+constexpr uint32_t kMemoSlots = 512;
+constexpr size_t kMemoWords = kMemoSlots / 64;
 
 }  // namespace
 
-// One configuration: its queue, mask and compiled patterns.
-struct IndexEntry {
-  uint32_t queue;
+// A pattern as a group names it: which one, and where Match remembers its
+// answer.  Slots are numbered along each chain of ancestors (a node's
+// patterns that its ancestors do not name come after theirs), so that one
+// pattern has one slot on every path that reaches it.
+struct PatternRef {
+  uint32_t id;    // into MonitorQueueIndexData::patterns
+  uint32_t slot;  // below the node's chain_slots
+};
+
+// The configurations of one path with the same mask and the same set of
+// compiled patterns: they want exactly the same events, so they answer as
+// one and hand out their queues together.
+struct IndexGroup {
   unsigned int mask;
-  uint32_t first_pattern;  // into MonitorQueueIndexData::pattern_ids
-  uint32_t pattern_count;
+  uint32_t first_ref;  // into MonitorQueueIndexData::refs
+  uint32_t ref_count;
+  uint32_t first_queue;  // into MonitorQueueIndexData::queue_ids: ascending, each once
+  uint32_t queue_count;
 };
 
 // All configurations with one path.
 struct IndexNode {
   std::string path;
   uint64_t hash;
-  unsigned int mask;  // the OR of the entries' masks
-  uint32_t first_entry;
-  uint32_t entry_count;
+  unsigned int mask;  // the OR of the groups' masks
+  uint32_t first_group;
+  uint32_t group_count;
 };
 
 struct MonitorQueueIndexData {
   size_t queues = 0;
   std::vector<IndexNode> nodes;  // sorted by path
-  std::vector<IndexEntry> entries;
-  std::vector<uint32_t> pattern_ids;
+  std::vector<IndexGroup> groups;
+  std::vector<PatternRef> refs;
+  std::vector<uint32_t> queue_ids;
   std::vector<std::unique_ptr<Pattern>> patterns;
+  size_t memo_words = 0;        // the 64-bit words of Match's memo that slots reach
   std::vector<uint32_t> slots;  // open addressing: node index + 1, 0 when free
 
   // The node whose path is the first |length| bytes of |path|, whose hash is
@@ -139,12 +163,13 @@ MonitorQueueIndex::MonitorQueueIndex(const std::vector<MonitorQueue>& queues) {
   // Patterns by the text regcomp sees (up to a NUL byte), compiled once.
   std::unordered_map<std::string, uint32_t> pattern_by_text;
   constexpr uint32_t kDropped = UINT32_MAX;
-  // The configurations of each path, in queue and list order.
-  std::unordered_map<std::string, std::vector<IndexEntry>> by_path;
+  // For each path, the queues of each (mask, set of compiled patterns), in
+  // queue order.
+  using GroupKey = std::pair<unsigned int, std::vector<uint32_t>>;
+  std::unordered_map<std::string, std::map<GroupKey, std::vector<uint32_t>>> by_path;
   for (size_t queue = 0; queue < queues.size(); ++queue) {
     for (const MonitorQueue::MonitorQueueConfig& config : queues[queue]._configs) {
-      IndexEntry entry{static_cast<uint32_t>(queue), config._mask,
-                       static_cast<uint32_t>(data->pattern_ids.size()), 0};
+      GroupKey key{config._mask, {}};
       for (const std::string& text : config._ignore) {
         auto found = pattern_by_text.emplace(text.c_str(), kDropped);
         if (found.second) {
@@ -154,16 +179,21 @@ MonitorQueueIndex::MonitorQueueIndex(const std::vector<MonitorQueue>& queues) {
             data->patterns.push_back(std::move(pattern));
           }
         }
-        if (found.first->second == kDropped) continue;
-        data->pattern_ids.push_back(found.first->second);
-        ++entry.pattern_count;
+        if (found.first->second != kDropped) key.second.push_back(found.first->second);
       }
-      by_path[config._path].push_back(entry);
+      // Whether the patterns ignore a path depends neither on their order
+      // nor on how often one is named.
+      std::sort(key.second.begin(), key.second.end());
+      key.second.erase(std::unique(key.second.begin(), key.second.end()), key.second.end());
+      std::vector<uint32_t>& members = by_path[config._path][key];
+      if (members.empty() || members.back() != queue) {
+        members.push_back(static_cast<uint32_t>(queue));
+      }
     }
   }
   data->nodes.reserve(by_path.size());
-  for (const auto& [path, entries] : by_path) {
-    data->nodes.push_back({path, Hash(path), 0, 0, static_cast<uint32_t>(entries.size())});
+  for (const auto& entry : by_path) {
+    data->nodes.push_back({entry.first, Hash(entry.first), 0, 0, 0});
   }
   std::sort(data->nodes.begin(), data->nodes.end(),
             [](const IndexNode& a, const IndexNode& b) { return a.path < b.path; });
@@ -171,16 +201,50 @@ MonitorQueueIndex::MonitorQueueIndex(const std::vector<MonitorQueue>& queues) {
   while (slots < 2 * data->nodes.size()) slots *= 2;
   data->slots.assign(data->nodes.empty() ? 0 : slots, 0);
   for (size_t i = 0; i < data->nodes.size(); ++i) {
-    IndexNode& node = data->nodes[i];
-    node.first_entry = static_cast<uint32_t>(data->entries.size());
-    for (const IndexEntry& entry : by_path[node.path]) {
-      node.mask |= entry.mask;
-      data->entries.push_back(entry);
-    }
-    size_t slot = node.hash & (slots - 1);
+    size_t slot = data->nodes[i].hash & (slots - 1);
     while (data->slots[slot] != 0) slot = (slot + 1) & (slots - 1);
     data->slots[slot] = static_cast<uint32_t>(i + 1);
   }
+  // Memo slots, node by node in path order (an ancestor sorts before its
+  // descendants): the nearest ancestor's chain first, then the patterns
+  // this node adds, kept in |added|.
+  constexpr uint32_t kNone = UINT32_MAX;
+  std::vector<std::vector<PatternRef>> added(data->nodes.size());
+  std::vector<uint32_t> parent(data->nodes.size(), kNone);
+  std::vector<uint32_t> chain_slots(data->nodes.size(), 0);
+  uint32_t most_slots = 0;
+  for (size_t i = 0; i < data->nodes.size(); ++i) {
+    IndexNode& node = data->nodes[i];
+    data->ForEachAncestor(node.path, [&](const IndexNode& ancestor) {
+      const uint32_t at = static_cast<uint32_t>(&ancestor - data->nodes.data());
+      if (at != i) parent[i] = at;  // the last one before the node itself
+    });
+    chain_slots[i] = parent[i] == kNone ? 0 : chain_slots[parent[i]];
+    // The slot of pattern |id| on this node's chain, added when new.
+    const auto slot_of = [&](uint32_t id) {
+      for (uint32_t n = static_cast<uint32_t>(i); n != kNone; n = parent[n]) {
+        for (const PatternRef& ref : added[n]) {
+          if (ref.id == id) return ref.slot;
+        }
+      }
+      added[i].push_back({id, chain_slots[i]});
+      return chain_slots[i]++;
+    };
+    node.first_group = static_cast<uint32_t>(data->groups.size());
+    for (const auto& [key, members] : by_path[node.path]) {
+      const IndexGroup group{key.first, static_cast<uint32_t>(data->refs.size()),
+                             static_cast<uint32_t>(key.second.size()),
+                             static_cast<uint32_t>(data->queue_ids.size()),
+                             static_cast<uint32_t>(members.size())};
+      for (uint32_t id : key.second) data->refs.push_back({id, slot_of(id)});
+      data->queue_ids.insert(data->queue_ids.end(), members.begin(), members.end());
+      node.mask |= group.mask;
+      data->groups.push_back(group);
+    }
+    node.group_count = static_cast<uint32_t>(data->groups.size()) - node.first_group;
+    most_slots = std::max(most_slots, chain_slots[i]);
+  }
+  data->memo_words = (std::min(most_slots, kMemoSlots) + 63) / 64;
   data_ = std::move(data);
 }
 
@@ -189,31 +253,45 @@ void MonitorQueueIndex::Match(const std::string& path, unsigned int mask,
   out.clear();
   if (mask == 0) return;  // no configuration shares a bit with it
   const MonitorQueueIndexData& data = *data_;
-  // One lookup of the thread's scratch, not one per use inside the loops.
-  Scratch& scratch = g_match_scratch;
-  scratch.Begin(data.patterns.size(), data.queues);
-  const uint32_t call = scratch.call;
+  // Which patterns ran during this call, and which of those matched.
+  uint64_t ran[kMemoWords], matched[kMemoWords];
+  std::fill_n(ran, data.memo_words, 0);
+  std::fill_n(matched, data.memo_words, 0);
+  Subject subject{path};
+  const auto ignored = [&](const IndexGroup& group) {
+    for (uint32_t r = group.first_ref; r < group.first_ref + group.ref_count; ++r) {
+      const PatternRef& ref = data.refs[r];
+      const Pattern& pattern = *data.patterns[ref.id];
+      if (ref.slot >= kMemoSlots) {
+        if (pattern.Matches(subject)) return true;
+        continue;
+      }
+      const uint64_t bit = uint64_t{1} << (ref.slot % 64);
+      if ((ran[ref.slot / 64] & bit) == 0) {
+        ran[ref.slot / 64] |= bit;
+        if (pattern.Matches(subject)) matched[ref.slot / 64] |= bit;
+      }
+      if (matched[ref.slot / 64] & bit) return true;
+    }
+    return false;
+  };
+  size_t answering = 0;  // groups whose queues went into |out|
   data.ForEachAncestor(path, [&](const IndexNode& node) {
     if ((node.mask & mask) == 0) return;
-    for (uint32_t e = node.first_entry; e < node.first_entry + node.entry_count; ++e) {
-      const IndexEntry& entry = data.entries[e];
-      if ((entry.mask & mask) == 0 || scratch.queue_stamp[entry.queue] == call) continue;
-      bool ignored = false;
-      for (uint32_t p = entry.first_pattern;
-           p < entry.first_pattern + entry.pattern_count && !ignored; ++p) {
-        const uint32_t id = data.pattern_ids[p];
-        if (scratch.pattern_stamp[id] != call) {
-          scratch.pattern_stamp[id] = call;
-          scratch.pattern_matched[id] = data.patterns[id]->Matches(path.c_str());
-        }
-        ignored = scratch.pattern_matched[id] != 0;
-      }
-      if (ignored) continue;
-      scratch.queue_stamp[entry.queue] = call;
-      out.push_back(entry.queue);
+    for (uint32_t g = node.first_group; g < node.first_group + node.group_count; ++g) {
+      const IndexGroup& group = data.groups[g];
+      if ((group.mask & mask) == 0 || ignored(group)) continue;
+      out.insert(out.end(), data.queue_ids.begin() + group.first_queue,
+                 data.queue_ids.begin() + group.first_queue + group.queue_count);
+      ++answering;
     }
   });
-  std::sort(out.begin(), out.end());
+  // One group's queues are ascending and each once already; several groups
+  // may name the same queue.
+  if (answering > 1) {
+    std::sort(out.begin(), out.end());
+    out.erase(std::unique(out.begin(), out.end()), out.end());
+  }
 }
 
 unsigned int MonitorQueueIndex::GetUnionMask(const std::string& dir) const {
