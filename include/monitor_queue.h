@@ -97,7 +97,10 @@ class ZORVNOTIFYD_EXPORT MonitorQueue {
     // below it ("/" after the prefix), and no compiled ignore pattern
     // matches the whole of |path|.  Compiles the patterns on the first call
     // that gets past the mask and path tests.  Allocates nothing once the
-    // record is prepared.
+    // record is prepared.  The patterns are those of _ignore when the record
+    // was prepared: change _ignore only while it is not (a copy of it is
+    // prepared afresh), since a pattern with the shape of a literal is
+    // answered from its text.
     bool IsMonitoring(const std::string& path, const unsigned int& mask);
 
     // True when _path is |dir| itself or lies below it.  Mask and patterns
