@@ -1263,6 +1263,9 @@ TEST_F(DaemonTest, ServesWholeFileSystemsWithFanotify) {
   EXPECT_EQ(daemon->Stop(SIGTERM), 0);
 
   // The default: fanotify only where no event outside the tree is paid for.
+  // What changed while the daemon was stopped comes from the comparison
+  // with the snapshot, after ready.
+  ASSERT_TRUE(Put("/tmp/all/t/c3/offline", ""));
   Register("all", "/tmp/all", IN_CREATE, nullptr, "fall");
   daemon = std::make_unique<Daemon>(Lines{"--json"});
   ASSERT_TRUE(
@@ -1274,6 +1277,7 @@ TEST_F(DaemonTest, ServesWholeFileSystemsWithFanotify) {
   ASSERT_TRUE(daemon->Logged(
       "tree \"/tmp/ram\" is served by inotify: its file system gives no file handles"));
   ASSERT_TRUE(daemon->Logged("ready:"));
+  EXPECT_TRUE(daemon->Heard("t /tmp/all/t/c3/offline 256"));
   const Json::Value trees = Status()["trees"];
   ASSERT_EQ(trees.size(), 4u);
   EXPECT_EQ(trees[0]["path"].asString() + " " + trees[0]["backend"].asString(),
