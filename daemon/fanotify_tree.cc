@@ -621,7 +621,10 @@ bool FanotifyTree::Read(EventSink& sink, bool* empty) {
     }
     size_t left = size_t(n);
     for (const char* at = buffer; left >= sizeof(struct fanotify_event_metadata);) {
-      const auto* meta = reinterpret_cast<const struct fanotify_event_metadata*>(at);
+      // Events are 4-byte aligned; the metadata holds a 64-bit mask.
+      struct fanotify_event_metadata copy;
+      memcpy(&copy, at, sizeof(copy));
+      const struct fanotify_event_metadata* meta = &copy;
       if (meta->event_len < meta->metadata_len || meta->event_len > left ||
           meta->metadata_len < sizeof(*meta) || meta->vers != FANOTIFY_METADATA_VERSION) {
         syslog(LOG_ERR, "reading fanotify events failed: a malformed event");
