@@ -114,15 +114,31 @@ void Watchers::Sync(const std::vector<std::string>& roots,
     }
     chosen[root] = choice;
   }
+  // A tree fanotify refuses (a mark it cannot have) goes to inotify, and
+  // the trees inside it with it, since inotify's walk covers them.
   std::vector<std::string> by_fanotify, by_inotify;
-  for (const auto& [root, choice] : chosen) {
-    (choice.backend == kFanotify ? by_fanotify : by_inotify).push_back(root);
-  }
-  std::map<std::string, std::string> refused;
-  fanotify_.Sync(by_fanotify, index, &refused);
-  for (const auto& [root, why] : refused) {
-    chosen[root] = {kInotify, why};
-    by_inotify.push_back(root);
+  for (bool again = true; again;) {
+    by_fanotify.clear();
+    by_inotify.clear();
+    for (const auto& [root, choice] : chosen) {
+      (choice.backend == kFanotify ? by_fanotify : by_inotify).push_back(root);
+    }
+    std::map<std::string, std::string> refused;
+    fanotify_.Sync(by_fanotify, index, &refused);
+    again = false;
+    for (const auto& [root, why] : refused) {
+      chosen[root] = {kInotify, why};
+      for (auto& [path, choice] : chosen) {
+        if (Below(path, root) && choice.backend == kFanotify) {
+          choice = {kInotify,
+                    "it lies in tree " + zorvcommon::Quoted(root) + ", which inotify serves"};
+          again = true;
+        }
+      }
+    }
+    if (!again) {
+      for (const auto& [root, why] : refused) by_inotify.push_back(root);
+    }
   }
   inotify_.Sync(by_inotify, index);
   for (const auto& [root, choice] : chosen) {
