@@ -63,6 +63,9 @@ constexpr int kReadsPerRound = 16;
 // their events cost one lookup; forgotten all at once past this many.
 constexpr size_t kMaxOutside = 1 << 16;
 
+// Directories compared per WalkPending call.
+constexpr int kWalkShare = 100;
+
 // The largest handle the kernel hands out (MAX_HANDLE_SZ).
 constexpr unsigned kMaxHandle = 128;
 
@@ -702,53 +705,75 @@ bool FanotifyTree::Drain(EventSink& sink) {
   return false;
 }
 
-void FanotifyTree::CompareWalk(int dir, const std::string& path, const Root& root,
-                               OfflineChanges& changes,
-                               std::vector<std::pair<dev_t, ino_t>>& ancestors) {
+void FanotifyTree::Enter(UniqueFd dir, const std::string& path) {
+  Walking& w = *walking_;
   struct stat st;
-  if (fstat(dir, &st) != 0) return;
-  for (const auto& ancestor : ancestors) {
-    if (ancestor == std::make_pair(st.st_dev, st.st_ino)) return;
+  if (fstat(dir.get(), &st) != 0) return;
+  for (const auto& ancestor : w.ancestors) {
+    if (ancestor == std::make_pair(st.st_dev, st.st_ino)) return;  // a bind mount inside itself
   }
-  if (st.st_dev == root.dev) {
-    const std::string key = KeyOf(dir, "", AT_EMPTY_PATH, root.fsid);
-    if (!key.empty()) Cache(key, Join(root.real, path.substr(root.path.size())));
+  if (st.st_dev == w.dev) {
+    const std::string key = KeyOf(dir.get(), "", AT_EMPTY_PATH, w.fsid);
+    if (!key.empty()) Cache(key, Join(w.real, path.substr(w.root.size())));
   }
-  ancestors.emplace_back(st.st_dev, st.st_ino);
   SnapshotListing listing;
   listing.ino = st.st_ino;
-  ListWithStatus(dir, &listing);
-  const SnapshotListing& seen = changes.Directory(path, std::move(listing));
-  for (const SnapshotEntry& entry : seen.entries) {
-    if (!entry.is_dir) continue;
-    const UniqueFd sub = OpenSubdir(dir, entry.name);
-    if (sub.get() >= 0) CompareWalk(sub.get(), path + "/" + entry.name, root, changes, ancestors);
+  ListWithStatus(dir.get(), &listing);
+  Frame frame;
+  for (const SnapshotEntry& entry : w.changes->Directory(path, std::move(listing)).entries) {
+    if (entry.is_dir) frame.subdirs.push_back(entry.name);
   }
-  ancestors.pop_back();
+  frame.dir = std::move(dir);
+  frame.path = path;
+  w.ancestors.emplace_back(st.st_dev, st.st_ino);
+  w.stack.push_back(std::move(frame));
 }
 
 bool FanotifyTree::WalkPending() {
-  if (to_walk_.empty()) return false;
-  const auto [path, walk] = to_walk_.front();
-  to_walk_.pop_front();
-  const Root* root = nullptr;
-  for (const Root& r : roots_) {
-    if (r.path == path && r.present) root = &r;
+  if (walking_ == nullptr) {
+    if (to_walk_.empty()) return false;
+    const auto [path, walk] = to_walk_.front();
+    to_walk_.pop_front();
+    const Root* root = nullptr;
+    for (const Root& r : roots_) {
+      if (r.path == path && r.present) root = &r;
+    }
+    if (root == nullptr || snapshot_ == nullptr || sink_ == nullptr) return walking();
+    UniqueFd dir = OpenConfiguredDir(path);
+    struct stat st;
+    if (dir.get() < 0 || fstat(dir.get(), &st) != 0 || st.st_dev != root->dev ||
+        st.st_ino != root->ino) {
+      return walking();  // replaced: Tick serves it afresh
+    }
+    walking_ = std::make_unique<Walking>();
+    walking_->root = path;
+    walking_->real = root->real;
+    walking_->fsid = root->fsid;
+    walking_->dev = root->dev;
+    walking_->walk = walk;
+    walking_->changes = std::make_unique<OfflineChanges>(snapshot_->Tree(path, &walking_->known));
+    Enter(std::move(dir), path);
   }
-  if (root == nullptr || snapshot_ == nullptr || sink_ == nullptr) return !to_walk_.empty();
-  const UniqueFd dir = OpenConfiguredDir(path);
-  struct stat st;
-  if (dir.get() < 0 || fstat(dir.get(), &st) != 0 || st.st_dev != root->dev ||
-      st.st_ino != root->ino) {
-    return !to_walk_.empty();  // replaced: Tick serves it afresh
+  // A bounded share of the walk per call: events are read in between.
+  Walking& w = *walking_;
+  for (int dirs = 0; dirs < kWalkShare && !w.stack.empty();) {
+    Frame& top = w.stack.back();
+    if (top.next == top.subdirs.size()) {
+      w.stack.pop_back();
+      w.ancestors.pop_back();
+      continue;
+    }
+    const std::string& name = top.subdirs[top.next++];
+    UniqueFd sub = OpenSubdir(top.dir.get(), name);
+    if (sub.get() < 0) continue;
+    Enter(std::move(sub), top.path + "/" + name);
+    ++dirs;
   }
-  Snapshot::Known known;
-  OfflineChanges changes(snapshot_->Tree(path, &known));
-  std::vector<std::pair<dev_t, ino_t>> ancestors;
-  CompareWalk(dir.get(), path, *root, changes, ancestors);
-  if (known == Snapshot::Known::kSaved) {
-    changes.Finish(*sink_);
-  } else if (known == Snapshot::Known::kNone && walk == Walk::kAppeared) {
+  if (!w.stack.empty()) return true;
+  const std::string path = w.root;
+  if (w.known == Snapshot::Known::kSaved) {
+    w.changes->Finish(*sink_);
+  } else if (w.known == Snapshot::Known::kNone && w.walk == Walk::kAppeared) {
     // A tree that appears for the first time has no past: all it holds
     // is new, and found.
     for (const auto& [dir_path, listing] : snapshot_->Loaded(path)->dirs()) {
@@ -756,10 +781,11 @@ bool FanotifyTree::WalkPending() {
         sink_->Found(dir_path + "/" + entry.name, entry.is_dir);
       }
     }
-  } else if (!(known == Snapshot::Known::kNone && walk == Walk::kReload)) {
+  } else if (!(w.known == Snapshot::Known::kNone && w.walk == Walk::kReload)) {
     sink_->Rescan(path);
   }
-  return !to_walk_.empty();
+  walking_.reset();
+  return walking();
 }
 
 void FanotifyTree::Relist() {

@@ -12,6 +12,7 @@
 #include <cstdint>
 #include <deque>
 #include <map>
+#include <memory>
 #include <set>
 #include <string>
 #include <unordered_map>
@@ -19,6 +20,7 @@
 #include <vector>
 
 #include "monitor_queue_index.h"
+#include "offline_changes.h"
 #include "snapshot.h"
 #include "unique_fd.h"
 #include "watch_tree.h"
@@ -33,8 +35,6 @@ bool FanotifySupports(int dir, std::string* why);
 // The trees served by one fanotify group.  Paths are built from the roots
 // as configured, as WatchTree builds them; symbolic links inside a tree
 // are never followed.
-class OfflineChanges;
-
 class FanotifyTree {
  public:
   // Tick is called every |retry_seconds| (said in log lines).
@@ -64,14 +64,15 @@ class FanotifyTree {
                                 const ZORV::ZORVNOTIFYD::MonitorQueueIndex& index,
                                 std::map<std::string, std::string>* refused);
 
-  // Walks one tree that waits for its comparison with the snapshot
-  // (started by Sync, a tree that came back, an overflow), handing the
-  // changes to the snapshot's sink as Offline (Found for a tree that
-  // appeared, Rescan with no saved view) and filling the cache.  True
-  // while more trees wait.
+  // Goes on with the walks that compare trees with the snapshot (a tree
+  // new to it, one that came back, every tree after an overflow), a
+  // bounded number of directories per call, filling the cache; at the end
+  // of each tree hands the changes to the snapshot's sink as Offline
+  // (Found for a tree that appeared, Rescan with no saved view).  True
+  // while some walk is not done.
   bool WalkPending();
-  // True while a tree waits for WalkPending.
-  bool walking() const { return !to_walk_.empty(); }
+  // True while some walk is not done.
+  bool walking() const { return walking_ != nullptr || !to_walk_.empty(); }
 
   // The periodic check: a root that is missing, or another directory now,
   // is served again and compared.
@@ -165,9 +166,27 @@ class FanotifyTree {
   // Scans each of |paths| (a directory that arrived in the trees), where
   // it still is; false when it was at none of them (moved on, or gone).
   bool Arrived(const std::vector<std::string>& paths, EventSink& sink);
-  // Walks |dir| at configured |path| for the comparison, caching handles.
-  void CompareWalk(int dir, const std::string& path, const Root& root, OfflineChanges& changes,
-                   std::vector<std::pair<dev_t, ino_t>>& ancestors);
+  // One directory of a walk in progress: the open directory, its path,
+  // the subdirectories to go into and the next of them.
+  struct Frame {
+    UniqueFd dir;
+    std::string path;
+    std::vector<std::string> subdirs;
+    size_t next = 0;
+  };
+  // A comparison walk in progress, depth first, one descriptor a level.
+  struct Walking {
+    std::string root, real, fsid;  // the tree's path, as the kernel names it, its file system
+    dev_t dev = 0;
+    Walk walk = Walk::kStart;
+    Snapshot::Known known = Snapshot::Known::kNone;
+    std::unique_ptr<OfflineChanges> changes;
+    std::vector<Frame> stack;
+    std::vector<std::pair<dev_t, ino_t>> ancestors;  // loop guard
+  };
+  // Compares the open directory |dir| at configured |path| (caching its
+  // handle) and pushes it on the walk's stack.
+  void Enter(UniqueFd dir, const std::string& path);
   // Logs, once while it lasts, that root |path| is not served and why.
   void NoteMissing(const std::string& path, const std::string& why);
   // A descriptor on the file system |fsid| for open_by_handle_at, kept
@@ -189,6 +208,7 @@ class FanotifyTree {
   std::unordered_set<std::string> outside_;              // handles of directories outside
   std::set<std::string> unscanned_;  // real paths of arrivals not found where they came
   std::deque<std::pair<std::string, Walk>> to_walk_;  // roots to compare
+  std::unique_ptr<Walking> walking_;                  // the walk in progress
   std::map<std::string, UniqueFd> mount_fds_;         // by root path, this round
   std::string key_;                                   // Resolve's buffer
   std::vector<std::string> paths_;                    // Configured's result

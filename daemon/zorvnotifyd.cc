@@ -291,7 +291,7 @@ int Serve(const Options& options) {
       sync.Wrote(NowMs());
     }
     // Trees that fanotify serves are compared with the snapshot after
-    // ready, one a turn, events delivered in between.
+    // ready, a hundred directories a turn, events read in between.
     if (tree.walking()) {
       tree.WalkPending();
       sync.Wrote(NowMs());

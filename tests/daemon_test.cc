@@ -1279,7 +1279,8 @@ TEST_F(DaemonTest, ServesWholeFileSystemsWithFanotify) {
   ASSERT_TRUE(daemon->Logged(
       "tree \"/tmp/ram\" is served by inotify: its file system gives no file handles"));
   ASSERT_TRUE(daemon->Logged("ready:"));
-  EXPECT_TRUE(daemon->Heard("t /tmp/all/t/c3/offline 256"));
+  EXPECT_EQ(daemon->ReadUntil("t /tmp/all/t/c3/offline 256"),
+            Lines({"t /tmp/all/t/c3/offline 256"}));
   const Json::Value trees = Status()["trees"];
   ASSERT_EQ(trees.size(), 4u);
   EXPECT_EQ(trees[0]["path"].asString() + " " + trees[0]["backend"].asString(),
