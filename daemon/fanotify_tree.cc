@@ -205,13 +205,12 @@ bool FanotifyTree::Attach(Root& root, int dir, std::string* why) {
   root.dev = st.st_dev;
   root.ino = st.st_ino;
   root.present = true;
-  // The directory holding it tells when it goes or comes back.
+  // The directory holding it tells when it goes or comes back: "..", not
+  // a path that could lead elsewhere by now.
   root.parent_key.clear();
   if (real != "/") {
-    const size_t slash = real.rfind('/');
-    const std::string parent = slash == 0 ? "/" : real.substr(0, slash);
-    root.name = real.substr(slash + 1);
-    const UniqueFd up(open(parent.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+    root.name = real.substr(real.rfind('/') + 1);
+    const UniqueFd up(openat(dir, "..", O_PATH | O_DIRECTORY | O_CLOEXEC));
     if (up.get() >= 0) {
       struct statfs fs;
       if (fstatfs(up.get(), &fs) == 0) {
