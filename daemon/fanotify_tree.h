@@ -99,9 +99,11 @@ class FanotifyTree {
   }
   // Lists again the directories events marked, and those new to a tree.
   void Relist();
-  // Saves the snapshot as it stands in memory.
+  // Saves the snapshot as it stands in memory, unless a walk is not done:
+  // the tree it compares holds listings whose changes are not reported
+  // yet, and lacks those of the directories it has not reached.
   void SaveSnapshot() {
-    if (snapshot_ != nullptr) snapshot_->Save();
+    if (snapshot_ != nullptr && walking_ == nullptr) snapshot_->Save();
   }
 
  private:
