@@ -6,6 +6,7 @@
 // 2 bad command line.
 
 #include <errno.h>
+#include <fcntl.h>
 #include <grp.h>
 #include <poll.h>
 #include <signal.h>
@@ -35,6 +36,7 @@
 #include "text.h"
 #include "unique_fd.h"
 #include "watch_tree.h"
+#include "watchers.h"
 
 namespace zorvnotifyd {
 namespace {
@@ -42,9 +44,10 @@ namespace {
 const char kUsage[] =
     "Usage: zorvnotifyd [OPTION]...\n"
     "\n"
-    "Watches, with inotify, every directory tree that a monitor queue of the catalogue\n"
-    "names, and delivers each queue's events to the programs that subscribe to it on\n"
-    "the daemon's Unix socket, as JSON lines (see zorvnotifyd(8) for the protocol).\n"
+    "Watches, with inotify or fanotify, every directory tree that a monitor queue of\n"
+    "the catalogue names, and delivers each queue's events to the programs that\n"
+    "subscribe to it on the daemon's Unix socket, as JSON lines (see zorvnotifyd(8)\n"
+    "for the protocol).\n"
     "\n"
     "  --socket PATH         the socket (default /run/zorvnotifyd/zorvnotifyd.sock), in\n"
     "                        a directory of root's that only root may write\n"
@@ -67,6 +70,11 @@ const char kUsage[] =
     "  --json                ... as JSON objects (implies --stdout)\n"
     "  --retry SECONDS       how often trees that are missing, replaced or over the\n"
     "                        watch limit are looked at again (default 5; fractions allowed)\n"
+    "  --backend auto|inotify|fanotify\n"
+    "                        what watches the trees (default auto: fanotify for a\n"
+    "                        tree that is a whole mounted file system where the\n"
+    "                        kernel, the file system and CAP_SYS_ADMIN allow it,\n"
+    "                        inotify elsewhere)\n"
     "  --version             print the version and exit\n"
     "\n"
     "The daemon runs in the foreground and never forks: start it from a service\n"
@@ -139,7 +147,7 @@ UniqueFd OpenSignals() {
 // Compares the trees that the start's walk watched with what was saved of
 // them, after READY: a start is ready once its watches are in place, and
 // the changes found are numbered before any event that came meanwhile.
-void CompareAfterReady(WatchTree& tree) {
+void CompareAfterReady(Watchers& tree) {
   const int64_t start = NowMs();
   const size_t trees = tree.Compare();
   if (trees > 0) {
@@ -163,6 +171,7 @@ struct Options {
   uint64_t journal_size = 8 << 20;
   int64_t sync_interval_ms = 100;
   int64_t coalesce_us = kDefaultCoalesceUs;
+  Backend backend = Backend::kAuto;
 };
 
 // Before a turn reads events: waits |window_us| for those that follow the
@@ -180,6 +189,10 @@ void Coalesce(int64_t window_us) {
   while (nanosleep(&wait, &wait) != 0 && errno == EINTR) {
   }
 }
+
+// The snapshot directory's second descriptor, for the fanotify watcher's
+// own snapshot; empty (no snapshot kept) when it cannot be had.
+UniqueFd DupDescriptor(int fd) { return UniqueFd(fd < 0 ? -1 : fcntl(fd, F_DUPFD_CLOEXEC, 0)); }
 
 // Serves events until a stop signal (returns 0) or a fatal error (1).
 int Serve(const Options& options) {
@@ -201,15 +214,16 @@ int Serve(const Options& options) {
   }
   SyncTimer sync(options.sync_interval_ms);
   Reporter reporter(logs, options.out);
-  WatchTree tree(std::move(inotify), options.retry_seconds);
+  Watchers tree(std::move(inotify), options.retry_seconds, options.backend);
   std::string reason;
   UniqueFd snapshot_dir = state.OpenSubdirectory("snapshot", &reason);
   if (snapshot_dir.get() < 0) {
     syslog(LOG_ERR, "cannot keep the snapshot of the trees (%s): every tree is rescanned",
            reason.c_str());
   }
+  Snapshot fanotify_snapshot(DupDescriptor(snapshot_dir.get()));
   Snapshot snapshot(std::move(snapshot_dir));
-  tree.UseSnapshot(&snapshot, &reporter);
+  tree.UseSnapshots(&snapshot, &fanotify_snapshot, &reporter);
   // The snapshot never gets ahead of the journals.  A change seen by the
   // listing had its event queued by then, so every queued event is read
   // and its records written and synced before the listing is saved: a
@@ -236,6 +250,8 @@ int Serve(const Options& options) {
     AppendJsonNumber(&status, "trees_missing", tree.missing());
     status += ',';
     AppendJsonNumber(&status, "directories_over_watch_limit", tree.over_limit());
+    status += ',';
+    tree.AppendStatus(&status);
     status += ',';
     AppendJsonField(&status, "state",
                     !journaling       ? "no journal"
@@ -267,14 +283,17 @@ int Serve(const Options& options) {
   const int64_t retry_ms = std::max<int64_t>(1, int64_t(options.retry_seconds * 1000));
   int64_t next_tick = NowMs() + retry_ms;
   struct pollfd fds[] = {{signals.get(), POLLIN, 0},
-                         {tree.fd(), POLLIN, 0},
+                         {tree.inotify_fd(), POLLIN, 0},
                          {catalogue_watch.fd(), POLLIN, 0},
-                         {server.fd(), POLLIN, 0}};
+                         {server.fd(), POLLIN, 0},
+                         {tree.fanotify_fd(), POLLIN, 0}};
   for (;;) {
     // Trees that went away, were replaced or did not fit under the watch
     // limit are looked at again on a fixed period, whatever the load.
     const int64_t wake = sync.due() >= 0 ? std::min(next_tick, sync.due()) : next_tick;
-    const int ready = poll(fds, 4, int(std::max<int64_t>(0, wake - NowMs())));
+    fds[4].fd = tree.fanotify_fd();  // opened by the first load, or never
+    const int timeout = tree.walking() ? 0 : int(std::max<int64_t>(0, wake - NowMs()));
+    const int ready = poll(fds, 5, timeout);
     if (ready < 0 && errno != EINTR) {
       syslog(LOG_ERR, "poll failed: %s", strerror(errno));
       return 1;
@@ -299,10 +318,22 @@ int Serve(const Options& options) {
       logs.Close();
       return 0;
     }
-    if (ready > 0 && (fds[1].revents & POLLIN)) {
-      Coalesce(options.coalesce_us);
-      if (!tree.ReadEvents(reporter)) return 1;
+    const bool inotify_ready = ready > 0 && (fds[1].revents & POLLIN);
+    const bool fanotify_ready = ready > 0 && (fds[4].revents & POLLIN);
+    if (inotify_ready || fanotify_ready) Coalesce(options.coalesce_us);
+    if (inotify_ready) {
+      if (!tree.ReadInotify(reporter)) return 1;
       sync.Wrote(NowMs());  // the directories the events marked
+    }
+    if (fanotify_ready) {
+      if (!tree.ReadFanotify(reporter)) return 1;
+      sync.Wrote(NowMs());
+    }
+    // Trees that fanotify serves are compared with the snapshot after
+    // ready, a hundred directories a turn, events read in between.
+    if (tree.walking()) {
+      tree.WalkPending();
+      sync.Wrote(NowMs());
     }
     // A configuration directory that was missing (a read-only /usr) and
     // exists now is read as soon as the next tick finds it.
@@ -403,6 +434,8 @@ int ParseOptions(int argc, char** argv, Options* options) {
     } else if (arg == "--max-clients" && value != nullptr &&
                ParseCount(value, 1, 1000000, &number)) {
       options->server.max_clients = size_t(number);
+      ++i;
+    } else if (arg == "--backend" && value != nullptr && ParseBackend(value, &options->backend)) {
       ++i;
     } else if (arg == "--retry" && value != nullptr) {
       char* end = nullptr;

@@ -319,6 +319,8 @@ TEST(ZorvnotifyctlTest, WatchAndStatusAskTheDaemon) {
   ASSERT_THAT(daemon.WaitFor("ready:"), ::testing::HasSubstr("for 1 queues"));
   EXPECT_EQ(RunTool("--socket " + socket + " status", "", &out, &err), 0) << err;
   EXPECT_THAT(out, ::testing::ContainsRegex("\nqueues +1\n"));
+  // A tree that is part of a file system stays with inotify by default.
+  EXPECT_THAT(out, ::testing::HasSubstr("\n/tmp/wd  inotify  it is a part of its file system ("));
 
   // Its first line comes once the subscription is in place.
   zorv_test::ChildProcess watch({ZORVNOTIFYCTL_PATH, "--socket", socket, "watch", "backup"},

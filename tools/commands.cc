@@ -774,6 +774,17 @@ int RunStatus(const Invocation& invocation) {
     std::cout << '\n';
     journals.Print(std::cout);
   }
+  // Which backend watches each tree, and why.
+  Table trees({"TREE", "BACKEND", "WHY"});
+  for (const Json::Value& tree : answer["trees"]) {
+    if (!tree.isObject() || !tree["path"].isString()) continue;
+    trees.AddRow({Shown(tree["path"]), tree["backend"].isString() ? Shown(tree["backend"]) : "-",
+                  tree["why"].isString() ? Shown(tree["why"]) : ""});
+  }
+  if (!answer["trees"].empty()) {
+    std::cout << '\n';
+    trees.Print(std::cout);
+  }
   return kExitOk;
 }
 

@@ -1,0 +1,173 @@
+// Choosing the watcher of each tree.
+
+#include "watchers.h"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <syslog.h>
+
+#include <algorithm>
+#include <fstream>
+#include <sstream>
+#include <utility>
+
+#include "directory.h"
+#include "json_writer.h"
+#include "text.h"
+
+namespace zorvnotifyd {
+namespace {
+
+constexpr const char* kInotify = "inotify";
+constexpr const char* kFanotify = "fanotify";
+
+// True when |path| lies strictly below |top|.
+bool Below(const std::string& path, const std::string& top) {
+  if (top == "/") return path.size() > 1;
+  return path.size() > top.size() && path.compare(0, top.size(), top) == 0 &&
+         path[top.size()] == '/';
+}
+
+// True when the open directory |dir| is the root of its file system, as
+// mounted: a mount whose root is the file system's own (a bind mount of a
+// directory inside one is not).
+bool IsFileSystemRoot(int dir) {
+  struct statx stx;
+  if (statx(dir, "", AT_EMPTY_PATH | AT_STATX_DONT_SYNC, STATX_BASIC_STATS | STATX_MNT_ID, &stx) !=
+          0 ||
+      !(stx.stx_attributes_mask & STATX_ATTR_MOUNT_ROOT) || !(stx.stx_mask & STATX_MNT_ID)) {
+    struct stat self, parent;  // kernels before 5.8: a mount's root
+    return fstat(dir, &self) == 0 && fstatat(dir, "..", &parent, 0) == 0 &&
+           (self.st_dev != parent.st_dev || self.st_ino == parent.st_ino);
+  }
+  if (!(stx.stx_attributes & STATX_ATTR_MOUNT_ROOT)) return false;
+  // "ID PARENT MAJOR:MINOR ROOT ..." in the mount table of the daemon.
+  std::ifstream table("/proc/self/mountinfo");
+  const std::string id = std::to_string(stx.stx_mnt_id) + " ";
+  for (std::string line; std::getline(table, line);) {
+    if (line.compare(0, id.size(), id) != 0) continue;
+    std::istringstream fields(line);
+    std::string skip, root;
+    fields >> skip >> skip >> skip >> root;
+    return root == "/";
+  }
+  return false;
+}
+
+}  // namespace
+
+bool ParseBackend(const std::string& text, Backend* backend) {
+  if (text == "auto") {
+    *backend = Backend::kAuto;
+  } else if (text == kInotify) {
+    *backend = Backend::kInotify;
+  } else if (text == kFanotify) {
+    *backend = Backend::kFanotify;
+  } else {
+    return false;
+  }
+  return true;
+}
+
+Watchers::Watchers(UniqueFd inotify, double retry_seconds, Backend backend)
+    : inotify_(std::move(inotify), retry_seconds), fanotify_(retry_seconds), backend_(backend) {}
+
+void Watchers::Sync(const std::vector<std::string>& roots,
+                    const ZORV::ZORVNOTIFYD::MonitorQueueIndex& index) {
+  std::string cannot;
+  const bool can = backend_ != Backend::kInotify && fanotify_.Open(&cannot);
+  std::vector<std::string> sorted(roots);
+  std::sort(sorted.begin(), sorted.end());
+  std::map<std::string, Choice> chosen;
+  for (const std::string& root : sorted) {
+    // The innermost tree chosen already that holds this one.
+    const std::string* outer = nullptr;
+    for (const auto& [path, choice] : chosen) {
+      if (Below(root, path)) outer = &path;
+    }
+    const UniqueFd dir = OpenConfiguredDir(root);
+    std::string why;
+    Choice choice{kInotify, ""};
+    if (outer != nullptr && chosen[*outer].backend == kInotify) {
+      choice.why = "it lies in tree " + zorvcommon::Quoted(*outer) + ", which inotify serves";
+    } else if (backend_ == Backend::kInotify) {
+      choice.why = "--backend inotify";
+    } else if (!can) {
+      choice.why = cannot;
+    } else if (dir.get() < 0) {
+      // Looked for again by the watcher chosen.
+      choice = backend_ == Backend::kFanotify ? Choice{kFanotify, "--backend fanotify"}
+                                              : Choice{kInotify, "it is missing"};
+    } else if (!FanotifySupports(dir.get(), &why)) {
+      choice.why = why;
+    } else if (backend_ == Backend::kFanotify) {
+      choice = {kFanotify, "--backend fanotify"};
+    } else if (outer != nullptr) {
+      choice = {kFanotify,
+                "it lies in tree " + zorvcommon::Quoted(*outer) + ", which fanotify serves"};
+    } else if (!IsFileSystemRoot(dir.get())) {
+      choice.why =
+          "it is a part of its file system (fanotify would pay for the events of the rest; "
+          "--backend fanotify serves it so)";
+    } else {
+      choice = {kFanotify, "it is a whole file system, with file handles"};
+    }
+    chosen[root] = choice;
+  }
+  // A tree fanotify refuses (a mark it cannot have) goes to inotify, and
+  // the trees inside it with it, since inotify's walk covers them.
+  std::vector<std::string> by_fanotify, by_inotify;
+  for (bool again = true; again;) {
+    by_fanotify.clear();
+    by_inotify.clear();
+    for (const auto& [root, choice] : chosen) {
+      (choice.backend == kFanotify ? by_fanotify : by_inotify).push_back(root);
+    }
+    std::map<std::string, std::string> refused;
+    fanotify_.Sync(by_fanotify, index, &refused);
+    again = false;
+    for (const auto& [root, why] : refused) {
+      chosen[root] = {kInotify, why};
+      for (auto& [path, choice] : chosen) {
+        if (Below(path, root) && choice.backend == kFanotify) {
+          choice = {kInotify,
+                    "it lies in tree " + zorvcommon::Quoted(root) + ", which inotify serves"};
+          again = true;
+        }
+      }
+    }
+    if (!again) {
+      for (const auto& [root, why] : refused) by_inotify.push_back(root);
+    }
+  }
+  inotify_.Sync(by_inotify, index);
+  for (const auto& [root, choice] : chosen) {
+    const auto before = chosen_.find(root);
+    if (before != chosen_.end() && before->second.backend == choice.backend &&
+        before->second.why == choice.why) {
+      continue;
+    }
+    syslog(LOG_INFO, "tree %s is served by %s: %s", zorvcommon::Quoted(root).c_str(),
+           choice.backend, choice.why.c_str());
+  }
+  chosen_ = std::move(chosen);
+}
+
+void Watchers::AppendStatus(std::string* out) const {
+  out->append("\"trees\":[");
+  bool first = true;
+  for (const auto& [root, choice] : chosen_) {
+    if (!first) out->push_back(',');
+    first = false;
+    out->push_back('{');
+    AppendJsonBytesField(out, "path", root);
+    out->push_back(',');
+    AppendJsonField(out, "backend", choice.backend);
+    out->push_back(',');
+    AppendJsonField(out, "why", choice.why);
+    out->push_back('}');
+  }
+  out->push_back(']');
+}
+
+}  // namespace zorvnotifyd
