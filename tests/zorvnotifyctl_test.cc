@@ -143,6 +143,9 @@ TEST(ZorvnotifyctlTest, RefusalsExitStatusesAndJsonOutput) {
   const std::string b = R"({"queue": "b", "config": [{"path": "/s/t/u", "mask": 6, "ignore": []}])";
   const std::string a_row = R"({"queue": "a", "type": "share")";
   const std::string b_row = R"({"queue": "b", "type": "etc")";
+  const std::string removed = R"({"file": "e", "path": "/usr/zorv/etc/zorvnotifyd/e",
+                                  "queue": "b", "type": "etc", "removed": )";
+  const std::string dotted = WatchingPath("/a/.b/..c/d.");  // dotted names, not components
   Check({
       {"-t share upsert q", a + "}", 0, ""},
       {"upsert e", b + "}", 0, ""},
@@ -156,11 +159,6 @@ TEST(ZorvnotifyctlTest, RefusalsExitStatusesAndJsonOutput) {
            b_row + R"(, "mask": 6}]})"},
       {"--json shares", "", 0, R"(["/s/t"])"},
       {"get nope e", "", 1, "No such monitor queue: nope"},  // the library's line
-  });
-  const std::string removed = R"({"file": "e", "path": "/usr/zorv/etc/zorvnotifyd/e",
-                                  "queue": "b", "type": "etc", "removed": )";
-  const std::string dotted = WatchingPath("/a/.b/..c/d.");  // dotted names, not components
-  Check({
       {"upsert g", dotted, 0, ""},
       {"--json get q g", "", 0, dotted},
       {"--json delete b e", "", 0, removed + "true}"},
