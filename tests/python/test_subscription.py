@@ -73,17 +73,29 @@ def take(subscription, count=None, until=None):
     return got
 
 
-def serve(path, scripts):
+def serve(path, scripts, requests):
     """Serves one connection at PATH with each of SCRIPTS in turn, in a thread.
 
-    A script takes the connection's reader and writer; it returns when it is
-    done with the connection, which is then closed.  The thread's failures
-    are kept in the returned list.
+    A script (journal, answers, then, hold) answers each request line, kept
+    in REQUESTS, with the next of ANSWERS under JOURNAL, then writes THEN
+    (records, or bytes as they are) and, with HOLD, waits for the client to
+    hang up.  The thread's failures are kept in the returned list.
     """
     listener = socket.socket(socket.AF_UNIX, socket.SOCK_STREAM)
     listener.bind(path)
     listener.listen()
     failures = []
+
+    def exchange(reader, writer, journal, answers, then, hold):
+        for answer in answers:
+            requests.append(json.loads(reader.readline()))
+            writer.write(json.dumps(dict(answer, journal=journal)).encode() + b"\n")
+            writer.flush()
+        for line in then:
+            writer.write(line if isinstance(line, bytes) else json.dumps(line).encode() + b"\n")
+        writer.flush()
+        if hold:
+            reader.read()
 
     def run():
         with listener:
@@ -91,7 +103,7 @@ def serve(path, scripts):
                 conn, _ = listener.accept()
                 with conn, conn.makefile("rb") as reader, conn.makefile("wb") as writer:
                     try:
-                        script(reader, writer)
+                        exchange(reader, writer, *script)
                     except Exception as e:  # reported by the test
                         failures.append(repr(e))
 
@@ -168,29 +180,15 @@ class SubscriptionTest(unittest.TestCase):
             return {"queue": "f", "type": "etc", "file": "x", "seq": seq, "path": "/p%d" % seq,
                     "mask": 256}
 
-        def exchange(reader, writer, journal, answers, then, hold=False):
-            for answer in answers:
-                requests.append(json.loads(reader.readline()))
-                writer.write(json.dumps(dict(answer, journal=journal)).encode() + b"\n")
-                writer.flush()
-            for line in then:
-                writer.write(line if isinstance(line, bytes) else json.dumps(line).encode() + b"\n")
-            writer.flush()
-            if hold:
-                reader.read()  # until the client hangs up
-
         status = {"reply": "status", "run": "r"}
         overlong = b"x" * (1 << 20) + b"x"
         reply7 = dict(reply, queues=[{"type": "etc", "file": "x", "seq": 7}])
         thread, failures = serve(path, [
-            lambda r, w: exchange(r, w, "J", [status, reply],
-                                  [record(1), record(2), record(1), overlong], hold=True),
-            lambda r, w: exchange(r, w, "J", [status, reply, reply],
-                                  [record(2), dict(record(3), path_b64="L3Az6Q==")]),
-            lambda r, w: exchange(r, w, "K", [status, reply7, reply], [record(7), record(8)],
-                                  hold=True),
-            lambda r, w: exchange(r, w, "K", [status, reply], [record(1)], hold=True),
-        ])
+            ("J", [status, reply], [record(1), record(2), record(1), overlong], True),
+            ("J", [status, reply, reply], [record(2), dict(record(3), path_b64="L3Az6Q==")], False),
+            ("K", [status, reply7, reply], [record(7), record(8)], True),
+            ("K", [status, reply], [record(1)], True),
+        ], requests)
         with zorvnotifyd.Subscription(path) as subscription:
             subscription.subscribe("f")
             got = take(subscription, 5)
