@@ -6,14 +6,9 @@
 #include <poll.h>
 #include <signal.h>
 #include <sys/inotify.h>
-#include <sys/socket.h>
-#include <sys/stat.h>
-#include <sys/un.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <cstdlib>
-#include <cstring>
 #include <fstream>
 #include <string>
 #include <vector>
@@ -33,14 +28,6 @@ using namespace ZORV::ZORVNOTIFYD;  // NOLINT
 using Lines = std::vector<std::string>;
 
 constexpr const char* kSocket = "/tmp/zorvrun/zorvnotifyd.sock";
-
-class SubscriptionTest : public ::testing::Test {
- protected:
-  void SetUp() override {
-    ZORV_REQUIRE_SANDBOX();
-    zorv_test::ResetStore();
-  }
-};
 
 // |event| as "KIND seq path" ("MISSED n" for a missed notice), with the
 // queue's identity when it is not queue "q" of etc file "f".
@@ -71,7 +58,9 @@ bool Readable(int fd, int timeout_ms) {
 
 bool Touch(const std::string& path) { return static_cast<bool>(std::ofstream(path).flush()); }
 
-TEST_F(SubscriptionTest, FollowsItsQueueInOrderAcrossADaemonRestart) {
+TEST(SubscriptionTest, FollowsItsQueueInOrderAcrossADaemonRestart) {
+  ZORV_REQUIRE_SANDBOX();
+  zorv_test::ResetStore();
   ASSERT_EQ(std::system("rm -rf /tmp/sub && mkdir -p /tmp/sub/q /tmp/sub/o"), 0);
   for (const char* name : {"q", "o"}) {
     Json::Value json;
@@ -135,50 +124,6 @@ TEST_F(SubscriptionTest, FollowsItsQueueInOrderAcrossADaemonRestart) {
   EXPECT_EQ(daemon->Stop(SIGTERM), 0);
 }
 
-// A server at |path| run by a child as |uid|: on its |n|th connection it
-// answers the |i|th request line with script[n][i], then closes the
-// connection once script[n] is done (the last connection stays open).
-// Every request line it received goes to |log|, one a line.
-pid_t Serve(const char* path, uid_t uid, const std::vector<Lines>& script, const char* log) {
-  unlink(path);
-  int ready[2];
-  if (pipe(ready) != 0) return -1;
-  const pid_t pid = fork();
-  if (pid != 0) {
-    close(ready[1]);
-    char byte;
-    const bool started = read(ready[0], &byte, 1) == 1;
-    close(ready[0]);
-    return started ? pid : -1;
-  }
-  const int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  struct sockaddr_un address = {};
-  address.sun_family = AF_UNIX;
-  strcpy(address.sun_path, path);
-  if (bind(fd, reinterpret_cast<struct sockaddr*>(&address), sizeof(address)) != 0 ||
-      setresgid(uid, uid, uid) != 0 || setresuid(uid, uid, uid) != 0 || listen(fd, 8) != 0 ||
-      write(ready[1], "x", 1) != 1) {
-    _exit(1);
-  }
-  FILE* out = fopen(log, "w");
-  for (size_t n = 0;; ++n) {
-    const int client = accept(fd, nullptr, nullptr);
-    if (client < 0) _exit(1);
-    std::string buffer, line;
-    for (size_t i = 0; n >= script.size() || i < script[n].size(); ++i) {
-      if (!zorv_test::ReadLine(client, buffer, &line)) break;
-      if (out != nullptr) {
-        fprintf(out, "%zu %s\n", n, line.c_str());
-        fflush(out);
-      }
-      if (n >= script.size()) continue;
-      const std::string& answer = script[n][i];
-      if (write(client, answer.data(), answer.size()) != ssize_t(answer.size())) break;
-    }
-    if (n + 1 < script.size()) close(client);
-  }
-}
-
 Lines ReadLines(const char* path) {
   Lines lines;
   std::ifstream in(path);
@@ -186,11 +131,20 @@ Lines ReadLines(const char* path) {
   return lines;
 }
 
+// |lines|, each ended by a newline.
+std::string Join(const Lines& lines) {
+  std::string text;
+  for (const std::string& line : lines) text += line + "\n";
+  return text;
+}
+
 // Every kind of line the daemon writes, strictly read; members it may add
 // ignored; a repeat dropped; resumption after the last record delivered; a
 // new journal told with RESCAN; an overlong line ends the connection; and
 // a peer that is not root is never trusted.
-TEST_F(SubscriptionTest, ReadsWhatTheDaemonSaysAndResumesOrRescans) {
+TEST(SubscriptionTest, ReadsWhatTheDaemonSaysAndResumesOrRescans) {
+  ZORV_REQUIRE_SANDBOX();
+  zorv_test::ResetStore();
   const std::string head = R"({"queue":"q","type":"etc","file":"f",)";
   const std::string j1(32, 'a'), j2(32, 'b');
   std::string events;
@@ -202,64 +156,32 @@ TEST_F(SubscriptionTest, ReadsWhatTheDaemonSaysAndResumesOrRescans) {
       {R"({"reply":"subscribe","run":"r","journal":")" + j1 +
        R"(","queue":"q","queues":[{"type":"etc","file":"f","seq":2,"new":[1,{}]}]})"
        "\n" +
-       events + head +
-       R"("seq":150,"path":"/again","mask":256})"
-       "\n" +
-       head +
-       R"("missed":7})"
-       "\n" +
-       head +
-       R"("x":{"y":[1,-2.5e3,null,"\u00e9"]},"seq":203,"lost":true})"
-       "\n" +
-       head +
-       R"("seq":204,"path":"/caf\udce9 \ud83d\ude00\n","mask":2,"offline":true})"
-       "\n" +
-       head +
-       R"("seq":"205","path":"/b","mask":1})"
-       "\n" +
-       head +
-       R"("seq":205,"path":"/b","mask":4294967296})"
-       "\n" +
-       head +
-       R"("seq":205,"path":"/b","seq":206,"mask":1})"
-       "\n" +
-       head +
-       R"("seq":205,"path":"/\udc41","mask":1})"
-       "\n" +
-       head +
-       R"("seq":205,"path":"/b","path_b64":"L3X=","mask":1})"
-       "\n" +
-       R"({"error":"too many"})"
-       "\n" +
-       R"({"queue":"r","type":"share","file":"g","seq":1,"removed":true})"
-       "\n" +
-       R"({"queue":"r","type":"local-etc","file":"g","seq":1,"rescan":"/t","rescan_b64":"L3Xp"})"
-       "\n" +
-       std::string((1 << 20) + 1, 'x') + "\n" + head +
-       R"("seq":300,"path":"/lost","mask":1})"
-       "\n"},
+       events +
+       Join({head + R"("seq":150,"path":"/again","mask":256})", head + R"("missed":7})",
+             head + R"("x":{"y":[1,-2.5e3,null,"\u00e9"]},"seq":203,"lost":true})",
+             head + R"("seq":204,"path":"/caf\udce9 \ud83d\ude00\n","mask":2,"offline":true})",
+             head + R"("seq":"205","path":"/b","mask":1})",
+             head + R"("seq":205,"path":"/b","mask":4294967296})",
+             head + R"("seq":205,"path":"/b","seq":206,"mask":1})",
+             head + R"("seq":205,"path":"/\udc41","mask":1})",
+             head + R"("seq":205,"path":"/b","path_b64":"L3X=","mask":1})",
+             R"({"error":"too many"})",
+             R"({"queue":"r","type":"share","file":"g","seq":1,"removed":true})",
+             R"({"queue":"r","type":"local-etc","file":"g","seq":1,)"
+             R"("rescan":"/t","rescan_b64":"L3Xp"})",
+             std::string((1 << 20) + 1, 'x'), head + R"("seq":300,"path":"/lost","mask":1})"})},
       {R"({"reply":"status","journal":")" + j1 + "\"}\n",
-       R"({"reply":"subscribe","queues":[]})"
-       "\n" +
-           head +
-           R"("seq":204,"path":"/x","mask":1})"
-           "\n" +
-           head +
-           R"("seq":205,"path":"/y","mask":1})"
-           "\n",
-       R"({"reply":"subscribe","queues":[]})"
-       "\n"},
+       Join({R"({"reply":"subscribe","queues":[]})", head + R"("seq":204,"path":"/x","mask":1})",
+             head + R"("seq":205,"path":"/y","mask":1})"}),
+       Join({R"({"reply":"subscribe","queues":[]})"})},
       {R"({"reply":"status","journal":")" + j2 + "\"}\n",
-       R"({"reply":"subscribe","queues":[{"type":"etc","file":"f","seq":9}]})"
-       "\n" +
-           head +
-           R"("seq":10,"path":"/z","mask":1})"
-           "\n"},
+       Join({R"({"reply":"subscribe","queues":[{"type":"etc","file":"f","seq":9}]})",
+             head + R"("seq":10,"path":"/z","mask":1})"})},
   };
   const char* fake = "/tmp/zorvrun/fake.sock";
   const char* log = "/tmp/zorvrun/fake.log";
-  const pid_t server = Serve(fake, 0, script, log);
-  ASSERT_GT(server, 0);
+  zorv_test::ScriptedServer server(fake, 0, script, log);
+  ASSERT_GT(server.pid(), 0);
   MonitorQueueSubscription sub(fake);
   ASSERT_TRUE(sub.Subscribe("q")) << sub.LastError();
   EXPECT_EQ(sub.Journal(), j1);
@@ -298,20 +220,16 @@ TEST_F(SubscriptionTest, ReadsWhatTheDaemonSaysAndResumesOrRescans) {
                    R"(1 {"request":"subscribe","queue":"q","type":"etc","file":"f","since":204})",
                    R"(1 {"request":"subscribe","queue":"q"})", R"(2 {"request":"status"})",
                    R"(2 {"request":"subscribe","queue":"q"})"}));
-  kill(server, SIGKILL);
-  waitpid(server, nullptr, 0);
+  server.Stop();
 
   // Served by nobody: refused before a byte is read.
-  const pid_t impostor =
-      Serve(fake, 65534, {{"{\"reply\":\"subscribe\",\"queues\":[]}\n"}}, "/dev/null");
-  ASSERT_GT(impostor, 0);
+  zorv_test::ScriptedServer impostor(fake, 65534, {{"{\"reply\":\"subscribe\",\"queues\":[]}\n"}});
+  ASSERT_GT(impostor.pid(), 0);
   MonitorQueueSubscription refused(fake);
   EXPECT_FALSE(refused.Subscribe("q"));
   EXPECT_EQ(refused.LastError(), std::string(fake) + " is served by uid 65534 (pid " +
-                                     std::to_string(impostor) + "), not by root");
+                                     std::to_string(impostor.pid()) + "), not by root");
   EXPECT_FALSE(refused.Connected());
-  kill(impostor, SIGKILL);
-  waitpid(impostor, nullptr, 0);
 }
 
 }  // namespace

@@ -62,38 +62,40 @@ class Daemon:
         self.process.wait(10)
 
 
-def take(subscription, count):
-    """The next COUNT events, each as (kind, seq, path); fewer after 10 s without one."""
+def take(subscription, count=None, until=None):
+    """The next COUNT events, or those up to the one of path UNTIL, each as
+    (kind, seq, path); fewer when none came for 10 s."""
     got = []
     for event in subscription.events(timeout=10):
         got.append((event.kind, event.seq, event.path))
-        if len(got) == count:
+        if len(got) == count or event.path == until:
             break
     return got
 
 
-def take_until(subscription, path):
-    """The events up to the one of PATH, each as (kind, seq, path); all of
-    them when it did not come within 10 s of the last."""
-    got = []
-    for event in subscription.events(timeout=10):
-        got.append((event.kind, event.seq, event.path))
-        if event.path == path:
-            break
-    return got
-
-
-def serve(path, scripts):
+def serve(path, scripts, requests):
     """Serves one connection at PATH with each of SCRIPTS in turn, in a thread.
 
-    A script takes the connection's reader and writer; it returns when it is
-    done with the connection, which is then closed.  The thread's failures
-    are kept in the returned list.
+    A script (journal, answers, then, hold) answers each request line, kept
+    in REQUESTS, with the next of ANSWERS under JOURNAL, then writes THEN
+    (records, or bytes as they are) and, with HOLD, waits for the client to
+    hang up.  The thread's failures are kept in the returned list.
     """
     listener = socket.socket(socket.AF_UNIX, socket.SOCK_STREAM)
     listener.bind(path)
     listener.listen()
     failures = []
+
+    def exchange(reader, writer, journal, answers, then, hold):
+        for answer in answers:
+            requests.append(json.loads(reader.readline()))
+            writer.write(json.dumps(dict(answer, journal=journal)).encode() + b"\n")
+            writer.flush()
+        for line in then:
+            writer.write(line if isinstance(line, bytes) else json.dumps(line).encode() + b"\n")
+        writer.flush()
+        if hold:
+            reader.read()
 
     def run():
         with listener:
@@ -101,7 +103,7 @@ def serve(path, scripts):
                 conn, _ = listener.accept()
                 with conn, conn.makefile("rb") as reader, conn.makefile("wb") as writer:
                     try:
-                        script(reader, writer)
+                        exchange(reader, writer, *script)
                     except Exception as e:  # reported by the test
                         failures.append(repr(e))
 
@@ -113,11 +115,12 @@ def serve(path, scripts):
 # Each daemon's first start over a tree records a rescan of it (seq 1), so a
 # queue's events are numbered from 2 here.
 class SubscriptionTest(unittest.TestCase):
-    def test_events_come_in_order_with_their_bytes(self):
+    def test_follows_in_order_with_the_bytes_across_restarts_each_record_once(self):
         # A queue name and a path that are not UTF-8, on the way in and out.
-        name, tree = "caf\udce9", "/tmp/py/order"
+        name, tree, other = "caf\udce9", "/tmp/py/order", "/tmp/py/restart"
         register(name, tree)
-        daemon = Daemon()
+        register("r", other)
+        daemon = Daemon("--state-dir", "/tmp/py/state")
         try:
             with zorvnotifyd.Subscription(SOCKET) as subscription:
                 subscription.subscribe(name)
@@ -135,28 +138,21 @@ class SubscriptionTest(unittest.TestCase):
                 follow.terminate()
             self.assertEqual(lines, [b"etc/py 3 event /tmp/py/order/b 256\n",
                                      b"etc/py 4 event /tmp/py/order/caf\\udce9 256\n"])
-        finally:
-            daemon.stop()
 
-    def test_follows_across_restarts_each_record_once(self):
-        tree = "/tmp/py/restart"
-        register("r", tree)
-        daemon = Daemon("--state-dir", "/tmp/py/state")
-        try:
             with zorvnotifyd.Subscription(SOCKET) as subscription:
                 subscription.subscribe("r")
-                touch(tree + "/1")
-                self.assertEqual(take(subscription, 1), [("event", 2, tree + "/1")])
+                touch(other + "/1")
+                self.assertEqual(take(subscription, 1), [("event", 2, other + "/1")])
                 journal = subscription.journal
                 self.assertRegex(journal, "^[0-9a-f]{32}$")
                 # Made while the daemon is away and just after it is back,
                 # before the subscription is: resumed, once each, no gap.
                 daemon.stop()
-                touch(tree + "/2")
+                touch(other + "/2")
                 daemon = Daemon("--state-dir", "/tmp/py/state")
-                touch(tree + "/3")
-                got = take_until(subscription, tree + "/3")
-                self.assertEqual(got[-1:], [("event", 2 + len(got), tree + "/3")])
+                touch(other + "/3")
+                got = take(subscription, until=other + "/3")
+                self.assertEqual(got[-1:], [("event", 2 + len(got), other + "/3")])
                 self.assertEqual([seq for _, seq, _ in got], list(range(3, 3 + len(got))))
                 self.assertEqual(subscription.journal, journal)
                 # Another journal: no resuming, a rescan of the whole queue,
@@ -165,8 +161,8 @@ class SubscriptionTest(unittest.TestCase):
                 daemon = Daemon("--state-dir", "/tmp/py/other-state")
                 # (numbered as the daemon's last record, its own first-start rescan)
                 self.assertEqual(take(subscription, 1), [("rescan", 1, "")])
-                touch(tree + "/4")
-                self.assertEqual(take(subscription, 1), [("event", 2, tree + "/4")])
+                touch(other + "/4")
+                self.assertEqual(take(subscription, 1), [("event", 2, other + "/4")])
                 self.assertNotEqual(subscription.journal, journal)
         finally:
             daemon.stop()
@@ -184,29 +180,15 @@ class SubscriptionTest(unittest.TestCase):
             return {"queue": "f", "type": "etc", "file": "x", "seq": seq, "path": "/p%d" % seq,
                     "mask": 256}
 
-        def exchange(reader, writer, journal, answers, then, hold=False):
-            for answer in answers:
-                requests.append(json.loads(reader.readline()))
-                writer.write(json.dumps(dict(answer, journal=journal)).encode() + b"\n")
-                writer.flush()
-            for line in then:
-                writer.write(line if isinstance(line, bytes) else json.dumps(line).encode() + b"\n")
-            writer.flush()
-            if hold:
-                reader.read()  # until the client hangs up
-
         status = {"reply": "status", "run": "r"}
         overlong = b"x" * (1 << 20) + b"x"
         reply7 = dict(reply, queues=[{"type": "etc", "file": "x", "seq": 7}])
         thread, failures = serve(path, [
-            lambda r, w: exchange(r, w, "J", [status, reply],
-                                  [record(1), record(2), record(1), overlong], hold=True),
-            lambda r, w: exchange(r, w, "J", [status, reply, reply],
-                                  [record(2), dict(record(3), path_b64="L3Az6Q==")]),
-            lambda r, w: exchange(r, w, "K", [status, reply7, reply], [record(7), record(8)],
-                                  hold=True),
-            lambda r, w: exchange(r, w, "K", [status, reply], [record(1)], hold=True),
-        ])
+            ("J", [status, reply], [record(1), record(2), record(1), overlong], True),
+            ("J", [status, reply, reply], [record(2), dict(record(3), path_b64="L3Az6Q==")], False),
+            ("K", [status, reply7, reply], [record(7), record(8)], True),
+            ("K", [status, reply], [record(1)], True),
+        ], requests)
         with zorvnotifyd.Subscription(path) as subscription:
             subscription.subscribe("f")
             got = take(subscription, 5)
@@ -229,17 +211,16 @@ class SubscriptionTest(unittest.TestCase):
                                     {"request": "status"}, subscribe])
 
     def test_refuses_a_peer_that_is_not_root(self):
-        os.makedirs("/tmp/py-theirs", mode=0o777, exist_ok=True)
-        os.chmod("/tmp/py-theirs", 0o777)
-        path = "/tmp/py-theirs/zorvnotifyd.sock"
+        # Bound by root, listened on by uid 65534, which would say anything.
+        path = "/tmp/py-theirs.sock"
+        listener = socket.socket(socket.AF_UNIX, socket.SOCK_STREAM)
+        listener.bind(path)
         ready_r, ready_w = os.pipe()
         pid = os.fork()
-        if pid == 0:  # a listener of uid 65534 that would say anything
+        if pid == 0:
             try:
                 os.setgid(65534)
                 os.setuid(65534)
-                listener = socket.socket(socket.AF_UNIX, socket.SOCK_STREAM)
-                listener.bind(path)
                 listener.listen()
                 os.write(ready_w, b"!")
                 conn, _ = listener.accept()
@@ -247,6 +228,7 @@ class SubscriptionTest(unittest.TestCase):
                 conn.recv(1)
             finally:
                 os._exit(0)
+        listener.close()
         os.close(ready_w)
         self.assertEqual(os.read(ready_r, 1), b"!")
         os.close(ready_r)

@@ -5,8 +5,13 @@
 #include <sched.h>
 #include <signal.h>
 #include <sys/mount.h>
+#include <sys/socket.h>
+#include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
+
+#include <cstdio>
+#include <cstring>
 
 #include <gtest/gtest.h>
 
@@ -74,6 +79,52 @@ int ChildProcess::Stop(int signal) {
     return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
   }
   return -1;
+}
+
+ScriptedServer::ScriptedServer(const char* path, uid_t uid,
+                               const std::vector<std::vector<std::string>>& script,
+                               const char* log) {
+  unlink(path);
+  int ready[2];
+  if (pipe(ready) != 0) return;
+  if ((pid_ = fork()) != 0) {
+    close(ready[1]);
+    char byte;
+    if (read(ready[0], &byte, 1) != 1) Stop();
+    close(ready[0]);
+    return;
+  }
+  const int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  struct sockaddr_un address = {};
+  address.sun_family = AF_UNIX;
+  strncpy(address.sun_path, path, sizeof(address.sun_path) - 1);
+  if (bind(fd, reinterpret_cast<struct sockaddr*>(&address), sizeof(address)) != 0 ||
+      setresgid(uid, uid, uid) != 0 || setresuid(uid, uid, uid) != 0 || listen(fd, 8) != 0 ||
+      write(ready[1], "x", 1) != 1) {
+    _exit(1);
+  }
+  FILE* out = fopen(log, "w");
+  for (size_t n = 0;; ++n) {
+    const int client = accept(fd, nullptr, nullptr);
+    if (client < 0) _exit(1);
+    std::string buffer, line;
+    for (size_t i = 0; n >= script.size() || i < script[n].size(); ++i) {
+      if (!ReadLine(client, buffer, &line)) break;
+      if (out != nullptr) {
+        fprintf(out, "%zu %s\n", n, line.c_str());
+        fflush(out);
+      }
+      if (n >= script.size()) continue;
+      const std::string& answer = script[n][i];
+      if (write(client, answer.data(), answer.size()) != ssize_t(answer.size())) break;
+    }
+    if (n + 1 < script.size()) close(client);
+  }
+}
+
+void ScriptedServer::Stop() {
+  if (pid_ > 0 && kill(pid_, SIGKILL) == 0) waitpid(pid_, nullptr, 0);
+  pid_ = -1;
 }
 
 }  // namespace zorv_test

@@ -1,5 +1,5 @@
-// A program run as a child process, with its standard output and error on
-// pipes read a line at a time with a timeout.
+// The tests' child processes: a program with its standard output and error
+// on pipes read a line at a time with a timeout, and a scripted socket server.
 #ifndef ZORVNOTIFYD_TESTS_SUPPORT_CHILD_PROCESS_H_
 #define ZORVNOTIFYD_TESTS_SUPPORT_CHILD_PROCESS_H_
 
@@ -44,6 +44,27 @@ class ChildProcess {
   pid_t pid_ = -1;
   int out_[2] = {-1, -1}, err_[2] = {-1, -1};
   std::string out_text_, err_text_;
+};
+
+// A Unix stream socket server at |path| in a forked child, bound as root and
+// then listening as |uid| (a peer that is not root, unless 0): on its |n|th
+// connection it answers the |i|th request line with script[n][i], then closes
+// the connection once script[n] is done (the last connection stays open).
+// Every request line it received goes to |log| as "n line".
+class ScriptedServer {
+ public:
+  ScriptedServer(const char* path, uid_t uid, const std::vector<std::vector<std::string>>& script,
+                 const char* log = "/dev/null");
+  ScriptedServer(const ScriptedServer&) = delete;
+  ScriptedServer& operator=(const ScriptedServer&) = delete;
+  ~ScriptedServer() { Stop(); }
+  // The server's pid once it listens; -1 when it could not start.
+  pid_t pid() const { return pid_; }
+  // Kills the server and waits for it.
+  void Stop();
+
+ private:
+  pid_t pid_ = -1;
 };
 
 }  // namespace zorv_test
