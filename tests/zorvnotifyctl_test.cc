@@ -135,7 +135,7 @@ TEST(ZorvnotifyctlTest, RefusalsExitStatusesAndJsonOutput) {
   ASSERT_NE(access("/usr/zorv", F_OK), 0) << "a refused command reached the library";
   std::string out, err;
   EXPECT_EQ(RunTool("--version upsert q", "", &out, &err), 0) << err;
-  EXPECT_EQ(out, "zorvnotifyctl 6.0.0\n");
+  EXPECT_EQ(out, "zorvnotifyctl " ZORVNOTIFYD_VERSION "\n");
 
   const std::string a =
       R"({"queue": "a", "config": [{"path": "/s/t", "mask": 4294967295, "ignore": ["p$"]}])";
