@@ -224,9 +224,9 @@ bool WatchTree::ReadEvents(EventSink& sink) {
     // A read after one that emptied the queue would only say EAGAIN: the
     // caller's poll tells when more come.
     if (pending_.empty() && (drained_ || !Fill(&failed))) break;
+    RawEvent event;
     while (!pending_.empty()) {
-      const RawEvent event = std::move(pending_.front());
-      pending_.pop_front();
+      pending_.PopFront(&event);
       if ((event.mask & IN_Q_OVERFLOW) == 0) {
         Handle(event, sink);
         continue;
