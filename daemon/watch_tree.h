@@ -253,9 +253,22 @@ class WatchTree {
   void ReadAhead();
   // Tells sink_ to rescan each of |tops| not told already.
   void NoteUnwatched(const std::vector<std::string>& tops);
-  // Lists the watched directory |path| into |listing|; false when it is
-  // not watched or is no longer the directory watched there.
-  bool ListWatched(const std::string& path, SnapshotListing* listing);
+  // The directory that ListWatched last opened as a parent, kept by its
+  // caller for one pass: the directories of one save mostly share their
+  // parents, and each is then one openat instead of a walk from its root.
+  struct ParentDir {
+    std::string path;
+    UniqueFd fd;
+  };
+  // Lists the watched directory |path| into |listing|, opening it through
+  // |parent| when that is its parent (and keeping its parent there
+  // otherwise); false when it is not watched or is no longer the directory
+  // watched there.
+  bool ListWatched(const std::string& path, SnapshotListing* listing, ParentDir* parent);
+  // Opens the directory |path| below |root| as OpenBelow does, through
+  // |parent| (see ListWatched).
+  static UniqueFd OpenThroughParent(const std::string& root, const std::string& path,
+                                    ParentDir* parent);
   // Moves the watches at and below each path of |from| to each path of
   // |to| (a rename within the trees; several paths when the directories
   // have several), then sets the kernel masks that the new place changes.
