@@ -130,7 +130,10 @@ void QueueLogs::Follow(const Catalogue& catalogue, std::vector<QueueLog*>* by_po
         order_ = std::max(order_, start.last_order);
       }
       log = std::make_unique<QueueLog>(entry.type, entry.file, entry.queue._name, keep_, last_seq);
-      if (journal) log->UseJournal(std::move(journal), &written_);
+      if (journal) {
+        log->UseJournal(std::move(journal), &written_);
+        NeedsSync(log.get());  // opening may have made or replaced its files
+      }
       log->Skip(start.last_record + 1, start.last_seq + 1);
       if (start.damaged) damaged.push_back(log.get());
       // A client's "since" for this queue means nothing now.
@@ -168,6 +171,7 @@ void QueueLogs::Forget(std::map<std::string, std::unique_ptr<QueueLog>>::iterato
   if (log.journal() == nullptr) return;
   log.journal()->Close(log.last_seq());
   written_.erase(std::remove(written_.begin(), written_.end(), &log), written_.end());
+  to_sync_.erase(std::remove(to_sync_.begin(), to_sync_.end(), &log), to_sync_.end());
   degraded_.erase(std::remove(degraded_.begin(), degraded_.end(), &log), degraded_.end());
 }
 
@@ -176,6 +180,7 @@ void QueueLogs::WriteOut() {
   unsynced_ = true;
   for (QueueLog* log : written_) {
     log->Written();
+    NeedsSync(log);
     const bool was_healthy = log->journal()->healthy();
     if (!log->journal()->WriteOut() && was_healthy) degraded_.push_back(log);
   }
@@ -189,10 +194,20 @@ void QueueLogs::BeforeSend() {
   WriteOut();
 }
 
+void QueueLogs::NeedsSync(QueueLog* log) {
+  if (log->to_sync) return;
+  log->to_sync = true;
+  to_sync_.push_back(log);
+}
+
 void QueueLogs::Sync() {
   unsynced_ = false;
-  for (auto& [key, log] : logs_) {
-    if (log->journal() != nullptr) log->journal()->Sync();
+  std::vector<QueueLog*> logs;
+  logs.swap(to_sync_);
+  for (QueueLog* log : logs) {
+    log->to_sync = false;
+    // One that failed is tried again at the next.
+    if (!log->journal()->Sync()) NeedsSync(log);
   }
 }
 
@@ -220,6 +235,8 @@ void QueueLogs::Close() {
     if (log->journal() != nullptr) log->journal()->Close(log->last_seq());
   }
   written_.clear();
+  for (QueueLog* log : to_sync_) log->to_sync = false;
+  to_sync_.clear();
 }
 
 bool QueueLogs::degraded() const {

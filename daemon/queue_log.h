@@ -105,6 +105,9 @@ class QueueLog {
   int followers = 0;
   // The order of the last finding recorded (set by the reporter).
   uint64_t last_order = 0;
+  // Its journal may hold writes not synced yet: on the list of journals
+  // the next group sync syncs (kept by QueueLogs).
+  bool to_sync = false;
 
  private:
   LogRecord& Next(uint64_t order);
@@ -153,7 +156,8 @@ class QueueLogs {
   // Before records go to a client: writes them out, and syncs a journal
   // whose reserve of numbers does not cover them yet (see Journal).
   void BeforeSend();
-  // The group sync: every journal synced.
+  // The group sync: every journal written since it was last synced is
+  // synced (the others have nothing to sync).
   void Sync();
   // A rescan record for the trees of each queue whose journal is written
   // again after a failure (what was not journaled is covered); true when
@@ -189,6 +193,8 @@ class QueueLogs {
   // Keeps the last number of the log at |it| for a queue that comes back,
   // and closes its journal; the caller erases it.
   void Forget(std::map<std::string, std::unique_ptr<QueueLog>>::iterator it);
+  // Puts |log| on the list of journals the next Sync syncs, once.
+  void NeedsSync(QueueLog* log);
 
   size_t keep_;
   uint64_t order_ = 0;
@@ -200,6 +206,9 @@ class QueueLogs {
   std::function<void(QueueLog*)> recorded_;
   std::vector<QueueLog*> written_;   // logs whose journals have records to write
   std::vector<QueueLog*> degraded_;  // logs whose journals failed to write
+  // Logs whose journals were written or made since their last sync: a
+  // group sync pays for these, not for every queue.
+  std::vector<QueueLog*> to_sync_;
   bool closed_ = false;
   bool unsynced_ = false;
   std::map<std::string, std::unique_ptr<QueueLog>> logs_;  // by type, file and name

@@ -157,6 +157,7 @@ bool ListWithStatus(int dir, SnapshotListing* listing) {
 void TreeSnapshot::Put(const std::string& path, SnapshotListing listing) {
   dirs_[path] = std::move(listing);
   queued_.push_back(path);
+  NoteQueued();
 }
 
 void TreeSnapshot::Forget(const std::string& path) {
@@ -164,6 +165,7 @@ void TreeSnapshot::Forget(const std::string& path) {
     it = dirs_.erase(it);
   }
   queued_.push_back(path);
+  NoteQueued();
 }
 
 void TreeSnapshot::Encode(const std::string& path, std::string* out) const {
@@ -276,6 +278,10 @@ TreeSnapshot* Snapshot::Tree(const std::string& root, Known* known) {
   auto tree = std::make_unique<TreeSnapshot>(root);
   *known = Load(tree.get());
   if (*known != Known::kSaved) tree->dirs_.clear();
+  if (dir_.get() >= 0) {
+    tree->to_save_ = &to_save_;
+    if (tree->has_queued()) tree->NoteQueued();
+  }
   return (trees_[root] = std::move(tree)).get();
 }
 
@@ -383,14 +389,28 @@ std::vector<std::string> Snapshot::TakeDirty() {
 }
 
 void Snapshot::Save() {
-  if (dir_.get() < 0) return;
+  if (dir_.get() < 0 || to_save_.empty()) return;
+  // In the order of their roots, as the trees are kept.
+  std::vector<TreeSnapshot*> trees;
+  trees.swap(to_save_);
+  std::sort(trees.begin(), trees.end(),
+            [](const TreeSnapshot* a, const TreeSnapshot* b) { return a->root_ < b->root_; });
+  for (TreeSnapshot* tree : trees) tree->listed_ = false;
+  SaveTrees(trees);
+  // A tree whose save failed is tried again at the next.
+  for (TreeSnapshot* tree : trees) {
+    if (tree->has_queued()) tree->NoteQueued();
+  }
+}
+
+void Snapshot::SaveTrees(const std::vector<TreeSnapshot*>& trees) {
   std::vector<std::pair<TreeSnapshot*, UniqueFd>> whole;
-  for (auto& [root, tree] : trees_) {
-    if (!tree->rewrite_ && tree->queued_.empty()) continue;
+  for (TreeSnapshot* tree : trees) {
+    if (!tree->has_queued()) continue;
     if (tree->AppendQueued(dir_.get())) continue;
     tree->queued_.clear();
     UniqueFd file = tree->WriteTemporary(dir_.get());
-    if (file.get() >= 0) whole.emplace_back(tree.get(), std::move(file));
+    if (file.get() >= 0) whole.emplace_back(tree, std::move(file));
   }
   if (whole.empty()) return;
   // Each file is durable before it replaces the old one, so a crash

@@ -58,7 +58,10 @@ class TreeSnapshot {
   // Forgets |path| and every directory below it, and queues the record.
   void Forget(const std::string& path);
   // From now on the next Save writes the whole tree afresh.
-  void RewriteAll() { rewrite_ = true; }
+  void RewriteAll() {
+    rewrite_ = true;
+    NoteQueued();
+  }
 
   // Appends the queued records to the tree's file in |dir| and
   // fdatasync()s it.  False when the file must be written whole instead:
@@ -73,6 +76,15 @@ class TreeSnapshot {
   // Appends the record of |path| (its listing, or "forgotten" when it has
   // none) to |out|.
   void Encode(const std::string& path, std::string* out) const;
+  // True while the next Save has something of this tree to write.
+  bool has_queued() const { return rewrite_ || !queued_.empty(); }
+  // Puts the tree on the list of its Snapshot's trees to save, once.
+  void NoteQueued() {
+    if (to_save_ != nullptr && !listed_) {
+      listed_ = true;
+      to_save_->push_back(this);
+    }
+  }
   // Writes every listing to a new temporary file in |dir|, not synced;
   // its descriptor, or an empty one (logged, the temporary removed).
   UniqueFd WriteTemporary(int dir);
@@ -86,6 +98,10 @@ class TreeSnapshot {
   bool rewrite_ = true;              // no file of this tree written yet
   uint64_t file_bytes_ = 0;          // the size of the tree's file
   uint64_t live_bytes_ = 0;          // its records still in force (an estimate)
+  // The trees Save looks at (its Snapshot's, none when the tree is not
+  // saved), and whether this one is on that list.
+  std::vector<TreeSnapshot*>* to_save_ = nullptr;
+  bool listed_ = false;
 };
 
 // Every tree's saved view, in the directory "snapshot" of the state
@@ -109,7 +125,7 @@ class Snapshot {
   TreeSnapshot* Tree(const std::string& root, Known* known);
   // The tree |root| if loaded, else nullptr.
   TreeSnapshot* Loaded(const std::string& root);
-  // Every loaded tree, by root.
+  // Every loaded tree, by root.  A tree once loaded is never dropped.
   std::map<std::string, std::unique_ptr<TreeSnapshot>>& trees() { return trees_; }
 
   // Marks directory |path| as changed: one hash-set insertion, no system
@@ -131,10 +147,15 @@ class Snapshot {
   // Reads and checks the file of |tree| into it; kNone or kBroken when
   // there is no usable file.
   Known Load(TreeSnapshot* tree);
+  // Saves those of |trees| with something queued, as Save says.
+  void SaveTrees(const std::vector<TreeSnapshot*>& trees);
 
   UniqueFd dir_;
   std::map<std::string, std::unique_ptr<TreeSnapshot>> trees_;
   std::unordered_set<std::string> dirty_;  // directories to list again
+  // The trees with something queued or to rewrite: a save pays for the
+  // trees that changed, not for every tree loaded.
+  std::vector<TreeSnapshot*> to_save_;
 };
 
 }  // namespace zorvnotifyd

@@ -224,9 +224,9 @@ bool WatchTree::ReadEvents(EventSink& sink) {
     // A read after one that emptied the queue would only say EAGAIN: the
     // caller's poll tells when more come.
     if (pending_.empty() && (drained_ || !Fill(&failed))) break;
+    RawEvent event;
     while (!pending_.empty()) {
-      const RawEvent event = std::move(pending_.front());
-      pending_.pop_front();
+      pending_.PopFront(&event);
       if ((event.mask & IN_Q_OVERFLOW) == 0) {
         Handle(event, sink);
         continue;
@@ -698,11 +698,28 @@ void WatchTree::NoteRootMissing(const std::string& path, const std::string& why)
 
 namespace zorvnotifyd {
 
-bool WatchTree::ListWatched(const std::string& path, SnapshotListing* listing) {
+UniqueFd WatchTree::OpenThroughParent(const std::string& root, const std::string& path,
+                                      ParentDir* parent) {
+  const size_t slash = path.rfind('/');
+  // A root is opened as configured (a link to it is followed), and its
+  // parent is outside the tree.
+  if (root.empty() || path.size() <= root.size() || slash < root.size()) {
+    return OpenBelow(root, path);
+  }
+  if (parent->fd.get() < 0 || parent->path.size() != slash ||
+      path.compare(0, slash, parent->path) != 0) {
+    parent->path.assign(path, 0, slash);
+    parent->fd = OpenBelow(root, parent->path);
+  }
+  if (parent->fd.get() < 0) return UniqueFd();
+  return OpenSubdir(parent->fd.get(), path.substr(slash + 1));
+}
+
+bool WatchTree::ListWatched(const std::string& path, SnapshotListing* listing, ParentDir* parent) {
   const auto known = by_path_.find(path);
   if (known == by_path_.end()) return false;
   const Watch& watch = watches_.at(known->second);
-  const UniqueFd dir = OpenBelow(RootOf(path), path);
+  const UniqueFd dir = OpenThroughParent(RootOf(path), path, parent);
   struct stat st;
   if (dir.get() < 0 || fstat(dir.get(), &st) != 0 || st.st_dev != watch.dev ||
       st.st_ino != watch.ino) {
@@ -739,6 +756,7 @@ void WatchTree::Relist() {
   };
   std::vector<std::string> work = snapshot_->TakeDirty();
   std::string root;  // each ancestor of a path, shortest first
+  ParentDir parent;  // the parent of the directory last listed
   while (!work.empty()) {
     std::unordered_map<uint64_t, Place> left;
     std::vector<std::pair<uint64_t, Place>> came;
@@ -755,7 +773,7 @@ void WatchTree::Relist() {
           continue;
         }
         const std::unique_ptr<TreeSnapshot>& tree = found->second;
-        if (!listed && !(listed = ListWatched(path, &listing))) break;
+        if (!listed && !(listed = ListWatched(path, &listing, &parent))) break;
         auto& dirs = tree->dirs();
         const auto old = dirs.find(path);
         if (old != dirs.end()) {

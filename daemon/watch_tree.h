@@ -10,7 +10,6 @@
 #include <sys/types.h>
 
 #include <cstdint>
-#include <deque>
 #include <map>
 #include <set>
 #include <string>
@@ -172,6 +171,39 @@ class WatchTree {
     uint32_t cookie;
     std::string name;
   };
+  // The events read but not yet handled, oldest first: a vector taken
+  // from the front and emptied once all are taken, keeping the storage of
+  // one buffer's worth of events, so that reading events allocates
+  // nothing for the queue once it has grown (more, read ahead while
+  // comparing, is given back).
+  class EventQueue {
+   public:
+    bool empty() const { return next_ == events_.size(); }
+    size_t size() const { return events_.size() - next_; }
+    void push_back(RawEvent event) { events_.push_back(std::move(event)); }
+    const RawEvent& back() const { return events_.back(); }
+    std::vector<RawEvent>::const_iterator begin() const { return events_.begin() + next_; }
+    std::vector<RawEvent>::const_iterator end() const { return events_.end(); }
+    // Moves the oldest event into |event|; the queue must not be empty.
+    void PopFront(RawEvent* event) {
+      *event = std::move(events_[next_++]);
+      if (empty()) clear();
+    }
+    void clear() {
+      // The most events one 64 KiB read returns: 16 bytes each at least.
+      constexpr size_t kKept = 4096;
+      if (events_.capacity() > kKept) {
+        events_ = std::vector<RawEvent>();
+      } else {
+        events_.clear();
+      }
+      next_ = 0;
+    }
+
+   private:
+    std::vector<RawEvent> events_;
+    size_t next_ = 0;  // the oldest not taken
+  };
   // What one walk of a tree does (see Walk).
   struct WalkContext {
     std::set<int>* synced = nullptr;           // Sync: watches given their exact mask this round
@@ -221,9 +253,22 @@ class WatchTree {
   void ReadAhead();
   // Tells sink_ to rescan each of |tops| not told already.
   void NoteUnwatched(const std::vector<std::string>& tops);
-  // Lists the watched directory |path| into |listing|; false when it is
-  // not watched or is no longer the directory watched there.
-  bool ListWatched(const std::string& path, SnapshotListing* listing);
+  // The directory that ListWatched last opened as a parent, kept by its
+  // caller for one pass: the directories of one save mostly share their
+  // parents, and each is then one openat instead of a walk from its root.
+  struct ParentDir {
+    std::string path;
+    UniqueFd fd;
+  };
+  // Lists the watched directory |path| into |listing|, opening it through
+  // |parent| when that is its parent (and keeping its parent there
+  // otherwise); false when it is not watched or is no longer the directory
+  // watched there.
+  bool ListWatched(const std::string& path, SnapshotListing* listing, ParentDir* parent);
+  // Opens the directory |path| below |root| as OpenBelow does, through
+  // |parent| (see ListWatched).
+  static UniqueFd OpenThroughParent(const std::string& root, const std::string& path,
+                                    ParentDir* parent);
   // Moves the watches at and below each path of |from| to each path of
   // |to| (a rename within the trees; several paths when the directories
   // have several), then sets the kernel masks that the new place changes.
@@ -261,7 +306,7 @@ class WatchTree {
   std::map<std::pair<dev_t, ino_t>, int> by_inode_;  // watch descriptor by directory
   std::map<std::string, std::string> missing_;       // unwatched roots and why
   std::map<std::string, size_t> limited_;            // roots the watch limit kept partly unwatched
-  std::deque<RawEvent> pending_;                     // events read but not yet handled
+  EventQueue pending_;                               // events read but not yet handled
   bool drained_ = false;                             // the last read left the kernel's queue empty
   std::set<uint32_t> moves_;  // cookies of directory moves within the trees, already done
   std::string entry_path_;    // Handle's buffer for the path of an event's entry
