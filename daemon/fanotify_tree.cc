@@ -606,8 +606,8 @@ void FanotifyTree::Handle(uint32_t mask, const Fid* dir, const Fid* old_dir, con
 bool FanotifyTree::Read(EventSink& sink, bool* empty) {
   alignas(struct fanotify_event_metadata) char buffer[64 * 1024];
   bool failed = false;
-  *empty = false;
-  for (int reads = 0; reads < kReadsPerRound && !failed; ++reads) {
+  *empty = fd() < 0;  // never opened (no fanotify here): nothing to read
+  for (int reads = 0; !*empty && reads < kReadsPerRound && !failed; ++reads) {
     ssize_t n;
     do {
       n = read(fd(), buffer, sizeof(buffer));
