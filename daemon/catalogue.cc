@@ -82,8 +82,8 @@ Catalogue CatalogueLoader::Load() {
         continue;
       }
       std::vector<MonitorQueue> queues;
+      bool has_good = true;  // loaded now, or loaded before
       if (MonitorQueue::List(queues, file, type)) {
-        good[key] = queues;
         if (failing_.count(key) != 0) {
           syslog(LOG_NOTICE, "queue file %s loads again: %zu queues", label.c_str(), queues.size());
         }
@@ -91,10 +91,8 @@ Catalogue CatalogueLoader::Load() {
         const std::string why = zorvcommon::WhyUnloadable(dir + "/" + file);
         const auto last = last_good_.find(key);
         queues.clear();
-        if (last != last_good_.end()) {
-          queues = last->second;
-          good[key] = queues;
-        }
+        if (last != last_good_.end()) queues = last->second;
+        has_good = last != last_good_.end();
         const auto known = failing_.find(key);
         if (known == failing_.end() || known->second != why) {
           syslog(LOG_ERR, "queue file %s cannot be loaded: %s; %s", label.c_str(), why.c_str(),
@@ -105,7 +103,9 @@ Catalogue CatalogueLoader::Load() {
         }
         failing[key] = why;
       }
+      // One copy for the catalogue; the loaded queues themselves are kept.
       for (const MonitorQueue& queue : queues) catalogue.push_back({type, file, queue});
+      if (has_good) good[key] = std::move(queues);
     }
   }
   last_good_ = std::move(good);
@@ -119,7 +119,8 @@ std::vector<std::string> CatalogueLoader::Honour(Catalogue* catalogue) {
   std::set<std::string> skipped;
   for (CatalogueQueue& entry : *catalogue) {
     std::vector<MonitorQueue::MonitorQueueConfig> honoured;
-    for (const auto& config : entry.queue._configs) {
+    honoured.reserve(entry.queue._configs.size());
+    for (auto& config : entry.queue._configs) {
       std::string why = zorvcommon::WatchPathProblem(config._path);
       if (why.empty() && (config._mask & kDeliverable) == 0) {
         char mask[16];
@@ -131,7 +132,7 @@ std::vector<std::string> CatalogueLoader::Honour(Catalogue* catalogue) {
       }
       if (why.empty()) {
         roots.push_back(config._path);
-        honoured.push_back(config);
+        honoured.push_back(std::move(config));  // the old list is dropped below
         continue;
       }
       const std::string line = "skipping configuration " + Quoted(config._path) + " of queue " +

@@ -12,7 +12,8 @@ int LOG_LEVEL = 3;
 MonitorQueue::MonitorQueue(const Json::Value& value) {
   if (!value.isObject()) return;
   _name = value.get("queue", "").asString();
-  const Json::Value configs = value.get("config", Json::Value(Json::arrayValue));
+  // Read in place: a copy of the array would duplicate every configuration.
+  const Json::Value& configs = value["config"];  // null when missing
   if (!configs.isArray()) return;
   _configs.reserve(configs.size());
   for (Json::Value::ArrayIndex i = 0; i < configs.size(); ++i) {

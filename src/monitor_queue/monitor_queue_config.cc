@@ -21,7 +21,7 @@ void ReleaseRegexes(std::vector<regex_t>& regexes) {
 MonitorQueue::MonitorQueueConfig::MonitorQueueConfig(const Json::Value& value)
     : _mask(0), _prepared(false) {
   if (!value.isObject()) return;
-  const Json::Value ignore = value.get("ignore", Json::Value(Json::arrayValue));
+  const Json::Value& ignore = value["ignore"];  // null when missing, read in place
   _path = value.get("path", "").asString();
   _mask = value.get("mask", 0).asUInt();
   if (ignore.isArray()) {

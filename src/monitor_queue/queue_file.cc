@@ -51,9 +51,9 @@ bool MonitorQueue::LoadFromFile(std::vector<MonitorQueue>& queues, const std::st
   if (ZORBCFileExist(path.c_str()) == 1 && !platform::JsonFromFile(root, path)) return false;
   if (!root.isArray()) return false;
   try {
-    for (Json::Value::ArrayIndex i = 0; i < root.size(); ++i) {
-      queues.push_back(MonitorQueue(root[i]));
-    }
+    // Made in place, in room reserved: a MonitorQueue is copied, not moved.
+    queues.reserve(queues.size() + root.size());
+    for (Json::Value::ArrayIndex i = 0; i < root.size(); ++i) queues.emplace_back(root[i]);
   } catch (const std::exception&) {
     return false;  // the queues of the elements before the faulty one stay
   }
