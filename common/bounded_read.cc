@@ -2,6 +2,8 @@
 
 #include "bounded_read.h"
 
+#include <unistd.h>
+
 #include <algorithm>
 #include <cerrno>
 

@@ -2,8 +2,6 @@
 #ifndef ZORVNOTIFYD_COMMON_BOUNDED_READ_H_
 #define ZORVNOTIFYD_COMMON_BOUNDED_READ_H_
 
-#include <unistd.h>
-
 #include <cstddef>
 #include <string>
 
@@ -12,22 +10,6 @@ namespace zorvcommon {
 // The most a queue file holds, in bytes (16 MiB): the library neither reads
 // nor writes a larger one, and the tool reads its own input within it.
 inline constexpr size_t kMaxQueueFileSize = size_t{16} << 20;
-
-// Owns the descriptor |fd| (negative: none) and closes it when destroyed.
-class ScopedFd {
- public:
-  explicit ScopedFd(int fd) : fd_(fd) {}
-  ScopedFd(const ScopedFd&) = delete;
-  ScopedFd& operator=(const ScopedFd&) = delete;
-  ~ScopedFd() {
-    if (fd_ >= 0) close(fd_);
-  }
-  // The descriptor, still owned.
-  int get() const { return fd_; }
-
- private:
-  const int fd_;
-};
 
 // How ReadAtMost ended.
 enum class BoundedRead { kWhole, kTooLarge, kError };

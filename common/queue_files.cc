@@ -18,6 +18,7 @@
 
 #include "bounded_read.h"
 #include "text.h"
+#include "unique_fd.h"
 
 namespace zorvcommon {
 namespace {
@@ -74,7 +75,7 @@ bool LooksLikeBackupCopy(const std::string& file) {
 }
 
 std::string WhyUnloadable(const std::string& path) {
-  const ScopedFd fd(open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
+  const UniqueFd fd(open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK));
   struct stat st;
   if (fd.get() < 0 || fstat(fd.get(), &st) != 0) return strerror(errno);
   if (!S_ISREG(st.st_mode)) return "not a regular file";

@@ -16,6 +16,8 @@
 
 namespace zorvnotifyd {
 
+using zorvcommon::UniqueFd;
+
 using zorvcommon::QueueType;
 
 // One queue and where it is stored.

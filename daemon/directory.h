@@ -10,6 +10,8 @@
 
 namespace zorvnotifyd {
 
+using zorvcommon::UniqueFd;
+
 // Opens the directory |path| for reading and for openat(), following
 // symbolic links (the path of a configured tree, which root chose).
 // Never blocks on a special file.  Empty (errno set) on failure.

@@ -27,6 +27,8 @@
 
 namespace zorvnotifyd {
 
+using zorvcommon::UniqueFd;
+
 // Whether a fanotify mark could serve the open directory |dir|: its file
 // system gives file handles and a non-zero file-system id.  False with
 // |why| (a phrase for the log) when it does not.

@@ -22,6 +22,8 @@
 
 namespace zorvnotifyd {
 
+using zorvcommon::UniqueFd;
+
 // The id of the running boot: the kernel's boot_id, or, where /proc/sys is
 // hidden (the unit's ProcSubset=pid), "t:" and the boot time in seconds.
 std::string BootId();

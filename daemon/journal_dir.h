@@ -13,6 +13,8 @@
 
 namespace zorvnotifyd {
 
+using zorvcommon::UniqueFd;
+
 // 32 random hexadecimal digits.
 std::string RandomId();
 

@@ -11,6 +11,8 @@
 
 namespace zorvnotifyd {
 
+using zorvcommon::UniqueFd;
+
 bool NotifyServiceManager(const std::string& state) {
   const char* name = getenv("NOTIFY_SOCKET");
   if (name == nullptr || name[0] == '\0') return false;

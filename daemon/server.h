@@ -20,6 +20,8 @@
 
 namespace zorvnotifyd {
 
+using zorvcommon::UniqueFd;
+
 // The socket when none is named; its directory is made when missing.
 constexpr char kDefaultSocketPath[] = "/run/zorvnotifyd/zorvnotifyd.sock";
 

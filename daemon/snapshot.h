@@ -17,6 +17,8 @@
 
 namespace zorvnotifyd {
 
+using zorvcommon::UniqueFd;
+
 // One entry of a directory as last seen.
 struct SnapshotEntry {
   std::string name;

@@ -11,6 +11,8 @@
 
 namespace zorvnotifyd {
 
+using zorvcommon::UniqueFd;
+
 // The state directory when none is named.
 constexpr char kDefaultStateDir[] = "/var/lib/zorvnotifyd";
 

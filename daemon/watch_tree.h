@@ -23,6 +23,8 @@
 
 namespace zorvnotifyd {
 
+using zorvcommon::UniqueFd;
+
 class OfflineChanges;
 
 // Opens an inotify instance, non-blocking and close-on-exec.  On failure

@@ -17,6 +17,8 @@
 
 namespace zorvnotifyd {
 
+using zorvcommon::UniqueFd;
+
 // What --backend asks for.
 enum class Backend { kAuto, kInotify, kFanotify };
 

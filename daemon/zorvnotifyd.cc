@@ -39,6 +39,8 @@
 #include "watchers.h"
 
 namespace zorvnotifyd {
+
+using zorvcommon::UniqueFd;
 namespace {
 
 const char kUsage[] =

@@ -34,6 +34,7 @@
 #include "queue_files.h"
 #include "queue_object.h"
 #include "table.h"
+#include "unique_fd.h"
 
 namespace zorvnotifyctl {
 namespace {
@@ -194,7 +195,7 @@ bool StoreWithRetry(const Invocation& invocation, const std::function<bool()>& s
 bool ReadSource(const std::string& source, std::string* text, std::string* error) {
   const bool stdin_source = source == "-";
   const std::string name = stdin_source ? "standard input" : zorvcommon::Printable(source);
-  const zorvcommon::ScopedFd opened(stdin_source ? -1 : open(source.c_str(), O_RDONLY | O_CLOEXEC));
+  const zorvcommon::UniqueFd opened(stdin_source ? -1 : open(source.c_str(), O_RDONLY | O_CLOEXEC));
   const int fd = stdin_source ? STDIN_FILENO : opened.get();
   struct stat st;
   if (fd < 0 || fstat(fd, &st) != 0) {

@@ -1,12 +1,13 @@
-// A file descriptor owned by exactly one object and closed with it.
-#ifndef ZORVNOTIFYD_EXAMPLES_DAEMON_UNIQUE_FD_H_
-#define ZORVNOTIFYD_EXAMPLES_DAEMON_UNIQUE_FD_H_
+// A file descriptor owned by exactly one object and closed with it: the
+// one scoped descriptor of the tool and the daemon.
+#ifndef ZORVNOTIFYD_COMMON_UNIQUE_FD_H_
+#define ZORVNOTIFYD_COMMON_UNIQUE_FD_H_
 
 #include <unistd.h>
 
 #include <utility>
 
-namespace zorvnotifyd {
+namespace zorvcommon {
 
 // Owns |fd| (negative: nothing) and closes it when destroyed or replaced.
 // Move-only.
@@ -37,6 +38,6 @@ class UniqueFd {
   int fd_;
 };
 
-}  // namespace zorvnotifyd
+}  // namespace zorvcommon
 
-#endif  // ZORVNOTIFYD_EXAMPLES_DAEMON_UNIQUE_FD_H_
+#endif  // ZORVNOTIFYD_COMMON_UNIQUE_FD_H_
