@@ -1304,7 +1304,13 @@ TEST_F(DaemonTest, ServesWholeFileSystemsWithFanotify) {
   if (max_file >> max_queued && max_queued <= 100000) {
     ASSERT_EQ(mkdir("/tmp/all/t/many", 0755), 0);
     ASSERT_EQ(kill(daemon->pid(), SIGSTOP), 0);
-    for (int i = 0; i <= max_queued; ++i) {
+    // Stopped for sure (the signal takes effect later), and a margin over
+    // the queue's size: it reads nothing while they are made.
+    const std::string stat = "/proc/" + std::to_string(daemon->pid()) + "/stat";
+    for (std::string state; state.find(") T ") == std::string::npos;) {
+      std::getline(std::ifstream(stat), state);
+    }
+    for (int i = 0; i <= 2 * max_queued; ++i) {
       close(open(("/tmp/all/t/many/" + std::to_string(i)).c_str(), O_CREAT | O_WRONLY, 0644));
     }
     ASSERT_EQ(kill(daemon->pid(), SIGCONT), 0);
