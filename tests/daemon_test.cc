@@ -90,19 +90,26 @@ class Daemon : public zorv_test::ChildProcess {
     return std::filesystem::read_symlink("/proc/" + std::to_string(pid()) + "/cwd") ==
            std::filesystem::current_path();
   }
-  // Reads JSON lines, each as "queue path mask" ("queue lost" for a lost
-  // notice, "queue rescan PATH" for a rescan record), until one equal to |last|; every line read,
-  // |last| included. Stops early (the result then lacks |last|) on a timeout.
+  // Reads JSON lines until one equal to |last|, each report as "queue type
+  // file path mask" with its exact set of fields checked, "offline" aside ("queue lost" for a
+  // lost notice, "queue rescan PATH" for a rescan record, a line that is not
+  // a JSON object as it is); every line read, |last| included.  Stops early
+  // (the result then lacks |last|) on a timeout.
   Lines ReadUntil(const std::string& last) {
     Lines lines;
     for (std::string text; (lines.empty() || lines.back() != last) && !(text = Read()).empty();) {
-      const Json::Value v = ParseJson(text);
-      lines.push_back(!v.isObject()        ? text
-                      : v.isMember("lost") ? v["queue"].asString() + " lost"
-                      : v.isMember("rescan")
-                          ? v["queue"].asString() + " rescan " + v["rescan"].asString()
-                          : v["queue"].asString() + " " + v["path"].asString() + " " +
-                                std::to_string(v["mask"].asUInt()));
+      Json::Value v = ParseJson(text);
+      const std::string q = v.isObject() ? v["queue"].asString() : "";
+      if (v.isObject()) v.removeMember("offline");  // what a tree held when it came back
+      if (!v.isObject() || v.isMember("lost") || v.isMember("rescan")) {
+        lines.push_back(q.empty()              ? text
+                        : v.isMember("rescan") ? q + " rescan " + v["rescan"].asString()
+                                               : q + " lost");
+        continue;
+      }
+      EXPECT_EQ(v.getMemberNames(), Lines({"file", "mask", "path", "queue", "type"})) << text;
+      lines.push_back(q + " " + v["type"].asString() + " " + v["file"].asString() + " " +
+                      v["path"].asString() + " " + std::to_string(v["mask"].asUInt()));
     }
     return lines;
   }
@@ -111,22 +118,8 @@ class Daemon : public zorv_test::ChildProcess {
     const Lines lines = ReadUntil(line);
     return !lines.empty() && lines.back() == line;
   }
-  // Reads as many reports as |expected| holds, each as "queue type file
-  // path mask" (a line that is not a JSON object as it is), and compares.
-  void Expect(const Lines& expected) {
-    Lines got;
-    for (size_t i = 0; i < expected.size(); ++i) {
-      const std::string text = Read();
-      const Json::Value v = ParseJson(text);
-      got.push_back(text);
-      if (!v.isObject()) continue;
-      EXPECT_EQ(v.getMemberNames(), Lines({"file", "mask", "path", "queue", "type"})) << text;
-      EXPECT_TRUE(v["mask"].isUInt()) << text;
-      got.back() = v["queue"].asString() + " " + v["type"].asString() + " " + v["file"].asString() +
-                   " " + v["path"].asString() + " " + std::to_string(v["mask"].asUInt());
-    }
-    EXPECT_EQ(got, expected);
-  }
+  // Reads lines as ReadUntil does up to the last of |expected|, and compares.
+  void Expect(const Lines& expected) { EXPECT_EQ(ReadUntil(expected.back()), expected); }
 
  private:
   bool started_ = false;  // a line other than a rescan record came
@@ -186,10 +179,6 @@ class NotifySocket {
   int fd_;
 };
 
-void MakeDirs(const Lines& dirs) {
-  for (const std::string& dir : dirs) ASSERT_EQ(mkdir(dir.c_str(), 0755), 0) << dir;
-}
-
 class DaemonTest : public ::testing::Test {
  protected:
   void SetUp() override {
@@ -201,9 +190,9 @@ class DaemonTest : public ::testing::Test {
 // Files are written with std::ofstream: IN_CREATE, then IN_MODIFY when the
 // stream is flushed at its end, then IN_CLOSE_WRITE.
 TEST_F(DaemonTest, ReportsToEachQueueExactlyItsEventsAndFollowsTheCatalogue) {
-  ASSERT_EQ(std::system("rm -rf /tmp/w /tmp/w2 /tmp/d"), 0);
-  MakeDirs({"/tmp/w", "/tmp/w/b", "/tmp/w2", "/tmp/d", "/tmp/d/inner"});
-  for (const char* path : {"/tmp/d/f", "/tmp/d/inner/g"}) Put(path, "x");
+  ASSERT_EQ(std::system("rm -rf /tmp/w /tmp/w2 /tmp/d && mkdir -p /tmp/w/b /tmp/w2 /tmp/d/inner && "
+                        "echo x >/tmp/d/f && echo x >/tmp/d/inner/g"),
+            0);
   Register("a", "/tmp/w", kCreate | kModify | kDelete, "\\.tmp$", "fa");
   Register("b", "/tmp/w/b", IN_CLOSE_WRITE | kDelete, nullptr, "fb", MONITOR_QUEUE_TYPE_SHARE_DIR);
   // The service manager hears of readiness, reloads and the stop.
@@ -292,13 +281,16 @@ TEST_F(DaemonTest, ReportsToEachQueueExactlyItsEventsAndFollowsTheCatalogue) {
 }
 
 // Symbolic links and bind mounts to a watched directory, paths the watcher
-// cannot honour, links inside a tree, forged lines, and directory moves.
+// cannot honour, links inside a tree, forged lines, and directory moves.  The
+// daemon sees a read-only /usr holding only the etc configuration directory:
+// it serves the queues that exist and says which directories it cannot
+// have, and which file looks like a backup; a directory made later (here,
+// where /usr is writable) is read at the next tick.
 TEST_F(DaemonTest, ServesEveryPathOfADirectoryAndNothingItCannotHonour) {
   ASSERT_EQ(std::system("umount /tmp/bind 2>/dev/null; rm -rf /tmp/w /tmp/bind /tmp/link "
-                        "/tmp/secret /tmp/d"),
+                        "/tmp/secret /tmp/d && mkdir /tmp/w /tmp/bind /tmp/secret /tmp/d && "
+                        "echo x >/tmp/d/g"),
             0);
-  MakeDirs({"/tmp/w", "/tmp/bind", "/tmp/secret", "/tmp/d"});
-  ASSERT_TRUE(Put("/tmp/d/g", "x"));
   ASSERT_EQ(symlink("/tmp/w", "/tmp/link"), 0);
   ASSERT_EQ(symlink("/tmp/secret", "/tmp/w/lnk"), 0);
   ASSERT_EQ(mount("/tmp/w", "/tmp/bind", nullptr, MS_BIND, nullptr), 0);
@@ -308,9 +300,13 @@ TEST_F(DaemonTest, ServesEveryPathOfADirectoryAndNothingItCannotHonour) {
   // test goes through; one path shows that the daemon skips on it.
   Register("slash", "/tmp/w/", mask);
   Register("unmount", "/tmp/w", IN_UNMOUNT);
-  Daemon daemon({"--stdout"});
+  ASSERT_TRUE(Put("/usr/zorv/etc/zorvnotifyd/f.bak", "[]"));
+  Daemon daemon({"--stdout", "--retry", "0.1"}, zorv_test::PrivateReadOnlyUsr);
   for (const char* line :
-       {"skipping configuration \"/tmp/w/\" of queue \"slash\" (etc/f): it ends in \"/\", which no "
+       {"the configuration directory /usr/zorv/share/zorvnotifyd is missing",
+        "queue file etc/f.bak looks like a backup copy, and is loaded like any queue file: remove "
+        "it or move it out of the directory",
+        "skipping configuration \"/tmp/w/\" of queue \"slash\" (etc/f): it ends in \"/\", which no "
         "reported path can match; write it as \"/tmp/w\"",
         "skipping configuration \"/tmp/w\" of queue \"unmount\" (etc/f): its mask 0x2000 holds no "
         "event kind",
@@ -346,20 +342,65 @@ TEST_F(DaemonTest, ServesEveryPathOfADirectoryAndNothingItCannotHonour) {
   ASSERT_EQ(chmod("/tmp/w/e", 0700), 0);
   expect({"IN_MOVED_FROM|IN_ISDIR /d", "IN_MOVED_TO|IN_ISDIR /e", "IN_CREATE /e/h",
           "IN_ATTRIB|IN_ISDIR /e"});
+  // Under one path, queues in catalogue order: share before etc.
+  Register("late", "/tmp/w", IN_CREATE, nullptr, "g", MONITOR_QUEUE_TYPE_SHARE_DIR);
+  ASSERT_TRUE(daemon.Logged("catalogue reloaded: watching 2 directories for 6 queues"));
+  ASSERT_TRUE(Put("/tmp/w/y", "y"));
+  EXPECT_EQ(
+      Lines({daemon.Read(), daemon.Read(), daemon.Read(), daemon.Read()}),
+      Lines({"queue bind [etc/f]: IN_CREATE /tmp/bind/y",
+             "queue link [etc/f]: IN_CREATE /tmp/link/y",
+             "queue late [share/g]: IN_CREATE /tmp/w/y", "queue w [etc/f]: IN_CREATE /tmp/w/y"}));
   EXPECT_EQ(daemon.Stop(SIGTERM), 0);
   EXPECT_EQ(daemon.Read(), "") << "a line after the last expected one";
   umount2("/tmp/bind", MNT_DETACH);
 }
 
-// Every file written at once in a directory made by mkdir -p, several
+// A tree missing at start, deleted and made again, moved away and back,
+// and a file system mounted on it and unmounted: each is watched again
+// without a reload, and what it holds when it appears is reported.  Then
+// every file written at once in a directory made by mkdir -p, several
 // levels deep, reaches both a queue that wants IN_CREATE and one that wants
 // only IN_CLOSE_WRITE, with both cores busy.
-TEST_F(DaemonTest, HearsOfEveryFileInNewDirectories) {
-  ASSERT_EQ(std::system("rm -rf /tmp/t && mkdir /tmp/t"), 0);
+TEST_F(DaemonTest, WatchesTreesAgainAndHearsOfEveryFileInNewDirectories) {
+  ASSERT_EQ(std::system("umount /tmp/r 2>/dev/null; rm -rf /tmp/r /tmp/r.old /tmp/late /tmp/t && "
+                        "mkdir /tmp/r /tmp/t"),
+            0);
+  Register("r", "/tmp/r", kCreate);
+  Register("late", "/tmp/late", kCreate);
   Register("create", "/tmp/t", IN_CREATE);
   Register("close", "/tmp/t", IN_CLOSE_WRITE);
-  Daemon daemon;
-  ASSERT_TRUE(daemon.Logged("ready: watching 1 directories"));
+  Daemon daemon({"--json", "--retry", "0.05"});
+  ASSERT_TRUE(
+      daemon.Logged("not watching tree \"/tmp/late\": No such file or directory; looking "
+                    "for it again every 0.05 s"));
+  ASSERT_EQ(std::system("mkdir /tmp/late && echo x >/tmp/late/a"), 0);
+  EXPECT_TRUE(daemon.Heard("late etc f /tmp/late/a 256"));
+  ASSERT_EQ(std::system("rm -r /tmp/r && mkdir /tmp/r && echo x > /tmp/r/b"), 0);
+  EXPECT_TRUE(daemon.Logged("not watching tree \"/tmp/r\": it was deleted;"));
+  EXPECT_TRUE(daemon.Heard("r etc f /tmp/r/b 256"));
+
+  // Nothing done to the tree while it is away reaches the queue under its
+  // path; what it holds when it is back does.
+  ASSERT_EQ(rename("/tmp/r", "/tmp/r.old"), 0);
+  EXPECT_TRUE(daemon.Logged("not watching tree \"/tmp/r\": it was moved away;"));
+  ASSERT_TRUE(Put("/tmp/r.old/x", "x") && Put("/tmp/late/marker", "x"));
+  EXPECT_EQ(daemon.ReadUntil("late etc f /tmp/late/marker 256"),
+            Lines({"late etc f /tmp/late/marker 256"}));
+  ASSERT_EQ(rename("/tmp/r.old", "/tmp/r"), 0);
+  EXPECT_TRUE(daemon.Logged("watching tree \"/tmp/r\" again"));
+  EXPECT_TRUE(daemon.Heard("r etc f /tmp/r/x 256"));
+
+  ASSERT_EQ(mount("zorv-test", "/tmp/r", "tmpfs", 0, "mode=0755"), 0);
+  EXPECT_TRUE(daemon.Logged("tree \"/tmp/r\" is another directory now"));
+  ASSERT_TRUE(Put("/tmp/r/m", "x"));
+  EXPECT_TRUE(daemon.Heard("r etc f /tmp/r/m 256"));
+  ASSERT_EQ(umount("/tmp/r"), 0);
+  EXPECT_TRUE(daemon.Logged("not watching tree \"/tmp/r\": it was unmounted;"));
+  EXPECT_TRUE(daemon.Logged("watching tree \"/tmp/r\" again"));
+  ASSERT_TRUE(Put("/tmp/r/u", "x"));
+  EXPECT_TRUE(daemon.Heard("r etc f /tmp/r/u 256"));
+
   constexpr int kFiles = 2000;
   {
     const Lines spin = {"/bin/sh", "-c", "while :; do :; done"};
@@ -372,58 +413,16 @@ TEST_F(DaemonTest, HearsOfEveryFileInNewDirectories) {
   }
   ASSERT_TRUE(Put("/tmp/t/end", "x"));
   std::map<std::string, std::set<std::string>> heard;
-  for (const std::string& line : daemon.ReadUntil("close /tmp/t/end 8")) {
-    const size_t space = line.find(' ');
-    const std::string queue = line.substr(0, space);
+  for (const std::string& line : daemon.ReadUntil("close etc f /tmp/t/end 8")) {
+    const std::string queue = line.substr(0, line.find(' '));
     const unsigned mask = std::stoul(line.substr(line.rfind(' ') + 1));
     if (line.find("/file ") != std::string::npos &&
         (mask & (queue == "close" ? IN_CLOSE_WRITE : IN_CREATE)) != 0) {
-      heard[queue].insert(line.substr(space + 1, line.rfind(' ') - space - 1));
+      heard[queue].insert(line.substr(0, line.rfind(' ')));
     }
   }
   EXPECT_EQ(heard["create"].size(), size_t(kFiles));
   EXPECT_EQ(heard["close"].size(), size_t(kFiles));
-}
-
-// A tree missing at start, deleted and made again, moved away and back,
-// and a file system mounted on it and unmounted: each is watched again
-// without a reload, and what it holds when it appears is reported.
-TEST_F(DaemonTest, WatchesTreesAgainThatWentAwayOrAppearedLater) {
-  ASSERT_EQ(std::system("umount /tmp/r 2>/dev/null; rm -rf /tmp/r /tmp/r.old /tmp/late"), 0);
-  MakeDirs({"/tmp/r"});
-  Register("r", "/tmp/r", kCreate);
-  Register("late", "/tmp/late", kCreate);
-  Daemon daemon({"--json", "--retry", "0.05"});
-  ASSERT_TRUE(
-      daemon.Logged("not watching tree \"/tmp/late\": No such file or directory; looking "
-                    "for it again every 0.05 s"));
-  MakeDirs({"/tmp/late"});
-  ASSERT_TRUE(Put("/tmp/late/a", "x"));
-  EXPECT_TRUE(daemon.Heard("late /tmp/late/a 256"));
-
-  ASSERT_EQ(std::system("rm -r /tmp/r && mkdir /tmp/r && echo x > /tmp/r/b"), 0);
-  EXPECT_TRUE(daemon.Logged("not watching tree \"/tmp/r\": it was deleted;"));
-  EXPECT_TRUE(daemon.Heard("r /tmp/r/b 256"));
-
-  // Nothing done to the tree while it is away reaches the queue under its
-  // path; what it holds when it is back does.
-  ASSERT_EQ(rename("/tmp/r", "/tmp/r.old"), 0);
-  EXPECT_TRUE(daemon.Logged("not watching tree \"/tmp/r\": it was moved away;"));
-  ASSERT_TRUE(Put("/tmp/r.old/x", "x") && Put("/tmp/late/marker", "x"));
-  EXPECT_EQ(daemon.ReadUntil("late /tmp/late/marker 256"), Lines({"late /tmp/late/marker 256"}));
-  ASSERT_EQ(rename("/tmp/r.old", "/tmp/r"), 0);
-  EXPECT_TRUE(daemon.Logged("watching tree \"/tmp/r\" again"));
-  EXPECT_TRUE(daemon.Heard("r /tmp/r/x 256"));
-
-  ASSERT_EQ(mount("zorv-test", "/tmp/r", "tmpfs", 0, "mode=0755"), 0);
-  EXPECT_TRUE(daemon.Logged("tree \"/tmp/r\" is another directory now"));
-  ASSERT_TRUE(Put("/tmp/r/m", "x"));
-  EXPECT_TRUE(daemon.Heard("r /tmp/r/m 256"));
-  ASSERT_EQ(umount("/tmp/r"), 0);
-  EXPECT_TRUE(daemon.Logged("not watching tree \"/tmp/r\": it was unmounted;"));
-  EXPECT_TRUE(daemon.Logged("watching tree \"/tmp/r\" again"));
-  ASSERT_TRUE(Put("/tmp/r/u", "x"));
-  EXPECT_TRUE(daemon.Heard("r /tmp/r/u 256"));
   EXPECT_EQ(daemon.Stop(SIGTERM), 0);
 }
 
@@ -453,7 +452,7 @@ TEST_F(DaemonTest, ServesWhatFitsUnderTheWatchLimitAndSaysWhenEventsWereLost) {
                     "again every 0.05 s"));
   ASSERT_TRUE(daemon.Logged("ready: watching 7 directories for 1 queues"));
   ASSERT_TRUE(Put("/tmp/big/f", "x"));
-  EXPECT_EQ(daemon.ReadUntil("big /tmp/big/f 256"), Lines({"big /tmp/big/f 256"}));
+  EXPECT_EQ(daemon.ReadUntil("big etc f /tmp/big/f 256"), Lines({"big etc f /tmp/big/f 256"}));
 
   // The watch limit of the daemon's user namespace, set from a process there.
   const std::string ns = "/proc/" + std::to_string(daemon.pid()) + "/ns/user";
@@ -466,11 +465,11 @@ TEST_F(DaemonTest, ServesWhatFitsUnderTheWatchLimitAndSaysWhenEventsWereLost) {
   ASSERT_EQ(std::system("cd /tmp/big && for d in 0/1/2 3/4/5/6 7/8/9 10 11 12/13; do "
                         "touch $d/g; done"),
             0);
-  EXPECT_EQ(
-      daemon.ReadUntil("big /tmp/big/12/13/g 256"),
-      Lines({"big rescan /tmp/big/12/13", "big rescan /tmp/big/3", "big rescan /tmp/big/7",
-             "big /tmp/big/0/1/2/g 256", "big /tmp/big/3/4/5/6/g 256", "big /tmp/big/7/8/9/g 256",
-             "big /tmp/big/10/g 256", "big /tmp/big/11/g 256", "big /tmp/big/12/13/g 256"}));
+  EXPECT_EQ(daemon.ReadUntil("big etc f /tmp/big/12/13/g 256"),
+            Lines({"big rescan /tmp/big/12/13", "big rescan /tmp/big/3", "big rescan /tmp/big/7",
+                   "big etc f /tmp/big/0/1/2/g 256", "big etc f /tmp/big/3/4/5/6/g 256",
+                   "big etc f /tmp/big/7/8/9/g 256", "big etc f /tmp/big/10/g 256",
+                   "big etc f /tmp/big/11/g 256", "big etc f /tmp/big/12/13/g 256"}));
 
   // More events than the kernel queues while the daemon is stopped.
   std::ifstream max_file("/proc/sys/fs/inotify/max_queued_events");
@@ -485,7 +484,7 @@ TEST_F(DaemonTest, ServesWhatFitsUnderTheWatchLimitAndSaysWhenEventsWereLost) {
   EXPECT_TRUE(daemon.Heard("big rescan /tmp/big"));
   EXPECT_TRUE(daemon.Logged("inotify event queue overflowed, events were lost"));
   ASSERT_TRUE(Put("/tmp/big/10/after", "x"));
-  EXPECT_TRUE(daemon.Heard("big /tmp/big/10/after 256"));
+  EXPECT_TRUE(daemon.Heard("big etc f /tmp/big/10/after 256"));
   EXPECT_EQ(daemon.Stop(SIGTERM), 0);
 }
 
@@ -549,14 +548,16 @@ Json::Value Subscribe(Client& client, const std::string& queue, long since = -1)
 }
 
 // Clients on two queues, one that never reads, one that comes back, one
-// that may not connect, and a queue that goes and comes back.
+// that may not connect, and a queue that goes and comes back; the socket
+// file removed or replaced while the daemon runs.
 TEST_F(DaemonTest, DeliversEachQueueItsEventsToItsSubscribers) {
   ASSERT_EQ(std::system("rm -rf /tmp/s && mkdir -p /tmp/s/a /tmp/s/b"), 0);
   Register("a", "/tmp/s/a", kCreate);
   Register("b", "/tmp/s/b", kCreate);
   // Each event read as it comes (the other tests wait the default window).
-  Daemon daemon(
-      {"--keep", "5", "--client-buffer", "1024", "--journal-size", "65536", "--coalesce", "0"});
+  Daemon daemon({"--keep", "5", "--client-buffer", "1024", "--journal-size", "65536", "--coalesce",
+                 "0", "--retry", "0.05"});
+  EXPECT_TRUE(daemon.Logged("made the state directory \"/var/lib/zorvnotifyd\""));
   ASSERT_TRUE(daemon.Logged("ready: watching 2 directories for 2 queues"));
   Client b, sleeper;
   Client* a = new Client;
@@ -590,11 +591,14 @@ TEST_F(DaemonTest, DeliversEachQueueItsEventsToItsSubscribers) {
 
   // Back with "since": the 5 records before those in memory from the
   // journal, then those in memory.
+  const auto resume = [&name](Client& client) {
+    Subscribe(client, "a", kFiles - 10);
+    for (int seq = kFiles - 9; seq <= kFiles + 1; ++seq) {
+      EXPECT_EQ(client.Line(), "a " + std::to_string(seq) + " " + name + std::to_string(seq - 1));
+    }
+  };
   Client again;
-  Subscribe(again, "a", kFiles - 10);
-  for (int seq = kFiles - 9; seq <= kFiles + 1; ++seq) {
-    EXPECT_EQ(again.Line(), "a " + std::to_string(seq) + " " + name + std::to_string(seq - 1));
-  }
+  resume(again);
 
   // A queue removed and registered again, on the same connection.
   ASSERT_TRUE(MonitorQueue::Delete("b", "f", MONITOR_QUEUE_TYPE_ETC_DIR));
@@ -626,34 +630,60 @@ TEST_F(DaemonTest, DeliversEachQueueItsEventsToItsSubscribers) {
   const Json::Value v = status.Next();
   EXPECT_EQ(std::vector<Json::Value>({v["queues"], v["clients"], v["directories"]}),
             std::vector<Json::Value>({2, 4, 2}));
-  EXPECT_EQ(daemon.Stop(SIGTERM), 0);
 
-  // Started again, with nothing in memory: the same records from the
-  // journal's files, which took turns many times, then new ones.
+  // The socket file removed: a new one, which new clients reach, and the
+  // old clients are still served.
+  const std::string replaced =
+      "the socket file \"/tmp/zorvrun/zorvnotifyd.sock\" was removed or replaced";
+  ASSERT_EQ(unlink(kSocket), 0);
+  ASSERT_TRUE(daemon.Logged(replaced + ": listening on a new one"));
+  Client after;
+  Subscribe(after, "b");
+  ASSERT_TRUE(Put("/tmp/s/b/z", "x"));
+  EXPECT_EQ(b.Line(), "b 7 /tmp/s/b/z");
+  EXPECT_EQ(after.Line(), "b 7 /tmp/s/b/z");
+  // Another daemon's live socket in its place is never taken, nor removed
+  // when this daemon stops; once it is stale, it is replaced.
+  const std::string taken = replaced + ", and a new one cannot be made: another daemon listens";
+  constexpr const char* kOther = "/tmp/zorvrun/other.sock";
+  {
+    const zorv_test::ScriptedServer other(kOther, 0, {});
+    ASSERT_EQ(rename(kOther, kSocket), 0);
+    ASSERT_TRUE(daemon.Logged(taken));
+  }
+  ASSERT_TRUE(daemon.Logged(replaced + ": listening on a new one"));
+  {
+    const zorv_test::ScriptedServer other(kOther, 0, {});
+    ASSERT_EQ(rename(kOther, kSocket), 0);
+    ASSERT_TRUE(daemon.Logged(taken));
+    struct stat planted, left;
+    ASSERT_EQ(lstat(kSocket, &planted), 0);
+    EXPECT_EQ(daemon.Stop(SIGTERM), 0);
+    ASSERT_EQ(lstat(kSocket, &left), 0);
+    EXPECT_EQ(left.st_ino, planted.st_ino);
+  }
+
+  // Started again, with nothing in memory and the other daemon gone: the
+  // same records from the journal's files, which took turns many times,
+  // then new ones.
   Daemon restarted({"--keep", "5", "--journal-size", "65536"});
   ASSERT_TRUE(restarted.Logged("ready:"));
   Client back;
-  Subscribe(back, "a", kFiles - 10);
-  for (int seq = kFiles - 9; seq <= kFiles + 1; ++seq) {
-    EXPECT_EQ(back.Line(), "a " + std::to_string(seq) + " " + name + std::to_string(seq - 1));
-  }
+  resume(back);
   ASSERT_TRUE(Put("/tmp/s/a/last", "x"));
   EXPECT_EQ(back.Line(), "a " + std::to_string(kFiles + 2) + " /tmp/s/a/last");
   EXPECT_EQ(restarted.Stop(SIGTERM), 0);
 }
 
-// The daemon's CPU time so far, in clock ticks (-1 when unknown).
+// The CPU time of process |pid| so far, in clock ticks (-1 when unknown).
 long CpuTicks(pid_t pid) {
   std::ifstream in("/proc/" + std::to_string(pid) + "/stat");
-  std::string text((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
-  std::istringstream fields(text.substr(text.rfind(')') + 2));
-  std::string field;
-  long user = -1, system = -1;
-  for (int i = 3; i <= 15 && fields >> field; ++i) {
-    if (i == 14) user = std::stol(field);
-    if (i == 15) system = std::stol(field);
-  }
-  return user < 0 || system < 0 ? -1 : user + system;
+  std::string text, field;
+  std::getline(in, text);
+  std::istringstream fields(text.substr(text.rfind(')') + 1));
+  for (int i = 3; i < 14; ++i) fields >> field;  // state to cmajflt
+  long user = 0, system = 0;
+  return fields >> user >> system ? user + system : -1;
 }
 
 // Clients that nest a request deeper than a parser's stack, hold ever more
@@ -740,75 +770,24 @@ TEST_F(DaemonTest, OutlivesHostileClients) {
   EXPECT_EQ(daemon.Stop(SIGTERM), 0);
 }
 
-// A socket listening at |path|, as another daemon's would; closed with it.
-class OtherDaemon {
- public:
-  explicit OtherDaemon(const char* path) : fd_(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0)) {
-    struct sockaddr_un address = {};
-    address.sun_family = AF_UNIX;
-    strcpy(address.sun_path, path);
-    EXPECT_EQ(bind(fd_, reinterpret_cast<struct sockaddr*>(&address), sizeof(address)), 0);
-    EXPECT_EQ(listen(fd_, 8), 0);
-  }
-  ~OtherDaemon() { close(fd_); }
-
- private:
-  int fd_;
-};
-
-// In a mount namespace of its own, an empty /run, as on a machine where the
-// service never ran; the host's stays as it is.  For a pre-exec hook.
-bool PrivateRun() {
-  return unshare(CLONE_NEWNS) == 0 &&
-         mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == 0 &&
-         mount("zorv-test", "/run", "tmpfs", 0, "mode=0755") == 0;
+// In a mount namespace of its own, a fresh tmpfs mounted with |options| on
+// |path|; the host's stays as it is.  For a pre-exec hook.
+std::function<bool()> PrivateTmpfs(const char* path, const char* options) {
+  return [=] {
+    return unshare(CLONE_NEWNS) == 0 &&
+           mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == 0 &&
+           mount("zorv-test", path, "tmpfs", 0, options) == 0;
+  };
 }
 
-// The socket file removed or replaced while the daemon runs, a socket
-// directory that others may write, and the default runtime directory
-// missing, as when the daemon is started by hand.
+// A socket directory or a state directory that others may write, and the
+// default runtime directory missing, as when the daemon is started by hand.
 TEST_F(DaemonTest, ListensOnItsOwnSocketInARootOnlyDirectory) {
-  ASSERT_EQ(std::system("rm -rf /tmp/k && mkdir /tmp/k"), 0);
-  Register("k", "/tmp/k", kCreate);
-  Daemon daemon({"--json", "--retry", "0.05"});
-  EXPECT_TRUE(daemon.Logged("made the state directory \"/var/lib/zorvnotifyd\""));
-  ASSERT_TRUE(daemon.Logged("ready: watching 1 directories for 1 queues"));
-  Client before;
-  ASSERT_TRUE(before.connected());
-  Subscribe(before, "k");
-  const std::string replaced =
-      "the socket file \"/tmp/zorvrun/zorvnotifyd.sock\" was removed or replaced";
-  ASSERT_EQ(unlink(kSocket), 0);
-  ASSERT_TRUE(daemon.Logged(replaced + ": listening on a new one"));
-  // New clients reach it again, and the old ones are still served.
-  Client after;
-  ASSERT_TRUE(after.connected());
-  Subscribe(after, "k");
-  ASSERT_TRUE(Put("/tmp/k/a", "x"));
-  EXPECT_EQ(before.Line(), "k 2 /tmp/k/a");  // after the first start's rescan
-  EXPECT_EQ(after.Line(), "k 2 /tmp/k/a");
-  // Another daemon's live socket in its place is never taken, nor removed
-  // when this daemon stops; once it is stale, it is replaced.
-  ASSERT_EQ(unlink(kSocket), 0);
-  const std::string taken = replaced + ", and a new one cannot be made: another daemon listens";
-  {
-    const OtherDaemon other(kSocket);
-    ASSERT_TRUE(daemon.Logged(taken));
-  }
-  ASSERT_TRUE(daemon.Logged(replaced + ": listening on a new one"));
-  ASSERT_EQ(unlink(kSocket), 0);
-  const OtherDaemon other(kSocket);
-  ASSERT_TRUE(daemon.Logged(taken));
-  struct stat planted, left;
-  ASSERT_EQ(lstat(kSocket, &planted), 0);
-  EXPECT_EQ(daemon.Stop(SIGTERM), 0);
-  ASSERT_EQ(lstat(kSocket, &left), 0);
-  EXPECT_EQ(left.st_ino, planted.st_ino);
-
   // A directory anyone may write, or one that is not root's, would let a
   // user block the start or serve a socket of their own.
-  MakeDirs({"/tmp/open", "/tmp/theirs"});
-  ASSERT_TRUE(chmod("/tmp/open", 01777) == 0 && chown("/tmp/theirs", 65534, 0) == 0);
+  ASSERT_EQ(std::system("mkdir -m 1777 /tmp/open && mkdir /tmp/theirs /tmp/good && "
+                        "chown 65534 /tmp/theirs && ln -s /tmp/good /tmp/state-link"),
+            0);
   for (const std::string dir : {"/tmp/open", "/tmp/theirs"}) {
     Daemon refused({}, nullptr, (dir + "/zorvnotifyd.sock").c_str());
     EXPECT_TRUE(refused.Logged("its directory \"" + dir + "\" is owned by uid " +
@@ -817,8 +796,7 @@ TEST_F(DaemonTest, ListensOnItsOwnSocketInARootOnlyDirectory) {
     EXPECT_EQ(refused.Stop(0), 1);
     EXPECT_NE(access((dir + "/zorvnotifyd.sock").c_str(), F_OK), 0);
   }
-  // So would a state directory: refused too, and so is a link to one.
-  ASSERT_EQ(symlink("/tmp/k", "/tmp/state-link"), 0);
+  // So would a state directory: refused too, and so is a link to a good one.
   for (const std::string dir : {"/tmp/open", "/tmp/theirs", "/tmp/state-link"}) {
     Daemon refused({"--state-dir", dir});
     EXPECT_TRUE(refused.Logged(
@@ -832,7 +810,7 @@ TEST_F(DaemonTest, ListensOnItsOwnSocketInARootOnlyDirectory) {
 
   // Started by hand, without the runtime directory its service makes: the
   // daemon makes it.
-  Daemon by_hand({}, PrivateRun, nullptr);
+  Daemon by_hand({}, PrivateTmpfs("/run", "mode=0755"), nullptr);
   EXPECT_TRUE(by_hand.Logged("made the socket's directory \"/run/zorvnotifyd\""));
   ASSERT_TRUE(by_hand.Logged("ready:"));
   const std::string run = "/proc/" + std::to_string(by_hand.pid()) + "/root/run/zorvnotifyd";
@@ -842,34 +820,11 @@ TEST_F(DaemonTest, ListensOnItsOwnSocketInARootOnlyDirectory) {
       << std::oct << st.st_mode;
   ASSERT_EQ(lstat((run + "/zorvnotifyd.sock").c_str(), &st), 0);
   EXPECT_TRUE(S_ISSOCK(st.st_mode));
-  // And its state directory (made by the first daemon), root's alone.
+  // And its state directory, which it made, root's alone.
   ASSERT_EQ(lstat("/var/lib/zorvnotifyd", &st), 0);
   EXPECT_TRUE(S_ISDIR(st.st_mode) && st.st_uid == 0 && (st.st_mode & 07777) == 0700)
       << std::oct << st.st_mode;
   EXPECT_EQ(by_hand.Stop(SIGTERM), 0);
-}
-
-// A read-only /usr holding only the etc configuration directory, as seen
-// by the daemon alone: the daemon serves the queues that exist and says
-// which directories it cannot have, and which file looks like a backup.
-// A directory made later (here, where /usr is writable) is read at the
-// next tick.
-TEST_F(DaemonTest, ServesWhatExistsOnAReadOnlyUsr) {
-  ASSERT_EQ(std::system("rm -rf /tmp/ro && mkdir /tmp/ro"), 0);
-  Register("ro", "/tmp/ro", IN_CREATE);
-  ASSERT_TRUE(Put("/usr/zorv/etc/zorvnotifyd/f.bak", "[]"));
-  Daemon daemon({"--json", "--retry", "0.1"}, zorv_test::PrivateReadOnlyUsr);
-  ASSERT_TRUE(daemon.Logged("the configuration directory /usr/zorv/share/zorvnotifyd is missing"));
-  ASSERT_TRUE(
-      daemon.Logged("queue file etc/f.bak looks like a backup copy, and is loaded like any "
-                    "queue file: remove it or move it out of the directory"));
-  ASSERT_TRUE(daemon.Logged("ready: watching 1 directories for 1 queues"));
-  Register("late", "/tmp/ro", IN_CREATE, nullptr, "g", MONITOR_QUEUE_TYPE_SHARE_DIR);
-  ASSERT_TRUE(daemon.Logged("catalogue reloaded: watching 1 directories for 2 queues"));
-  Put("/tmp/ro/y", "y");
-  daemon.Expect({"late share g /tmp/ro/y " + std::to_string(IN_CREATE),
-                 "ro etc f /tmp/ro/y " + std::to_string(IN_CREATE)});
-  EXPECT_EQ(daemon.Stop(SIGTERM), 0);
 }
 
 // The next record of |client| as "SEQ PATH MASK", with " offline" for a
@@ -1181,11 +1136,8 @@ TEST_F(DaemonTest, DeliversLiveWhenTheJournalCannotBeWritten) {
   Register("full", "/tmp/full", kCreate);
   // No periodic tick: a record must never wait for one (or for the next
   // event) to reach its subscriber.
-  Daemon daemon({"--state-dir", "/tmp/fs", "--retry", "600"}, [] {
-    return unshare(CLONE_NEWNS) == 0 &&
-           mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == 0 &&
-           mount("zorv-test", "/tmp/fs", "tmpfs", 0, "mode=0700,size=64k") == 0;
-  });
+  Daemon daemon({"--state-dir", "/tmp/fs", "--retry", "600"},
+                PrivateTmpfs("/tmp/fs", "mode=0700,size=64k"));
   ASSERT_TRUE(daemon.Logged("ready:"));
   Client client;
   Subscribe(client, "full");
@@ -1257,18 +1209,18 @@ TEST_F(DaemonTest, ServesWholeFileSystemsWithFanotify) {
                         "echo x >/tmp/all/out/o$i; done; echo x >/tmp/all/t/end"),
             0);
   std::set<std::string> files;
-  for (const std::string& line : daemon->ReadUntil("t /tmp/all/t/end 8")) {
+  for (const std::string& line : daemon->ReadUntil("t etc f /tmp/all/t/end 8")) {
     EXPECT_EQ(line.find("/out"), std::string::npos) << line;
     if (line.size() > 6 && line.compare(line.size() - 6, 6, "/f 256") == 0) files.insert(line);
   }
   EXPECT_EQ(files.size(), 200u);
   ASSERT_TRUE(Put("/tmp/ram/a", ""));
-  EXPECT_TRUE(daemon->Heard("ram /tmp/ram/a 256"));
+  EXPECT_TRUE(daemon->Heard("ram etc f /tmp/ram/a 256"));
 
   // Moves in (what came is found), within (the pair; the directory's new
   // path serves at once) and out (nothing more from there).
   const auto t = [](const std::string& path, unsigned mask) {
-    return "t /tmp/all/t/" + path + " " + std::to_string(mask);
+    return "t etc f /tmp/all/t/" + path + " " + std::to_string(mask);
   };
   // The lines up to |last| but the first start's rescan record of the
   // tree, which comes when the walk after ready has been through it.
@@ -1295,7 +1247,7 @@ TEST_F(DaemonTest, ServesWholeFileSystemsWithFanotify) {
   ASSERT_EQ(std::system("rm -r /tmp/all/r && mkdir /tmp/all/r && echo x >/tmp/all/r/b"), 0);
   EXPECT_TRUE(daemon->Logged("not watching tree \"/tmp/all/r\": it was deleted;"));
   EXPECT_TRUE(daemon->Logged("watching tree \"/tmp/all/r\" again"));
-  EXPECT_TRUE(daemon->Heard("r /tmp/all/r/b 256"));
+  EXPECT_TRUE(daemon->Heard("r etc f /tmp/all/r/b 256"));
 
   // More events than the kernel queues while the daemon is stopped: a
   // rescan record, and events again after.
@@ -1317,7 +1269,7 @@ TEST_F(DaemonTest, ServesWholeFileSystemsWithFanotify) {
     EXPECT_TRUE(daemon->Heard("t rescan /tmp/all/t"));
     EXPECT_TRUE(daemon->Logged("fanotify event queue overflowed, events were lost"));
     ASSERT_TRUE(Put("/tmp/all/t/c2/after", "x"));
-    EXPECT_TRUE(daemon->Heard("t /tmp/all/t/c2/after 256"));
+    EXPECT_TRUE(daemon->Heard("t etc f /tmp/all/t/c2/after 256"));
   }
   EXPECT_EQ(daemon->Stop(SIGTERM), 0);
 
@@ -1340,8 +1292,8 @@ TEST_F(DaemonTest, ServesWholeFileSystemsWithFanotify) {
   // tree is named for a rescan when the first daemon stopped before it
   // could save its view of the tree (its walk after the overflow was not
   // done); changes it had delivered may come again, never fewer.
-  const Lines offline = daemon->ReadUntil("t /tmp/all/t/c3/offline 256");
-  EXPECT_TRUE((!offline.empty() && offline.back() == "t /tmp/all/t/c3/offline 256") ||
+  const Lines offline = daemon->ReadUntil("t etc f /tmp/all/t/c3/offline 256");
+  EXPECT_TRUE((!offline.empty() && offline.back() == "t etc f /tmp/all/t/c3/offline 256") ||
               std::count(offline.begin(), offline.end(), "t rescan /tmp/all/t") > 0)
       << ::testing::PrintToString(offline);
   const Json::Value trees = Status()["trees"];
@@ -1350,7 +1302,7 @@ TEST_F(DaemonTest, ServesWholeFileSystemsWithFanotify) {
             "/tmp/all fanotify");
   EXPECT_EQ(trees[3]["path"].asString() + " " + trees[3]["backend"].asString(), "/tmp/ram inotify");
   ASSERT_TRUE(Put("/tmp/all/out/x", ""));
-  EXPECT_TRUE(daemon->Heard("all /tmp/all/out/x 256"));
+  EXPECT_TRUE(daemon->Heard("all etc fall /tmp/all/out/x 256"));
   EXPECT_EQ(daemon->Stop(SIGTERM), 0);
   EXPECT_EQ(std::system("umount /tmp/all /tmp/ram && rm /tmp/img"), 0);
 }
