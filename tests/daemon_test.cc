@@ -21,7 +21,6 @@
 #include <filesystem>
 #include <fstream>
 #include <functional>
-#include <iterator>
 #include <map>
 #include <memory>
 #include <set>
@@ -733,9 +732,7 @@ TEST_F(DaemonTest, OutlivesHostileClients) {
   EXPECT_EQ(Subscribe(big, name + "0")["reply"], "subscribe");
 
   // Idle clients up to the cap, then more than the descriptors allow.
-  std::vector<std::unique_ptr<Client>> idle, beyond;
-  for (size_t i = 4; i < kCap; ++i) idle.push_back(std::make_unique<Client>());
-  for (int i = 0; i < 150; ++i) beyond.push_back(std::make_unique<Client>());
+  std::vector<Client> idle(kCap - 4), beyond(150);
   // A directory made now is watched, and the daemon waits without spinning.
   ASSERT_EQ(mkdir("/tmp/h/new", 0755), 0);
   ASSERT_TRUE(Put("/tmp/h/new/f", "x"));
@@ -745,11 +742,11 @@ TEST_F(DaemonTest, OutlivesHostileClients) {
   const long before = CpuTicks(daemon.pid());
   usleep(1000 * 1000);
   EXPECT_LT(CpuTicks(daemon.pid()) - before, sysconf(_SC_CLK_TCK) / 4);
-  for (const auto& client : beyond) {
-    const Json::Value refusal = client->Next();
+  for (Client& client : beyond) {
+    const Json::Value refusal = client.Next();
     ASSERT_EQ(refusal["error"],
               "too many clients: the daemon serves at most 32 at once; try again later");
-    EXPECT_EQ(client->Next(), Json::Value()) << "not closed";
+    EXPECT_EQ(client.Next(), Json::Value()) << "not closed";
   }
   EXPECT_TRUE(daemon.Logged("at the client limit"));
   // A tree deeper than the reserve lets a walk go, moved in at the cap:
@@ -836,7 +833,7 @@ TEST_F(DaemonTest, ReportsWhatChangedWhileItWasStopped) {
   constexpr unsigned kAll =
       IN_CREATE | IN_MODIFY | IN_CLOSE_WRITE | IN_DELETE | IN_MOVED_FROM | IN_MOVED_TO;
   Register("o", "/tmp/o", kAll);
-  // Each run: the records after |seq| until one ending in |last|, |seq|
+  // Each run: the records after |seq| until one holding |last|, |seq|
   // moved to the last one; |log| is a line the daemon must log after "ready";
   // with |out| the daemon is left running there.
   std::string journal;
@@ -852,13 +849,9 @@ TEST_F(DaemonTest, ReportsWhatChangedWhileItWasStopped) {
     EXPECT_EQ(id, journal.empty() ? id : journal);
     journal = id;
     Lines got;
-    const auto ends = [&last](const std::string& text) {
-      return text.empty() || (text.size() >= last.size() &&
-                              text.compare(text.size() - last.size(), last.size(), last) == 0);
-    };
     do {
       got.push_back(client.Line(true));
-    } while (!ends(got.back()));
+    } while (!got.back().empty() && got.back().find(last) == std::string::npos);
     seq = std::atoi(got.back().c_str());
     if (out != nullptr) {
       *out = std::move(daemon);
@@ -989,7 +982,6 @@ TEST_F(DaemonTest, KeepsEachQueuesRecordsAcrossRestarts) {
     ASSERT_TRUE(daemon.Logged("ready:"));
     Client sleeper;
     journal = Subscribe(sleeper, "j")["journal"].asString();
-    EXPECT_EQ(journal.size(), 32u);
     // File i is record i, after the first start's rescan record.
     for (int i = 2; i < kAway + 2; ++i) {
       ASSERT_EQ(close(open(("/tmp/j/" + std::to_string(i)).c_str(), O_CREAT | O_WRONLY, 0644)), 0);
@@ -1106,11 +1098,7 @@ TEST_F(DaemonTest, DeliversLiveWhenTheJournalCannotBeWritten) {
   Subscribe(client, "full");
   // Fills what the daemon sees at /tmp/fs.
   const std::string filler = "/proc/" + std::to_string(daemon.pid()) + "/root/tmp/fs/filler";
-  {
-    std::ofstream out(filler);
-    const std::string block(4096, 'f');
-    for (int i = 0; i < 64 && out.write(block.data(), block.size()); ++i) out.flush();
-  }
+  std::system(("head -c 1M /dev/zero >" + filler + " 2>/dev/null").c_str());
   for (int i = 1; i <= 300; ++i) {
     ASSERT_TRUE(Put("/tmp/full/" + std::to_string(i), "x"));
     ASSERT_EQ(client.Line(), "full " + std::to_string(i + 1) + " /tmp/full/" + std::to_string(i));
