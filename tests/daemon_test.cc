@@ -545,6 +545,13 @@ Json::Value Subscribe(Client& client, const std::string& queue, long since = -1)
   return client.Next();
 }
 
+// The status reply of the daemon on the default socket.
+Json::Value Status() {
+  Client client;
+  EXPECT_TRUE(client.Send("{\"request\":\"status\"}"));
+  return client.Next();
+}
+
 // Clients on two queues, one that never reads, one that comes back, one
 // that may not connect, and a queue that goes and comes back; the socket
 // file removed or replaced while the daemon runs.
@@ -622,9 +629,7 @@ TEST_F(DaemonTest, DeliversEachQueueItsEventsToItsSubscribers) {
       });
   EXPECT_TRUE(refused.exited && refused.result == 1) << refused.error;
 
-  Client status;
-  ASSERT_TRUE(status.Send("{\"request\":\"status\"}"));
-  const Json::Value v = status.Next();
+  const Json::Value v = Status();
   EXPECT_EQ(std::vector<Json::Value>({v["queues"], v["clients"], v["directories"]}),
             std::vector<Json::Value>({2, 4, 2}));
 
@@ -759,9 +764,7 @@ TEST_F(DaemonTest, OutlivesHostileClients) {
   idle.clear();
   beyond.clear();
   EXPECT_TRUE(daemon.Logged("accepting clients again: 150 were refused at the client limit"));
-  Client again;
-  ASSERT_TRUE(again.Send("{\"request\":\"status\"}"));
-  EXPECT_EQ(again.Next()["reply"], "status");
+  EXPECT_EQ(Status()["reply"], "status");
   EXPECT_EQ(daemon.Stop(SIGTERM), 0);
 }
 
@@ -957,13 +960,6 @@ TEST_F(DaemonTest, ReportsWhatChangedWhileItWasStopped) {
   EXPECT_EQ(got, Lines({"/tmp/o/late 256", "/tmp/o/late 2", "/tmp/o/late 8", "/tmp/o/end 256"}));
 }
 
-// The status reply of the daemon on the default socket.
-Json::Value Status() {
-  Client client;
-  EXPECT_TRUE(client.Send("{\"request\":\"status\"}"));
-  return client.Next();
-}
-
 // Each queue's records outlive the daemon: stopped, killed in the middle
 // of a burst, restarted, the numbering goes on under the same journal id,
 // and a client that comes back with "since" gets each record once, in
@@ -1129,10 +1125,10 @@ TEST_F(DaemonTest, ServesWholeFileSystemsWithFanotify) {
                  << strerror(errno);
   }
   close(probe);
-  std::system("umount /tmp/all /tmp/ram 2>/dev/null");
-  ASSERT_EQ(std::system("rm -rf /tmp/all /tmp/ram /tmp/img && mkdir /tmp/all /tmp/ram && "
-                        "truncate -s 64M /tmp/img"),
-            0);
+  ASSERT_EQ(
+      std::system("umount /tmp/all /tmp/ram 2>/dev/null; rm -rf /tmp/all /tmp/ram /tmp/img && "
+                  "mkdir /tmp/all /tmp/ram && truncate -s 64M /tmp/img"),
+      0);
   if (std::system("mkfs.ext4 -q -N 40000 /tmp/img && mount -o loop /tmp/img /tmp/all") != 0) {
     GTEST_SKIP() << "no ext4 file system in a loop device here (mkfs.ext4, /dev/loop*)";
   }
