@@ -356,10 +356,6 @@ int Serve(const Options& options) {
       next_tick = NowMs() + retry_ms;
       sync.Wrote(NowMs());  // a tree that came back was compared
     }
-    // A group sync reads the events queued meanwhile: it comes before the
-    // delivery, so that their records go out in this turn instead of
-    // waiting for the next event or tick.
-    sync.RunIfDue(NowMs());
     server.Deliver();
     // The journals' records of this turn, one write each, synced in groups;
     // a journal written again after a failure gives its queue rescan
@@ -367,6 +363,7 @@ int Serve(const Options& options) {
     logs.WriteOut();
     if (logs.unsynced()) sync.Wrote(NowMs());
     if (logs.Settle()) server.Deliver();
+    sync.RunIfDue(NowMs());
     if (options.out != Stdout::kNone && (fflush(stdout) != 0 || ferror(stdout))) {
       syslog(LOG_ERR, "cannot write the report to standard output: stopping");
       tree.Clear();
