@@ -207,8 +207,7 @@ UniqueFd TreeSnapshot::WriteTemporary(int dir) {
   UniqueFd out(
       openat(dir, temporary.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0600));
   if (out.get() < 0 || !WriteAll(out.get(), data)) {
-    syslog(LOG_ERR, "cannot save the snapshot of tree %s: %s", Quoted(root_).c_str(),
-           strerror(errno));
+    SaveFailed(errno);
     unlinkat(dir, temporary.c_str(), 0);
     return UniqueFd();
   }
@@ -220,13 +219,23 @@ bool TreeSnapshot::Install(int dir) {
   const std::string name = FileName(root_);
   const std::string temporary = "." + name + ".tmp";
   if (renameat(dir, temporary.c_str(), dir, name.c_str()) != 0) {
-    syslog(LOG_ERR, "cannot save the snapshot of tree %s: %s", Quoted(root_).c_str(),
-           strerror(errno));
+    SaveFailed(errno);
     unlinkat(dir, temporary.c_str(), 0);
     return false;
   }
   rewrite_ = false;
+  if (save_failed_) {
+    save_failed_ = false;
+    syslog(LOG_NOTICE, "the snapshot of tree %s is saved again", Quoted(root_).c_str());
+  }
   return true;
+}
+
+void TreeSnapshot::SaveFailed(int error) {
+  if (save_failed_) return;
+  save_failed_ = true;
+  syslog(LOG_ERR, "cannot save the snapshot of tree %s: %s", Quoted(root_).c_str(),
+         strerror(error));
 }
 
 bool TreeSnapshot::AppendQueued(int dir) {
@@ -422,8 +431,7 @@ void Snapshot::SaveTrees(const std::vector<TreeSnapshot*>& trees) {
       ++it;
       continue;
     }
-    syslog(LOG_ERR, "cannot save the snapshot of tree %s: %s", Quoted(it->first->root()).c_str(),
-           strerror(errno));
+    it->first->SaveFailed(errno);
     unlinkat(dir_.get(), ("." + FileName(it->first->root()) + ".tmp").c_str(), 0);
     it = whole.erase(it);
   }

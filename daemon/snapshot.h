@@ -93,6 +93,9 @@ class TreeSnapshot {
   // Renames the temporary file, synced by the caller, over the tree's
   // file; false (logged) on failure.
   bool Install(int dir);
+  // Logs that a save failed for |error|, once until a save succeeds again:
+  // a full disk is retried at every sync and must not flood the log.
+  void SaveFailed(int error);
 
   std::string root_;
   std::map<std::string, SnapshotListing> dirs_;
@@ -104,6 +107,7 @@ class TreeSnapshot {
   // saved), and whether this one is on that list.
   std::vector<TreeSnapshot*>* to_save_ = nullptr;
   bool listed_ = false;
+  bool save_failed_ = false;  // the last save failed, and was logged
 };
 
 // Every tree's saved view, in the directory "snapshot" of the state

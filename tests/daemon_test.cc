@@ -1103,6 +1103,7 @@ TEST_F(DaemonTest, DeliversLiveWhenTheJournalCannotBeWritten) {
   EXPECT_EQ(client.Line(), "full 302 /tmp/full/again");
   EXPECT_EQ(client.Line(), "full 303 rescan /tmp/full");
   EXPECT_TRUE(daemon.Logged("the journal of queue \"full\" (etc/f) is written again"));
+  EXPECT_TRUE(daemon.Logged("the snapshot of tree \"/tmp/full\" is saved again"));
   EXPECT_EQ(Status()["state"], "ok");
   EXPECT_EQ(daemon.Stop(SIGTERM), 0);
 }
