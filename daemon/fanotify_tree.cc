@@ -797,8 +797,14 @@ void FanotifyTree::Relist() {
     for (const std::string& path : work) {
       SnapshotListing listing;
       bool listed = false;
-      for (auto& [root, tree] : snapshot_->trees()) {
-        if (!Under(path, root)) continue;
+      // The trees that hold |path|: their roots are |path| or one of its
+      // ancestors, found by one lookup each, outermost first.
+      for (size_t end = 1; end <= path.size(); ++end) {
+        if (end < path.size() && path[end] != '/') continue;
+        const auto found = snapshot_->trees().find(std::string_view(path).substr(0, end));
+        if (found == snapshot_->trees().end()) continue;
+        const std::string& root = found->first;
+        TreeSnapshot* tree = found->second.get();
         if (!listed) {
           const UniqueFd dir = OpenBelow(root, path);
           struct stat st;

@@ -132,7 +132,7 @@ class Snapshot {
   // The tree |root| if loaded, else nullptr.
   TreeSnapshot* Loaded(const std::string& root);
   // Every loaded tree, by root.  A tree once loaded is never dropped.
-  std::map<std::string, std::unique_ptr<TreeSnapshot>>& trees() { return trees_; }
+  std::map<std::string, std::unique_ptr<TreeSnapshot>, std::less<>>& trees() { return trees_; }
 
   // Marks directory |path| as changed: one hash-set insertion, no system
   // call; SaveChanges lists it again.
@@ -157,7 +157,7 @@ class Snapshot {
   void SaveTrees(const std::vector<TreeSnapshot*>& trees);
 
   UniqueFd dir_;
-  std::map<std::string, std::unique_ptr<TreeSnapshot>> trees_;
+  std::map<std::string, std::unique_ptr<TreeSnapshot>, std::less<>> trees_;
   std::unordered_set<std::string> dirty_;  // directories to list again
   // The trees with something queued or to rewrite: a save pays for the
   // trees that changed, not for every tree loaded.

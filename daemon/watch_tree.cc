@@ -436,12 +436,12 @@ uint32_t WatchTree::MaskFor(const std::string& dir) const {
 }
 
 std::string WatchTree::RootOf(const std::string& dir) const {
-  std::string found;
+  size_t found = 0;
   for (size_t i = 1; i <= dir.size(); ++i) {
     if (i < dir.size() && dir[i] != '/') continue;
-    if (roots_.find(std::string_view(dir).substr(0, i)) != roots_.end()) found = dir.substr(0, i);
+    if (roots_.find(std::string_view(dir).substr(0, i)) != roots_.end()) found = i;
   }
-  return found;
+  return dir.substr(0, found);
 }
 
 bool WatchTree::WatchRootTree(const std::string& root, WalkContext& context, std::string* why,
