@@ -2,8 +2,12 @@
 
 #include <stddef.h>
 #include <sys/socket.h>
+#include <sys/stat.h>
 #include <sys/un.h>
+#include <unistd.h>
 
+#include <cinttypes>
+#include <cstdio>
 #include <cstdlib>
 #include <cstring>
 
@@ -35,6 +39,15 @@ bool NotifyServiceManager(const std::string& state) {
   return sendto(fd.get(), state.data(), state.size(), MSG_NOSIGNAL,
                 reinterpret_cast<const struct sockaddr*>(&address),
                 address_length) == ssize_t(state.size());
+}
+
+bool StderrIsJournal() {
+  const char* stream = getenv("JOURNAL_STREAM");
+  uintmax_t device = 0, inode = 0;
+  struct stat st;
+  return stream != nullptr && sscanf(stream, "%ju:%ju", &device, &inode) == 2 &&
+         fstat(STDERR_FILENO, &st) == 0 && uintmax_t(st.st_dev) == device &&
+         uintmax_t(st.st_ino) == inode;
 }
 
 }  // namespace zorvnotifyd

@@ -18,6 +18,12 @@ namespace zorvnotifyd {
 // sd_notify's callers do.  Never raises SIGPIPE.
 bool NotifyServiceManager(const std::string& state);
 
+// True when standard error is the stream a service manager connected to
+// its journal ($JOURNAL_STREAM names that stream's device and inode, and
+// standard error is still it).  A daemon that logs through syslog then
+// leaves its lines off standard error, or the journal holds each twice.
+bool StderrIsJournal();
+
 }  // namespace zorvnotifyd
 
 #endif  // ZORVNOTIFYD_DAEMON_NOTIFY_H_

@@ -467,7 +467,9 @@ int main(int argc, char** argv) {
   // ends the daemon through a write error, not by a signal that skips the
   // clean-up; a client that goes away is a write error on its socket.
   signal(SIGPIPE, SIG_IGN);
-  openlog("zorvnotifyd", LOG_PID | LOG_PERROR, LOG_DAEMON);
+  // On standard error too, for a person running it, unless that is the
+  // journal syslog writes to as well.
+  openlog("zorvnotifyd", LOG_PID | (zorvnotifyd::StderrIsJournal() ? 0 : LOG_PERROR), LOG_DAEMON);
   if (geteuid() != 0) {
     syslog(LOG_ERR, "must run as root: the catalogue and the watched trees are root's");
     return 1;
