@@ -17,39 +17,11 @@
 #include <string>
 
 #include "bounded_read.h"
+#include "root_owned.h"
 #include "text.h"
 #include "unique_fd.h"
 
 namespace zorvcommon {
-namespace {
-
-// Why |st|, the status of |what|, is not root's alone, or "".
-std::string NotRootsAlone(const struct stat& st, const std::string& what) {
-  if (st.st_uid != 0) {
-    const struct passwd* user = getpwuid(st.st_uid);
-    return what + " belongs to uid " + std::to_string(st.st_uid) +
-           (user != nullptr ? " (user " + Printable(user->pw_name) + ")" : "") + ", not root";
-  }
-  if ((st.st_mode & (S_IWGRP | S_IWOTH)) != 0) return what + " is writable by group or others";
-  return std::string();
-}
-
-// Why |dir| (absolute) or a directory above it is not root's alone, or "".
-std::string UntrustedDirectories(std::string dir) {
-  for (;;) {
-    struct stat st;
-    if (stat(dir.c_str(), &st) != 0) {
-      return "its directory " + Printable(dir) + " cannot be checked: " + strerror(errno);
-    }
-    std::string why = NotRootsAlone(st, "its directory " + Printable(dir));
-    if (!why.empty()) return why;
-    const std::string::size_type slash = dir.rfind('/');
-    if (dir == "/" || slash == std::string::npos) return std::string();
-    dir = slash == 0 ? "/" : dir.substr(0, slash);
-  }
-}
-
-}  // namespace
 
 bool QueueFileNames(const std::string& dir, std::vector<std::string>* names) {
   std::unique_ptr<DIR, int (*)(DIR*)> handle(opendir(dir.c_str()), closedir);

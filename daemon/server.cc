@@ -22,6 +22,7 @@
 
 #include "json_writer.h"
 #include "request.h"
+#include "root_owned.h"
 #include "text.h"
 
 namespace zorvnotifyd {
@@ -170,6 +171,12 @@ UniqueFd Server::Bind(struct stat* bound, std::string* reason) {
     snprintf(mode, sizeof(mode), "%04o", unsigned(st.st_mode & 07777));
     *reason = "its directory " + Quoted(dir) + " is owned by uid " + std::to_string(st.st_uid) +
               " with mode " + mode + "; it must be root's and writable by root alone";
+    return UniqueFd();
+  }
+  // Nor may anyone else write a directory above it (but for a sticky one of
+  // root's, as /tmp), or they could move it away and put their own there.
+  if (std::string why = zorvcommon::UntrustedDirectories(dir, true); !why.empty()) {
+    *reason = why;
     return UniqueFd();
   }
   // A socket left by an earlier run is replaced; nothing else ever is.

@@ -794,6 +794,13 @@ TEST_F(DaemonTest, ListensOnItsOwnSocketInARootOnlyDirectory) {
     EXPECT_EQ(refused.Stop(0), 1);
     EXPECT_NE(access((dir + "/zorvnotifyd.sock").c_str(), F_OK), 0);
   }
+  // So would a root-only directory in one of theirs, which they may swap.
+  {
+    ASSERT_EQ(mkdir("/tmp/theirs/sub", 0755), 0);
+    Daemon refused({}, nullptr, "/tmp/theirs/sub/zorvnotifyd.sock");
+    EXPECT_TRUE(refused.Logged("its directory /tmp/theirs belongs to uid 65534"));
+    EXPECT_EQ(refused.Stop(0), 1);
+  }
   // So would a state directory: refused too, and so is a link to a good one.
   for (const std::string dir : {"/tmp/open", "/tmp/theirs", "/tmp/state-link"}) {
     Daemon refused({"--state-dir", dir});
