@@ -139,6 +139,8 @@ class Snapshot {
   void MarkDirty(const std::string& path) { dirty_.insert(path); }
   // Takes the set of directories marked since the last call.
   std::vector<std::string> TakeDirty();
+  // True while directories are marked or trees wait for Save.
+  bool pending() const { return !dirty_.empty() || !to_save_.empty(); }
 
   // Saves every tree with queued changes: appends where it can, and
   // writes the other trees' files whole, synced together (one syncfs when

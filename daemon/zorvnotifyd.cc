@@ -62,6 +62,9 @@ const char kUsage[] =
     "                        8 MiB of records; 0: none, records in memory only)\n"
     "  --sync-interval MS    records reach the disk at most this long after they\n"
     "                        are written (default 100)\n"
+    "  --snapshot-interval MS\n"
+    "                        the directories events marked are listed again for\n"
+    "                        the snapshot at most this often (default 1000)\n"
     "  --coalesce US         when events are ready, wait this many microseconds more\n"
     "                        for those that follow, so that they are handled and\n"
     "                        sent together (default 5000; 0 to 100000; 0: read\n"
@@ -172,6 +175,7 @@ struct Options {
   std::string state_dir = kDefaultStateDir;
   uint64_t journal_size = 8 << 20;
   int64_t sync_interval_ms = 100;
+  int64_t snapshot_interval_ms = 1000;
   int64_t coalesce_us = kDefaultCoalesceUs;
   Backend backend = Backend::kAuto;
 };
@@ -232,7 +236,22 @@ int Serve(const Options& options) {
   // crash at any moment leaves each change in a journal, or still to be
   // found by comparing with the older snapshot.  Under a flood that does
   // not let the queue empty, the snapshot waits for a later sync.
-  sync.Join([&tree, &logs, &reporter] {
+  //
+  // Listing the marked directories is most of a sync's cost under a steady
+  // load, so it is done at most every --snapshot-interval; the journals
+  // are synced every time, and at the stop both.
+  int64_t next_listing_ms = 0;
+  bool stopping = false;
+  sync.Join([&] {
+    const int64_t now = NowMs();
+    if (!stopping && now < next_listing_ms) {
+      logs.WriteOut();
+      logs.Sync();
+      // A sync is due again when the listing is, events or not.
+      if (snapshot.pending() || fanotify_snapshot.pending()) sync.Wrote(next_listing_ms);
+      return;
+    }
+    next_listing_ms = now + options.snapshot_interval_ms;
     tree.Relist();
     const bool drained = tree.Drain(reporter);
     logs.WriteOut();
@@ -315,6 +334,7 @@ int Serve(const Options& options) {
       // The snapshot is saved with the last sync, while the watches still
       // tell which directories are the ones watched.
       logs.WriteOut();
+      stopping = true;
       sync.Run(NowMs());
       tree.Clear();
       logs.Close();
@@ -425,6 +445,10 @@ int ParseOptions(int argc, char** argv, Options* options) {
     } else if (arg == "--sync-interval" && value != nullptr &&
                ParseCount(value, 1, 3600000, &number)) {
       options->sync_interval_ms = int64_t(number);
+      ++i;
+    } else if (arg == "--snapshot-interval" && value != nullptr &&
+               ParseCount(value, 1, 3600000, &number)) {
+      options->snapshot_interval_ms = int64_t(number);
       ++i;
     } else if (arg == "--coalesce" && value != nullptr && ParseCount(value, 0, 100000, &number)) {
       options->coalesce_us = int64_t(number);
