@@ -152,10 +152,15 @@ void Watchers::Sync(const std::vector<std::string>& roots,
         before->second.why == choice.why) {
       continue;
     }
-    syslog(LOG_INFO, "tree %s is served by %s: %s", zorvcommon::Quoted(root).c_str(),
-           choice.backend, choice.why.c_str());
+    unlogged_.push_back("tree " + zorvcommon::Quoted(root) + " is served by " + choice.backend +
+                        ": " + choice.why);
   }
   chosen_ = std::move(chosen);
+}
+
+void Watchers::LogChoices() {
+  for (const std::string& line : unlogged_) syslog(LOG_INFO, "%s", line.c_str());
+  unlogged_.clear();
 }
 
 void Watchers::AppendStatus(std::string* out) const {
