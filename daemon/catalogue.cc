@@ -104,6 +104,13 @@ Catalogue CatalogueLoader::Load() {
         failing[key] = why;
       }
       // One copy for the catalogue; the loaded queues themselves are kept.
+      // Room made first, at least doubling: a queue is copied, not moved,
+      // when the catalogue grows, which copied a large file's queues about
+      // twice more.
+      const size_t needed = catalogue.size() + queues.size();
+      if (catalogue.capacity() < needed) {
+        catalogue.reserve(std::max(needed, 2 * catalogue.capacity()));
+      }
       for (const MonitorQueue& queue : queues) catalogue.push_back({type, file, queue});
       if (has_good) good[key] = std::move(queues);
     }

@@ -80,10 +80,15 @@ void Watchers::Sync(const std::vector<std::string>& roots,
   std::sort(sorted.begin(), sorted.end());
   std::map<std::string, Choice> chosen;
   for (const std::string& root : sorted) {
-    // The innermost tree chosen already that holds this one.
+    // The innermost tree chosen already that holds this one: its nearest
+    // ancestor among them (ancestors sort first, so all are chosen by now),
+    // looked up by each of its leading paths in turn, longest first.
     const std::string* outer = nullptr;
-    for (const auto& [path, choice] : chosen) {
-      if (Below(root, path)) outer = &path;
+    for (size_t end = root.size(); outer == nullptr && end > 0;) {
+      end = root.rfind('/', end - 1);
+      if (end == std::string::npos) break;
+      const auto found = chosen.find(root.substr(0, std::max<size_t>(end, 1)));
+      if (found != chosen.end() && Below(root, found->first)) outer = &found->first;
     }
     const UniqueFd dir = OpenConfiguredDir(root);
     std::string why;
@@ -147,10 +152,15 @@ void Watchers::Sync(const std::vector<std::string>& roots,
         before->second.why == choice.why) {
       continue;
     }
-    syslog(LOG_INFO, "tree %s is served by %s: %s", zorvcommon::Quoted(root).c_str(),
-           choice.backend, choice.why.c_str());
+    unlogged_.push_back("tree " + zorvcommon::Quoted(root) + " is served by " + choice.backend +
+                        ": " + choice.why);
   }
   chosen_ = std::move(chosen);
+}
+
+void Watchers::LogChoices() {
+  for (const std::string& line : unlogged_) syslog(LOG_INFO, "%s", line.c_str());
+  unlogged_.clear();
 }
 
 void Watchers::AppendStatus(std::string* out) const {

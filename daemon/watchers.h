@@ -55,10 +55,14 @@ class Watchers {
     fanotify_.UseSnapshot(fanotify, sink);
   }
 
-  // Chooses the backend of each root (logging each new choice and why)
-  // and syncs both watchers.
+  // Chooses the backend of each root and syncs both watchers.  Each new
+  // choice and why waits for LogChoices.
   void Sync(const std::vector<std::string>& roots,
             const ZORV::ZORVNOTIFYD::MonitorQueueIndex& index);
+  // Logs the choices Sync made that differ from the earlier ones, a line
+  // per tree: thousands of lines for a large catalogue, which the daemon
+  // writes once it is ready rather than before.
+  void LogChoices();
   // Both watchers' periodic checks.
   void Tick(EventSink& sink) {
     inotify_.Tick(sink);
@@ -104,6 +108,7 @@ class Watchers {
   FanotifyTree fanotify_;
   Backend backend_;
   std::map<std::string, Choice> chosen_;  // by root
+  std::vector<std::string> unlogged_;     // lines of new choices, for LogChoices
 };
 
 }  // namespace zorvnotifyd

@@ -299,6 +299,7 @@ int Serve(const Options& options) {
   load();
   syslog(LOG_INFO, "ready: watching %zu directories for %zu queues", tree.size(), reporter.size());
   NotifyServiceManager(ReadyState(tree.size(), reporter.size()));
+  tree.LogChoices();
   CompareAfterReady(tree);
   sync.Wrote(NowMs());  // the views of the trees compared
   const int64_t retry_ms = std::max<int64_t>(1, int64_t(options.retry_seconds * 1000));
@@ -364,6 +365,7 @@ int Serve(const Options& options) {
     if (hangup || changed || (tick && catalogue_watch.WatchMissing())) {
       NotifyServiceManager("RELOADING=1");
       load();
+      tree.LogChoices();
       sync.Wrote(NowMs());
       syslog(LOG_INFO, "catalogue reloaded: watching %zu directories for %zu queues", tree.size(),
              reporter.size());

@@ -1153,11 +1153,12 @@ TEST_F(DaemonTest, ServesWholeFileSystemsWithFanotify) {
   Register("ram", "/tmp/ram", IN_CREATE);
   auto daemon =
       std::make_unique<Daemon>(Lines{"--json", "--retry", "0.05", "--backend", "fanotify"});
+  // Each tree's backend is logged once the daemon is ready.
+  ASSERT_TRUE(daemon->Logged("ready:"));
   ASSERT_TRUE(daemon->Logged("tree \"/tmp/all/r\" is served by fanotify: --backend fanotify"));
   ASSERT_TRUE(daemon->Logged("tree \"/tmp/all/t\" is served by fanotify: --backend fanotify"));
   ASSERT_TRUE(daemon->Logged(
       "tree \"/tmp/ram\" is served by inotify: its file system gives no file handles"));
-  ASSERT_TRUE(daemon->Logged("ready:"));
 
   // Every file written at once in new directories ten deep, and nothing
   // from outside the trees.
@@ -1236,6 +1237,7 @@ TEST_F(DaemonTest, ServesWholeFileSystemsWithFanotify) {
   ASSERT_TRUE(Put("/tmp/all/t/c3/offline", ""));
   Register("all", "/tmp/all", IN_CREATE, nullptr, "fall");
   daemon = std::make_unique<Daemon>(Lines{"--json"});
+  ASSERT_TRUE(daemon->Logged("ready:"));
   ASSERT_TRUE(
       daemon->Logged("tree \"/tmp/all\" is served by fanotify: it is a whole file system, with "
                      "file handles"));
@@ -1244,7 +1246,6 @@ TEST_F(DaemonTest, ServesWholeFileSystemsWithFanotify) {
       "serves"));
   ASSERT_TRUE(daemon->Logged(
       "tree \"/tmp/ram\" is served by inotify: its file system gives no file handles"));
-  ASSERT_TRUE(daemon->Logged("ready:"));
   // The file made while no daemon ran comes as an offline record, or its
   // tree is named for a rescan when the first daemon stopped before it
   // could save its view of the tree (its walk after the overflow was not

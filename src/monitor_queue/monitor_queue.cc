@@ -11,7 +11,7 @@ int LOG_LEVEL = 3;
 
 MonitorQueue::MonitorQueue(const Json::Value& value) {
   if (!value.isObject()) return;
-  _name = value.get("queue", "").asString();
+  _name = value["queue"].asString();  // in place; null when missing: ""
   // Read in place: a copy of the array would duplicate every configuration.
   const Json::Value& configs = value["config"];  // null when missing
   if (!configs.isArray()) return;

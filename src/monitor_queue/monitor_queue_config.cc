@@ -21,9 +21,10 @@ void ReleaseRegexes(std::vector<regex_t>& regexes) {
 MonitorQueue::MonitorQueueConfig::MonitorQueueConfig(const Json::Value& value)
     : _mask(0), _prepared(false) {
   if (!value.isObject()) return;
-  const Json::Value& ignore = value["ignore"];  // null when missing, read in place
-  _path = value.get("path", "").asString();
-  _mask = value.get("mask", 0).asUInt();
+  // Members read in place (null when missing: "" and 0), not copied out.
+  const Json::Value& ignore = value["ignore"];
+  _path = value["path"].asString();
+  _mask = value["mask"].asUInt();
   if (ignore.isArray()) {
     _ignore.reserve(ignore.size());
     for (Json::Value::ArrayIndex i = 0; i < ignore.size(); ++i) {
