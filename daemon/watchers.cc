@@ -159,7 +159,15 @@ void Watchers::Sync(const std::vector<std::string>& roots,
 }
 
 void Watchers::LogChoices() {
-  for (const std::string& line : unlogged_) syslog(LOG_INFO, "%s", line.c_str());
+  // A catalogue of thousands of trees must not flood the log at each start:
+  // the first lines, then how many more the status reply lists.
+  constexpr size_t kMaxLines = 20;
+  for (size_t i = 0; i < unlogged_.size() && i < kMaxLines; ++i) {
+    syslog(LOG_INFO, "%s", unlogged_[i].c_str());
+  }
+  if (unlogged_.size() > kMaxLines) {
+    syslog(LOG_INFO, "and %zu trees more, as the status reply lists", unlogged_.size() - kMaxLines);
+  }
   unlogged_.clear();
 }
 

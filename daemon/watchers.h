@@ -60,8 +60,8 @@ class Watchers {
   void Sync(const std::vector<std::string>& roots,
             const ZORV::ZORVNOTIFYD::MonitorQueueIndex& index);
   // Logs the choices Sync made that differ from the earlier ones, a line
-  // per tree: thousands of lines for a large catalogue, which the daemon
-  // writes once it is ready rather than before.
+  // per tree for the first 20, then one line with the count of the rest.
+  // The daemon calls it once it is ready rather than before.
   void LogChoices();
   // Both watchers' periodic checks.
   void Tick(EventSink& sink) {
