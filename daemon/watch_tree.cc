@@ -17,6 +17,7 @@
 #include "directory.h"
 #include "offline_changes.h"
 #include "text.h"
+#include "tree_lister.h"
 
 namespace zorvnotifyd {
 namespace {
@@ -249,6 +250,7 @@ size_t WatchTree::Compare() {
   if (snapshot_ == nullptr || sink_ == nullptr) return 0;
   size_t compared = 0;
   reading_ahead_ = true;
+  TreeLister lister;
   for (const std::string& root : roots) {
     // A tree gone or replaced since its walk is watched afresh by Tick,
     // which compares it then.
@@ -269,8 +271,12 @@ size_t WatchTree::Compare() {
       const auto names = at == by_path_.end() ? live_.end() : live_.find(at->second);
       return names == live_.end() ? nullptr : &names->second;
     });
-    std::vector<std::pair<dev_t, ino_t>> ancestors;
-    CompareDir(dir.get(), root, changes, ancestors);
+    // Every event of a directory from before its listing is read before
+    // the listing is compared; reading as the listing goes keeps the
+    // kernel's queue from filling.
+    ListedDir* top = lister.List(std::move(dir), [this] { ReadAhead(); });
+    ReadAhead();
+    if (top->listed) CompareListed(*top, root, changes);
     ++compared;
     if (known == Snapshot::Known::kSaved) {
       changes.Finish(*sink_);
@@ -295,36 +301,25 @@ void WatchTree::ReadAhead() {
   }
 }
 
-void WatchTree::CompareDir(int dir, const std::string& path, OfflineChanges& changes,
-                           std::vector<std::pair<dev_t, ino_t>>& ancestors) {
-  struct stat st;
-  if (fstat(dir, &st) != 0) return;
-  const std::pair<dev_t, ino_t> id(st.st_dev, st.st_ino);
-  for (const auto& ancestor : ancestors) {
-    if (ancestor == id) return;  // a bind mount of a directory inside itself
-  }
-  SnapshotListing listing;
-  listing.ino = st.st_ino;
-  ListWithStatus(dir, &listing);
-  // Every event of this directory from before its listing is read now.
-  ReadAhead();
-  const auto watch = by_inode_.find(id);
+void WatchTree::CompareListed(ListedDir& dir, const std::string& path, OfflineChanges& changes) {
+  const auto watch = by_inode_.find({dir.dev, ino_t(dir.listing.ino)});
   const auto names = watch == by_inode_.end() ? live_.end() : live_.find(watch->second);
   const LiveNames* live = names == live_.end() ? nullptr : &names->second;
-  const SnapshotListing& seen = changes.Directory(path, std::move(listing), live);
-  ancestors.push_back(id);
+  // The listing moves into the snapshot; the subdirectories' nodes follow
+  // its entries' order.
+  const SnapshotListing& seen = changes.Directory(path, std::move(dir.listing), live);
+  auto sub = dir.subdirs.begin();
   for (const SnapshotEntry& entry : seen.entries) {
     if (!entry.is_dir) continue;
+    ListedDir& below = **sub++;
     // Made since its parent was watched: its event scans it.
     const auto told = live == nullptr ? LiveNames::const_iterator() : live->find(entry.name);
     if (live != nullptr && told != live->end() && (told->second & (IN_CREATE | IN_MOVED_TO)) &&
-        by_inode_.count({st.st_dev, ino_t(entry.ino)}) == 0) {
+        by_inode_.count({dir.dev, ino_t(entry.ino)}) == 0) {
       continue;
     }
-    UniqueFd sub = OpenSubdir(dir, entry.name);
-    if (sub.get() >= 0) CompareDir(sub.get(), path + "/" + entry.name, changes, ancestors);
+    if (below.listed) CompareListed(below, path + "/" + entry.name, changes);
   }
-  ancestors.pop_back();
 }
 
 void WatchTree::Clear() {

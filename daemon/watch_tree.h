@@ -26,6 +26,7 @@ namespace zorvnotifyd {
 using zorvcommon::UniqueFd;
 
 class OfflineChanges;
+struct ListedDir;
 
 // Opens an inotify instance, non-blocking and close-on-exec.  On failure
 // logs why (naming the kernel limit when it is the instance limit) and
@@ -246,10 +247,10 @@ class WatchTree {
   // entries as Found; with |compare| and a snapshot, compares it with the
   // snapshot instead.  False (with |why|) when the root cannot be opened.
   bool WatchRootTree(const std::string& root, WalkContext& context, std::string* why, bool compare);
-  // Compares the open directory |dir| at |path| and those below it, for
-  // Compare, without following links.
-  void CompareDir(int dir, const std::string& path, OfflineChanges& changes,
-                  std::vector<std::pair<dev_t, ino_t>>& ancestors);
+  // Compares the listed directory |dir| at |path| and those below it, for
+  // Compare, in the walk's order (names sorted, parents first); the
+  // listings move into the snapshot.
+  void CompareListed(ListedDir& dir, const std::string& path, OfflineChanges& changes);
   // Reads the events queued now into pending_ (up to a bound), noting the
   // kinds of each name in live_.
   void ReadAhead();
