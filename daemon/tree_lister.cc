@@ -19,11 +19,13 @@ TreeLister::~TreeLister() {
   if (worker_.joinable()) worker_.join();
 }
 
-ListedDir* TreeLister::List(UniqueFd root, const std::function<void()>& between) {
+ListedDir* TreeLister::List(UniqueFd root, const std::function<void()>& between,
+                            std::function<void()> beside) {
   std::unique_lock<std::mutex> lock(mutex_);
   // The worker is idle between calls: nothing refers to the nodes.
   nodes_.clear();
   ListedDir* top = &nodes_.emplace_back();
+  beside_ = std::move(beside);
   lock.unlock();
   ListInto(top, std::make_shared<const UniqueFd>(std::move(root)));
   between();
@@ -50,6 +52,16 @@ void TreeLister::Work() {
 }
 
 bool TreeLister::RunOne(std::unique_lock<std::mutex>& lock, const std::function<void()>* between) {
+  if (beside_) {
+    const std::function<void()> beside = std::move(beside_);
+    beside_ = nullptr;
+    ++busy_;
+    lock.unlock();
+    beside();
+    lock.lock();
+    if (--busy_ == 0 && stack_.empty() && waiting_ > 0) changed_.notify_all();
+    return true;
+  }
   if (stack_.empty()) return false;
   Item item = std::move(stack_.back());
   stack_.pop_back();

@@ -51,9 +51,11 @@ class TreeLister {
   // Lists the open directory |root| and every directory below it, each
   // opened through its parent without following a symbolic link, and
   // returns the root's node (never null).  |between| runs on the calling
-  // thread after each directory that thread lists.  The nodes stay valid
-  // until the next call or the lister's end.
-  ListedDir* List(UniqueFd root, const std::function<void()>& between);
+  // thread after each directory that thread lists; |beside| runs once, on
+  // either thread, while the listing goes on, and is done when List
+  // returns.  The nodes stay valid until the next call or the lister's end.
+  ListedDir* List(UniqueFd root, const std::function<void()>& between,
+                  std::function<void()> beside);
 
  private:
   // A directory to open and list: |name| in the directory |parent|, which
@@ -66,8 +68,8 @@ class TreeLister {
 
   // The worker's loop: lists what the stack holds until stopped.
   void Work();
-  // Takes the next item and lists it, |lock| released meanwhile; false
-  // when the stack is empty.
+  // Runs |beside_| or takes the next item and lists it, |lock| released
+  // meanwhile; false when there was nothing to do.
   bool RunOne(std::unique_lock<std::mutex>& lock, const std::function<void()>* between);
   // Lists the open directory |dir| into |node| and stacks its
   // subdirectories.
@@ -76,6 +78,7 @@ class TreeLister {
   std::mutex mutex_;
   std::condition_variable changed_;  // work stacked, the last item done, or stop
   std::vector<Item> stack_;          // directories to list, next at the back
+  std::function<void()> beside_;     // List's |beside|, until a thread takes it
   size_t busy_ = 0;                  // items being listed
   size_t waiting_ = 0;               // threads waiting on changed_
   bool stop_ = false;

@@ -262,8 +262,17 @@ size_t WatchTree::Compare() {
         watches_.at(watched->second).ino != st.st_ino) {
       continue;
     }
+    // Every event of a directory from before its listing is read before
+    // the listing is compared; reading as the listing goes keeps the
+    // kernel's queue from filling.  The saved view is loaded meanwhile
+    // (nothing else touches the snapshot while the tree is listed).
     Snapshot::Known known;
-    OfflineChanges changes(snapshot_->Tree(root, &known));
+    TreeSnapshot* saved = nullptr;
+    ListedDir* top = lister.List(
+        std::move(dir), [this] { ReadAhead(); },
+        [this, &root, &known, &saved] { saved = snapshot_->Tree(root, &known); });
+    ReadAhead();
+    OfflineChanges changes(saved);
     // A directory not met again is known by the path it was watched at:
     // its events are not handled yet.
     changes.set_live([this](const std::string& path) -> const LiveNames* {
@@ -271,11 +280,6 @@ size_t WatchTree::Compare() {
       const auto names = at == by_path_.end() ? live_.end() : live_.find(at->second);
       return names == live_.end() ? nullptr : &names->second;
     });
-    // Every event of a directory from before its listing is read before
-    // the listing is compared; reading as the listing goes keeps the
-    // kernel's queue from filling.
-    ListedDir* top = lister.List(std::move(dir), [this] { ReadAhead(); });
-    ReadAhead();
     if (top->listed) CompareListed(*top, root, changes);
     ++compared;
     if (known == Snapshot::Known::kSaved) {
