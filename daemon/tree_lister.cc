@@ -3,7 +3,9 @@
 #include "tree_lister.h"
 
 #include <sys/stat.h>
+#include <syslog.h>
 
+#include <system_error>
 #include <utility>
 
 #include "directory.h"
@@ -31,7 +33,7 @@ ListedDir* TreeLister::List(UniqueFd root, const std::function<void()>& between,
   between();
   lock.lock();
   for (;;) {
-    if (stack_.size() > 1 && !worker_.joinable()) worker_ = std::thread(&TreeLister::Work, this);
+    if (stack_.size() > 1 && !worker_.joinable() && !alone_) StartWorker();
     if (RunOne(lock, &between)) continue;
     if (busy_ == 0) break;
     ++waiting_;
@@ -39,6 +41,16 @@ ListedDir* TreeLister::List(UniqueFd root, const std::function<void()>& between,
     --waiting_;
   }
   return top;
+}
+
+void TreeLister::StartWorker() {
+  try {
+    worker_ = std::thread(&TreeLister::Work, this);
+  } catch (const std::system_error& error) {
+    alone_ = true;
+    syslog(LOG_WARNING, "cannot start a thread to list the trees: %s: listing them on one",
+           error.what());
+  }
 }
 
 void TreeLister::Work() {

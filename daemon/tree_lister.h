@@ -66,6 +66,9 @@ class TreeLister {
     std::string name;
   };
 
+  // Starts the worker, with |mutex_| held; when the system refuses a
+  // thread (logged), the calling thread lists alone from then on.
+  void StartWorker();
   // The worker's loop: lists what the stack holds until stopped.
   void Work();
   // Runs |beside_| or takes the next item and lists it, |lock| released
@@ -82,6 +85,7 @@ class TreeLister {
   size_t busy_ = 0;                  // items being listed
   size_t waiting_ = 0;               // threads waiting on changed_
   bool stop_ = false;
+  bool alone_ = false;           // the worker could not be started
   std::deque<ListedDir> nodes_;  // the current tree's, never moved
   std::thread worker_;
 };
