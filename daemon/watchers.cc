@@ -103,6 +103,12 @@ void Watchers::Sync(const std::vector<std::string>& roots,
       // Looked for again by the watcher chosen.
       choice = backend_ == Backend::kFanotify ? Choice{kFanotify, "--backend fanotify"}
                                               : Choice{kInotify, "it is missing"};
+    } else if (backend_ == Backend::kAuto && outer == nullptr && !IsFileSystemRoot(dir.get())) {
+      // Asked first: one statx tells most trees apart without the file
+      // handle and file-system probes below.
+      choice.why =
+          "it is a part of its file system (fanotify would pay for the events of the rest; "
+          "--backend fanotify serves it so)";
     } else if (!FanotifySupports(dir.get(), &why)) {
       choice.why = why;
     } else if (backend_ == Backend::kFanotify) {
@@ -110,10 +116,6 @@ void Watchers::Sync(const std::vector<std::string>& roots,
     } else if (outer != nullptr) {
       choice = {kFanotify,
                 "it lies in tree " + zorvcommon::Quoted(*outer) + ", which fanotify serves"};
-    } else if (!IsFileSystemRoot(dir.get())) {
-      choice.why =
-          "it is a part of its file system (fanotify would pay for the events of the rest; "
-          "--backend fanotify serves it so)";
     } else {
       choice = {kFanotify, "it is a whole file system, with file handles"};
     }
