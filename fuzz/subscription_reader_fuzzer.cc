@@ -4,15 +4,19 @@
 // The first byte chooses how the stream is cut into reads.  Checked: no
 // line handed out is longer than the bound, nor does the reader take
 // bytes once a line overruns it; a record the reader accepts is one that
-// jsoncpp's strict reader accepts too (duplicate unknown members and
-// depth aside), with the same numbers and booleans, and with the same
+// jsoncpp's strict reader accepts too (duplicate unknown members, depth
+// and numbers beyond a double's range aside), with the same numbers and booleans, and with the same
 // strings where the line has no \u escape; reading is deterministic, and a
 // record reused for the next line carries nothing of the last one.
 
 #include <algorithm>
+#include <cerrno>
+#include <cmath>
 #include <cstddef>
 #include <cstdint>
+#include <cstdlib>
 #include <memory>
+#include <regex>
 #include <string>
 
 #include <json/json.h>
@@ -28,6 +32,19 @@ using zorv_fuzz::Check;
 
 namespace {
 
+// True when jsoncpp's |errors| refuse a number that JSON's grammar allows
+// but a double cannot hold (1e400): the reader skips such a number in a
+// member it does not know, as it may.
+bool BeyondDouble(const std::string& errors) {
+  static const std::regex kRefused(
+      "'(-?(0|[1-9][0-9]*)(\\.[0-9]+)?([eE][+-]?[0-9]+)?)' is not a number\\.");
+  std::smatch match;
+  if (!std::regex_search(errors, match, kRefused)) return false;
+  errno = 0;
+  const double value = std::strtod(match[1].str().c_str(), nullptr);
+  return errno == ERANGE && std::isinf(value);
+}
+
 // Compares what |record| read of |line| with jsoncpp's reading.
 void CrossCheck(const std::string& line, const WireRecord& record) {
   Json::CharReaderBuilder builder;
@@ -38,8 +55,9 @@ void CrossCheck(const std::string& line, const WireRecord& record) {
   const std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
   Json::Value value;
   std::string errors;
-  Check(reader->parse(line.data(), line.data() + line.size(), &value, &errors) && value.isObject(),
-        "an accepted record is strict JSON");
+  const bool parsed = reader->parse(line.data(), line.data() + line.size(), &value, &errors);
+  if (!parsed && BeyondDouble(errors)) return;
+  Check(parsed && value.isObject(), "an accepted record is strict JSON");
   auto number = [&](const char* key, bool has, uint64_t got) {
     Check(has == value.isMember(key), "a number is seen as jsoncpp sees it");
     if (has) Check(value[key].isUInt64() && value[key].asUInt64() == got, "the same number");
