@@ -4,6 +4,7 @@
 #define ZORVNOTIFYD_DAEMON_DIRECTORY_H_
 
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "unique_fd.h"
@@ -11,6 +12,18 @@
 namespace zorvnotifyd {
 
 using zorvcommon::UniqueFd;
+
+// Calls |visit| with each leading part of the absolute |path| that ends
+// where a component does, shortest first: "/a", "/a/b", then "/a/b/c" for
+// "/a/b/c".  The trees that hold |path| are rooted at some of them ("/" is
+// never a tree).  Stops early when |visit| returns false.
+template <typename Visit>
+void ForEachLeadingPath(std::string_view path, Visit visit) {
+  for (size_t end = path.find('/', 1);; end = path.find('/', end + 1)) {
+    if (!visit(path.substr(0, end == std::string_view::npos ? path.size() : end))) return;
+    if (end == std::string_view::npos) return;
+  }
+}
 
 // Opens the directory |path| for reading and for openat(), following
 // symbolic links (the path of a configured tree, which root chose).

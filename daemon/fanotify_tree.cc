@@ -799,18 +799,18 @@ void FanotifyTree::Relist() {
       bool listed = false;
       // The trees that hold |path|: their roots are |path| or one of its
       // ancestors, found by one lookup each, outermost first.
-      for (size_t end = 1; end <= path.size(); ++end) {
-        if (end < path.size() && path[end] != '/') continue;
-        const auto found = snapshot_->trees().find(std::string_view(path).substr(0, end));
-        if (found == snapshot_->trees().end()) continue;
+      ForEachLeadingPath(path, [&](std::string_view prefix) {
+        const auto found = snapshot_->trees().find(prefix);
+        if (found == snapshot_->trees().end()) return true;
         const std::string& root = found->first;
         TreeSnapshot* tree = found->second.get();
         if (!listed) {
           const UniqueFd dir = OpenBelow(root, path);
           struct stat st;
-          if (dir.get() < 0 || fstat(dir.get(), &st) != 0) break;  // its parent's listing tells
+          if (dir.get() < 0 || fstat(dir.get(), &st) != 0)
+            return false;  // its parent's listing tells
           listing.ino = st.st_ino;
-          if (!(listed = ListWithStatus(dir.get(), &listing))) break;
+          if (!(listed = ListWithStatus(dir.get(), &listing))) return false;
         }
         auto& dirs = tree->dirs();
         const auto old = dirs.find(path);
@@ -832,7 +832,8 @@ void FanotifyTree::Relist() {
           if (known == dirs.end() || known->second.ino != entry.ino) next.push_back(child);
         }
         tree->Put(path, listing);
-      }
+        return true;
+      });
     }
     work = std::move(next);
   }

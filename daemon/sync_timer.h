@@ -28,9 +28,11 @@ class SyncTimer {
   // When the next sync is due (milliseconds of the caller's clock), or -1
   // when nothing waits.
   int64_t due() const { return due_ms_; }
-  // Syncs when due at |now_ms|.
-  void RunIfDue(int64_t now_ms) {
-    if (due_ms_ >= 0 && now_ms >= due_ms_) Run(now_ms);
+  // Syncs when due at |now_ms|; true when it did.
+  bool RunIfDue(int64_t now_ms) {
+    if (due_ms_ < 0 || now_ms < due_ms_) return false;
+    Run(now_ms);
+    return true;
   }
   // Syncs now.
   void Run(int64_t now_ms) {

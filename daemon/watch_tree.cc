@@ -436,10 +436,10 @@ uint32_t WatchTree::MaskFor(const std::string& dir) const {
 
 std::string WatchTree::RootOf(const std::string& dir) const {
   size_t found = 0;
-  for (size_t i = 1; i <= dir.size(); ++i) {
-    if (i < dir.size() && dir[i] != '/') continue;
-    if (roots_.find(std::string_view(dir).substr(0, i)) != roots_.end()) found = i;
-  }
+  ForEachLeadingPath(dir, [this, &found](std::string_view prefix) {
+    if (roots_.find(prefix) != roots_.end()) found = prefix.size();
+    return true;
+  });
   return dir.substr(0, found);
 }
 
@@ -754,7 +754,6 @@ void WatchTree::Relist() {
     std::string path;
   };
   std::vector<std::string> work = snapshot_->TakeDirty();
-  std::string root;  // each ancestor of a path, shortest first
   ParentDir parent;  // the parent of the directory last listed
   while (!work.empty()) {
     std::unordered_map<uint64_t, Place> left;
@@ -764,15 +763,11 @@ void WatchTree::Relist() {
       bool listed = false;
       // The trees holding |path| are those rooted at it or at an ancestor:
       // looked up one by one, not found by walking every tree.
-      for (size_t end = path.find('/', 1);; end = path.find('/', end + 1)) {
-        root.assign(path, 0, end == std::string::npos ? path.size() : end);
+      ForEachLeadingPath(path, [&](std::string_view root) {
         const auto found = snapshot_->trees().find(root);
-        if (found == snapshot_->trees().end()) {
-          if (end == std::string::npos) break;  // |path| itself, the last
-          continue;
-        }
+        if (found == snapshot_->trees().end()) return true;
         const std::unique_ptr<TreeSnapshot>& tree = found->second;
-        if (!listed && !(listed = ListWatched(path, &listing, &parent))) break;
+        if (!listed && !(listed = ListWatched(path, &listing, &parent))) return false;
         auto& dirs = tree->dirs();
         const auto old = dirs.find(path);
         if (old != dirs.end()) {
@@ -794,8 +789,8 @@ void WatchTree::Relist() {
           }
         }
         tree->Put(path, listing);
-        if (end == std::string::npos) break;
-      }
+        return true;
+      });
     }
     work.clear();
     // Forget what left first: a directory replaced under the same name

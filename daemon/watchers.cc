@@ -78,18 +78,17 @@ void Watchers::Sync(const std::vector<std::string>& roots,
   const bool can = backend_ != Backend::kInotify && fanotify_.Open(&cannot);
   std::vector<std::string> sorted(roots);
   std::sort(sorted.begin(), sorted.end());
-  std::map<std::string, Choice> chosen;
+  std::map<std::string, Choice, std::less<>> chosen;
   for (const std::string& root : sorted) {
     // The innermost tree chosen already that holds this one: its nearest
     // ancestor among them (ancestors sort first, so all are chosen by now),
-    // looked up by each of its leading paths in turn, longest first.
+    // looked up by each of its leading paths.
     const std::string* outer = nullptr;
-    for (size_t end = root.size(); outer == nullptr && end > 0;) {
-      end = root.rfind('/', end - 1);
-      if (end == std::string::npos) break;
-      const auto found = chosen.find(root.substr(0, std::max<size_t>(end, 1)));
-      if (found != chosen.end() && Below(root, found->first)) outer = &found->first;
-    }
+    ForEachLeadingPath(root, [&](std::string_view prefix) {
+      const auto found = chosen.find(prefix);
+      if (found != chosen.end() && prefix.size() < root.size()) outer = &found->first;
+      return true;
+    });
     const UniqueFd dir = OpenConfiguredDir(root);
     std::string why;
     Choice choice{kInotify, ""};

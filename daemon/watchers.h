@@ -107,8 +107,8 @@ class Watchers {
   WatchTree inotify_;
   FanotifyTree fanotify_;
   Backend backend_;
-  std::map<std::string, Choice> chosen_;  // by root
-  std::vector<std::string> unlogged_;     // lines of new choices, for LogChoices
+  std::map<std::string, Choice, std::less<>> chosen_;  // by root
+  std::vector<std::string> unlogged_;                  // lines of new choices, for LogChoices
 };
 
 }  // namespace zorvnotifyd

@@ -387,8 +387,7 @@ int Serve(const Options& options) {
     if (logs.Settle()) server.Deliver();
     // The group sync reads the events queued by then; their records go out
     // now, not with the next event or tick.
-    sync.RunIfDue(NowMs());
-    server.Deliver();
+    if (sync.RunIfDue(NowMs())) server.Deliver();
     if (options.out != Stdout::kNone && (fflush(stdout) != 0 || ferror(stdout))) {
       syslog(LOG_ERR, "cannot write the report to standard output: stopping");
       tree.Clear();
