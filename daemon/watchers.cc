@@ -2,6 +2,7 @@
 
 #include "watchers.h"
 
+#include <errno.h>
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <syslog.h>
@@ -26,6 +27,28 @@ bool Below(const std::string& path, const std::string& top) {
   if (top == "/") return path.size() > 1;
   return path.size() > top.size() && path.compare(0, top.size(), top) == 0 &&
          path[top.size()] == '/';
+}
+
+constexpr const char* kPartWhy =
+    "it is a part of its file system (fanotify would pay for the events of the rest; "
+    "--backend fanotify serves it so)";
+
+// What one statx of a configured tree's path, followed as its open follows
+// it, tells without opening it.
+enum class Look {
+  kMissing,  // no directory there: the open would fail
+  kPart,     // a directory the kernel says is not the root of a mount
+  kAsk,      // the open directory must be asked
+};
+
+Look LookAt(const std::string& path) {
+  struct statx stx;
+  if (statx(AT_FDCWD, path.c_str(), AT_STATX_DONT_SYNC, STATX_TYPE, &stx) != 0) {
+    return errno == ENOENT || errno == ENOTDIR || errno == ELOOP ? Look::kMissing : Look::kAsk;
+  }
+  if (!S_ISDIR(stx.stx_mode)) return Look::kMissing;
+  const bool known = stx.stx_attributes_mask & STATX_ATTR_MOUNT_ROOT;
+  return known && !(stx.stx_attributes & STATX_ATTR_MOUNT_ROOT) ? Look::kPart : Look::kAsk;
 }
 
 // True when the open directory |dir| is the root of its file system, as
@@ -89,7 +112,6 @@ void Watchers::Sync(const std::vector<std::string>& roots,
       if (found != chosen.end() && prefix.size() < root.size()) outer = &found->first;
       return true;
     });
-    const UniqueFd dir = OpenConfiguredDir(root);
     std::string why;
     Choice choice{kInotify, ""};
     if (outer != nullptr && chosen[*outer].backend == kInotify) {
@@ -98,25 +120,28 @@ void Watchers::Sync(const std::vector<std::string>& roots,
       choice.why = "--backend inotify";
     } else if (!can) {
       choice.why = cannot;
-    } else if (dir.get() < 0) {
-      // Looked for again by the watcher chosen.
-      choice = backend_ == Backend::kFanotify ? Choice{kFanotify, "--backend fanotify"}
-                                              : Choice{kInotify, "it is missing"};
-    } else if (backend_ == Backend::kAuto && outer == nullptr && !IsFileSystemRoot(dir.get())) {
-      // Asked first: one statx tells most trees apart without the file
-      // handle and file-system probes below.
-      choice.why =
-          "it is a part of its file system (fanotify would pay for the events of the rest; "
-          "--backend fanotify serves it so)";
-    } else if (!FanotifySupports(dir.get(), &why)) {
-      choice.why = why;
-    } else if (backend_ == Backend::kFanotify) {
-      choice = {kFanotify, "--backend fanotify"};
-    } else if (outer != nullptr) {
-      choice = {kFanotify,
-                "it lies in tree " + zorvcommon::Quoted(*outer) + ", which fanotify serves"};
     } else {
-      choice = {kFanotify, "it is a whole file system, with file handles"};
+      // Asked first: one statx of the path tells most trees apart without
+      // opening them or probing file handles and file systems below.
+      const bool top = backend_ == Backend::kAuto && outer == nullptr;
+      const Look look = top ? LookAt(root) : Look::kAsk;
+      const UniqueFd dir = look == Look::kAsk ? OpenConfiguredDir(root) : UniqueFd();
+      if (look == Look::kMissing || (look == Look::kAsk && dir.get() < 0)) {
+        // Looked for again by the watcher chosen.
+        choice = backend_ == Backend::kFanotify ? Choice{kFanotify, "--backend fanotify"}
+                                                : Choice{kInotify, "it is missing"};
+      } else if (look == Look::kPart || (top && !IsFileSystemRoot(dir.get()))) {
+        choice.why = kPartWhy;
+      } else if (!FanotifySupports(dir.get(), &why)) {
+        choice.why = why;
+      } else if (backend_ == Backend::kFanotify) {
+        choice = {kFanotify, "--backend fanotify"};
+      } else if (outer != nullptr) {
+        choice = {kFanotify,
+                  "it lies in tree " + zorvcommon::Quoted(*outer) + ", which fanotify serves"};
+      } else {
+        choice = {kFanotify, "it is a whole file system, with file handles"};
+      }
     }
     chosen[root] = choice;
   }
@@ -153,6 +178,12 @@ void Watchers::Sync(const std::vector<std::string>& roots,
         before->second.why == choice.why) {
       continue;
     }
+    // Only the lines LogChoices prints are made: a catalogue of thousands
+    // of trees would otherwise build thousands of them at every start.
+    if (unlogged_.size() == kMaxChoiceLines) {
+      ++unlogged_more_;
+      continue;
+    }
     unlogged_.push_back("tree " + zorvcommon::Quoted(root) + " is served by " + choice.backend +
                         ": " + choice.why);
   }
@@ -160,16 +191,12 @@ void Watchers::Sync(const std::vector<std::string>& roots,
 }
 
 void Watchers::LogChoices() {
-  // A catalogue of thousands of trees must not flood the log at each start:
-  // the first lines, then how many more the status reply lists.
-  constexpr size_t kMaxLines = 20;
-  for (size_t i = 0; i < unlogged_.size() && i < kMaxLines; ++i) {
-    syslog(LOG_INFO, "%s", unlogged_[i].c_str());
-  }
-  if (unlogged_.size() > kMaxLines) {
-    syslog(LOG_INFO, "and %zu trees more, as the status reply lists", unlogged_.size() - kMaxLines);
+  for (const std::string& line : unlogged_) syslog(LOG_INFO, "%s", line.c_str());
+  if (unlogged_more_ > 0) {
+    syslog(LOG_INFO, "and %zu trees more, as the status reply lists", unlogged_more_);
   }
   unlogged_.clear();
+  unlogged_more_ = 0;
 }
 
 void Watchers::AppendStatus(std::string* out) const {

@@ -108,7 +108,11 @@ class Watchers {
   FanotifyTree fanotify_;
   Backend backend_;
   std::map<std::string, Choice, std::less<>> chosen_;  // by root
-  std::vector<std::string> unlogged_;                  // lines of new choices, for LogChoices
+  // A catalogue of thousands of trees must not flood the log at each start:
+  // LogChoices prints the first lines of new choices, then how many more.
+  static constexpr size_t kMaxChoiceLines = 20;
+  std::vector<std::string> unlogged_;  // the first lines of new choices
+  size_t unlogged_more_ = 0;           // how many new choices more
 };
 
 }  // namespace zorvnotifyd
