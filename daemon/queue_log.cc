@@ -2,7 +2,10 @@
 
 #include "queue_log.h"
 
+#include <syslog.h>
+
 #include <algorithm>
+#include <system_error>
 
 #include "json_writer.h"
 #include "text.h"
@@ -104,40 +107,29 @@ void QueueLogs::UseJournals(int dir, uint64_t size, std::string boot,
 
 void QueueLogs::Follow(const Catalogue& catalogue, std::vector<QueueLog*>* by_position,
                        std::vector<QueueLog*>* created) {
-  std::map<QueueLog*, bool> was_present;
+  Opened();  // an earlier Follow's journals first
+  was_present_.clear();
   for (auto& [key, log] : logs_) {
-    was_present[log.get()] = log->present;
+    was_present_[log.get()] = log->present;
     log->present = false;
     log->trees.clear();
   }
   by_position->clear();
-  std::vector<QueueLog*> damaged;
   for (const CatalogueQueue& entry : catalogue) {
     const std::string key = Key(entry.type, entry.file, entry.queue._name);
     std::unique_ptr<QueueLog>& log = logs_[key];
     if (!log) {
       const auto before = forgotten_.find(key);
-      uint64_t last_seq = before == forgotten_.end() ? 0 : before->second;
-      std::unique_ptr<Journal> journal;
-      JournalStart start;
+      const uint64_t last_seq = before == forgotten_.end() ? 0 : before->second;
+      log = std::make_unique<QueueLog>(entry.type, entry.file, entry.queue._name, keep_, last_seq);
       if (journal_dir_ >= 0) {
         const std::string shown = "queue " + zorvcommon::Quoted(entry.queue._name) + " (" +
                                   zorvcommon::QueueTypeName(entry.type) + "/" +
                                   zorvcommon::Printable(entry.file) + ")";
-        journal = std::make_unique<Journal>(journal_dir_, key, shown, journal_size_, boot_);
-        start = journal->Open();
-        last_seq = std::max(last_seq, start.last_seq);
-        order_ = std::max(order_, start.last_order);
+        opening_.push_back(
+            {log.get(), std::make_unique<Journal>(journal_dir_, key, shown, journal_size_, boot_),
+             JournalStart()});
       }
-      log = std::make_unique<QueueLog>(entry.type, entry.file, entry.queue._name, keep_, last_seq);
-      if (journal) {
-        log->UseJournal(std::move(journal), &written_);
-        NeedsSync(log.get());  // opening may have made or replaced its files
-      }
-      log->Skip(start.last_record + 1, start.last_seq + 1);
-      if (start.damaged) damaged.push_back(log.get());
-      // A client's "since" for this queue means nothing now.
-      if (start.lost && renew_) journal_id_ = renew_();
       created->push_back(log.get());
     }
     log->present = true;
@@ -148,12 +140,47 @@ void QueueLogs::Follow(const Catalogue& catalogue, std::vector<QueueLog*>* by_po
     }
     by_position->push_back(log.get());
   }
+  following_ = true;
+  // Each journal opened is a few reads: a thousand new queues take a while,
+  // which the caller's walk of the trees may spend meanwhile.
+  if (opening_.size() < kOpenAside) return Opened();
+  try {
+    opener_ = std::thread([this] {
+      for (Opening& opening : opening_) opening.start = opening.journal->Open();
+    });
+  } catch (const std::system_error& error) {
+    syslog(LOG_WARNING, "cannot open the journals aside (%s): they are opened in turn",
+           error.what());
+  }
+}
+
+void QueueLogs::FinishFollow() {
+  following_ = false;
+  if (opener_.joinable()) {
+    opener_.join();
+  } else {
+    for (Opening& opening : opening_) opening.start = opening.journal->Open();
+  }
+  std::vector<QueueLog*> damaged;
+  for (Opening& opening : opening_) {
+    QueueLog* log = opening.log;
+    const JournalStart& start = opening.start;
+    log->NumberAfter(std::max(log->last_seq(), start.last_seq));
+    order_ = std::max(order_, start.last_order);
+    log->UseJournal(std::move(opening.journal), &written_);
+    NeedsSync(log);  // opening may have made or replaced its files
+    log->Skip(start.last_record + 1, start.last_seq + 1);
+    if (start.damaged) damaged.push_back(log);
+    // A client's "since" for this queue means nothing now.
+    if (start.lost && renew_) journal_id_ = renew_();
+  }
+  opening_.clear();
   // What a damaged journal lost is not known: its queue rescans its trees.
   for (QueueLog* log : damaged) log->AddRescans(NextOrder());
   for (auto it = logs_.begin(); it != logs_.end();) {
     QueueLog& log = *it->second;
-    const auto before = was_present.find(&log);
-    if (before != was_present.end() && before->second != log.present && log.followers > 0) {
+    const auto before = was_present_.find(&log);
+    if (before != was_present_.end() && before->second != log.present && log.followers > 0) {
       log.AddNotice(log.present ? "registered" : "removed", NextOrder());
     }
     if (!log.present && log.followers == 0) {
@@ -163,6 +190,7 @@ void QueueLogs::Follow(const Catalogue& catalogue, std::vector<QueueLog*>* by_po
       ++it;
     }
   }
+  was_present_.clear();
 }
 
 void QueueLogs::Forget(std::map<std::string, std::unique_ptr<QueueLog>>::iterator it) {
@@ -176,6 +204,7 @@ void QueueLogs::Forget(std::map<std::string, std::unique_ptr<QueueLog>>::iterato
 }
 
 void QueueLogs::WriteOut() {
+  Opened();
   if (written_.empty()) return;
   unsynced_ = true;
   for (QueueLog* log : written_) {
@@ -188,6 +217,7 @@ void QueueLogs::WriteOut() {
 }
 
 void QueueLogs::BeforeSend() {
+  Opened();
   for (QueueLog* log : written_) {
     if (log->journal()->NeedsSyncFor(log->last_seq())) log->journal()->Sync();
   }
@@ -201,6 +231,7 @@ void QueueLogs::NeedsSync(QueueLog* log) {
 }
 
 void QueueLogs::Sync() {
+  Opened();
   unsynced_ = false;
   std::vector<QueueLog*> logs;
   logs.swap(to_sync_);
@@ -212,6 +243,7 @@ void QueueLogs::Sync() {
 }
 
 bool QueueLogs::Settle() {
+  Opened();
   bool added = false;
   for (auto it = degraded_.begin(); it != degraded_.end();) {
     QueueLog* log = *it;
@@ -229,6 +261,7 @@ bool QueueLogs::Settle() {
 }
 
 void QueueLogs::Close() {
+  Opened();
   if (closed_) return;
   closed_ = true;
   for (auto& [key, log] : logs_) {
@@ -284,6 +317,7 @@ std::vector<QueueLog*> QueueLogs::Find(const std::string& name, const QueueType*
 }
 
 void QueueLogs::Unfollow(QueueLog* log) {
+  Opened();
   if (--log->followers > 0 || log->present) return;
   for (auto it = logs_.begin(); it != logs_.end(); ++it) {
     if (it->second.get() == log) {

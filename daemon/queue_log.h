@@ -12,6 +12,7 @@
 #include <map>
 #include <memory>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "catalogue.h"
@@ -62,6 +63,8 @@ class QueueLog {
   // Numbers from |from| to before |to| were never given to a record (the
   // numbering went on past a damaged journal): a client is not told of
   // them as missed.
+  // The next record is numbered |last_seq| + 1; only before the first.
+  void NumberAfter(uint64_t last_seq) { next_seq_ = last_seq + 1; }
   void Skip(uint64_t from, uint64_t to) {
     skipped_from_ = from;
     skipped_to_ = to;
@@ -176,8 +179,18 @@ class QueueLogs {
   // one file).  A followed queue that left the catalogue gets a "removed"
   // notice, one that came back a "registered" notice; logs no longer
   // present nor followed are forgotten.  |created| gets the new logs.
+  // The journals of many new queues are opened on a thread of their own
+  // meanwhile: the logs are usable, and the notices and forgetting done,
+  // once Opened returns, which the caller must call before it records,
+  // reads or syncs any log (each call below that changes the logs calls
+  // it first).
   void Follow(const Catalogue& catalogue, std::vector<QueueLog*>* by_position,
               std::vector<QueueLog*>* created);
+  // Waits for the journals the last Follow opens, and finishes it.  Cheap
+  // when it has nothing left to do.
+  void Opened() {
+    if (following_) FinishFollow();
+  }
 
   // The logs of queue |name|, of type |type| and file |file| when given.
   std::vector<QueueLog*> Find(const std::string& name, const QueueType* type,
@@ -186,17 +199,39 @@ class QueueLogs {
   // A client stopped following |log|: forgets it when it left the catalogue.
   void Unfollow(QueueLog* log);
 
-  // A number for the next record of any queue.
-  uint64_t NextOrder() { return ++order_; }
+  // A number for the next record of any queue.  Every record takes one
+  // first, so the logs are usable (Opened) by then.
+  uint64_t NextOrder() {
+    Opened();
+    return ++order_;
+  }
 
  private:
+  // Opened's work: the journals' findings into their logs, then the
+  // notices and the forgetting.
+  void FinishFollow();
   // Keeps the last number of the log at |it| for a queue that comes back,
   // and closes its journal; the caller erases it.
   void Forget(std::map<std::string, std::unique_ptr<QueueLog>>::iterator it);
   // Puts |log| on the list of journals the next Sync syncs, once.
   void NeedsSync(QueueLog* log);
 
+  // A journal of a new queue being opened by Follow, and what it found.
+  struct Opening {
+    QueueLog* log;
+    std::unique_ptr<Journal> journal;
+    JournalStart start;
+  };
+  // Fewer new journals than this are opened in turn, without a thread.
+  static constexpr size_t kOpenAside = 2;
+
   size_t keep_;
+  // A Follow not finished by Opened yet: |opening_| belongs to |opener_|
+  // (when it runs) until Opened joins it.
+  bool following_ = false;
+  std::vector<Opening> opening_;
+  std::thread opener_;
+  std::map<QueueLog*, bool> was_present_;  // for the notices of a Follow
   uint64_t order_ = 0;
   int journal_dir_ = -1;
   uint64_t journal_size_ = 0;

@@ -292,7 +292,8 @@ int Serve(const Options& options) {
     const std::vector<std::string> roots = loader.Honour(&catalogue);
     std::vector<QueueLog*> created;
     reporter.Use(std::move(catalogue), &created);
-    tree.Sync(roots, reporter.index());
+    tree.Sync(roots, reporter.index());  // while the new queues' journals open aside
+    logs.Opened();
     server.FollowNew(created);
   };
   tree.CompareLater();
