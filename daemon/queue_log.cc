@@ -143,7 +143,7 @@ void QueueLogs::Follow(const Catalogue& catalogue, std::vector<QueueLog*>* by_po
   following_ = true;
   // Each journal opened is a few reads: a thousand new queues take a while,
   // which the caller's walk of the trees may spend meanwhile.
-  if (opening_.size() < kOpenAside) return Opened();
+  if (opening_.empty()) return Opened();
   try {
     opener_ = std::thread([this] {
       for (Opening& opening : opening_) opening.start = opening.journal->Open();

@@ -179,7 +179,7 @@ class QueueLogs {
   // one file).  A followed queue that left the catalogue gets a "removed"
   // notice, one that came back a "registered" notice; logs no longer
   // present nor followed are forgotten.  |created| gets the new logs.
-  // The journals of many new queues are opened on a thread of their own
+  // The journals of new queues are opened on a thread of their own
   // meanwhile: the logs are usable, and the notices and forgetting done,
   // once Opened returns, which the caller must call before it records,
   // reads or syncs any log (each call below that changes the logs calls
@@ -222,8 +222,6 @@ class QueueLogs {
     std::unique_ptr<Journal> journal;
     JournalStart start;
   };
-  // Fewer new journals than this are opened in turn, without a thread.
-  static constexpr size_t kOpenAside = 2;
 
   size_t keep_;
   // A Follow not finished by Opened yet: |opening_| belongs to |opener_|
