@@ -5,6 +5,7 @@
 
 #include <stdint.h>
 
+#include <deque>
 #include <exception>
 #include <string>
 #include <string_view>
@@ -18,38 +19,6 @@ using Config = MonitorQueue::MonitorQueueConfig;
 
 bool IsSpace(char c) { return c == ' ' || c == '\t' || c == '\n' || c == '\r'; }
 
-// The number of objects directly inside the outermost array of a text in
-// the subset: room to reserve, so that appending never copies the queues.
-// Any other text gives some count; only the speed depends on it.
-size_t CountQueues(const char* p, const char* end) {
-  size_t count = 0;
-  int depth = 0;
-  for (; p != end; ++p) {
-    switch (*p) {
-      case '"':  // to the closing quote, over escaped bytes
-        for (++p; p != end && *p != '"'; ++p) {
-          if (*p == '\\' && ++p == end) return count;
-        }
-        if (p == end) return count;
-        break;
-      case '{':
-        if (depth == 1) ++count;
-        ++depth;
-        break;
-      case '[':
-        ++depth;
-        break;
-      case ']':
-      case '}':
-        --depth;
-        break;
-      default:
-        break;
-    }
-  }
-  return count;
-}
-
 // Reads one text from its start.  Every function returns false at the
 // first byte outside the subset, leaving the position anywhere.
 class Parser {
@@ -57,7 +26,7 @@ class Parser {
   Parser(const char* text, size_t size) : p_(text), end_(text + size) {}
 
   // The whole text: the array, then whitespace to the end.
-  bool File(std::vector<MonitorQueue>& queues) {
+  bool File(std::deque<MonitorQueue>& queues) {
     const bool ok = Array([&] {
       queues.emplace_back(Json::Value::nullSingleton());  // name "", no configurations
       return Queue(queues.back());
@@ -226,15 +195,22 @@ class Parser {
 }  // namespace
 
 bool ParseQueueFileSubset(const char* text, size_t size, std::vector<MonitorQueue>& queues) {
-  const size_t before = queues.size();
   try {
-    queues.reserve(before + CountQueues(text, text + size));
-    if (Parser(text, size).File(queues)) return true;
+    // Built apart, in a deque, which never copies a queue as it grows (a
+    // MonitorQueue has no move), so that a refused text leaves |queues| as
+    // it was, capacity included.
+    std::deque<MonitorQueue> parsed;
+    if (!Parser(text, size).File(parsed)) return false;
+    queues.reserve(queues.size() + parsed.size());
+    for (MonitorQueue& queue : parsed) {  // nothing below allocates
+      queues.emplace_back(Json::Value::nullSingleton());
+      queues.back()._name.swap(queue._name);
+      queues.back()._configs.swap(queue._configs);
+    }
+    return true;
   } catch (const std::exception&) {
-    // Out of memory: the general reader decides, as for any refused text.
+    return false;  // out of memory: the JSON reader decides, as for any refused text
   }
-  while (queues.size() > before) queues.pop_back();
-  return false;
 }
 
 }  // namespace ZORVNOTIFYD

@@ -29,8 +29,7 @@ namespace ZORVNOTIFYD {
 // Appends to |queues| one queue per element of the queue-file text of
 // |size| bytes at |text| and returns true when the text lies in the subset
 // above.  Otherwise (and when memory runs out) returns false with |queues|
-// holding the queues it held before and no other; its capacity may have
-// grown.
+// untouched, capacity included.
 bool ParseQueueFileSubset(const char* text, size_t size, std::vector<MonitorQueue>& queues);
 
 }  // namespace ZORVNOTIFYD
