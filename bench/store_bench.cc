@@ -118,6 +118,24 @@ void ParseCatalogue(benchmark::State& state, int files) {
   state.SetLabel("read and parse each file");
 }
 
+void LoadFromFile(benchmark::State& state, int count) {
+  const std::string path = MakeQueueFile(count);
+  for (auto _ : state) {
+    std::vector<MonitorQueue> queues;
+    if (!MonitorQueue::LoadFromFile(queues, path) || queues.size() != static_cast<size_t>(count)) {
+      state.SkipWithError("LoadFromFile failed");
+      break;
+    }
+  }
+  state.SetLabel("queue file of " + std::to_string(count) + " queues");
+}
+
+void ParseQueueFile(benchmark::State& state, int count) {
+  const std::string path = MakeQueueFile(count);
+  for (auto _ : state) benchmark::DoNotOptimize(ParseFile(path));
+  state.SetLabel("read and parse the file");
+}
+
 void Upsert(benchmark::State& state, int count) {
   MakeQueueFile(count);
   const MonitorQueue queue = MakeQueue("queue" + std::to_string(count / 2));
@@ -166,6 +184,8 @@ int main(int argc, char** argv) {
   }
   for (int count : {10, 100, 1000}) {
     const std::string suffix = "/" + std::to_string(count) + " queues";
+    Register("lib/LoadFromFile" + suffix, LoadFromFile, count);
+    Register("base/LoadFromFile" + suffix, ParseQueueFile, count);
     Register("lib/Upsert" + suffix, Upsert, count);
     Register("base/Upsert" + suffix, ParseAndWrite, count);
   }

@@ -47,10 +47,16 @@ static std::vector<MonitorQueue> Parse(const std::string& text) {
   return std::vector<MonitorQueue>(root.begin(), root.end());
 }
 
-// The records as comparable text.
+// The records as comparable text, their bytes as they are.
 static std::string Describe(const std::vector<MonitorQueue>& queues) {
   std::string out;
-  for (const MonitorQueue& queue : queues) out += queue.ToJson().toStyledString();
+  for (const MonitorQueue& queue : queues) {
+    out += "queue " + queue._name + "\n";
+    for (const auto& config : queue._configs) {
+      out += " path " + config._path + " mask " + std::to_string(config._mask) + "\n";
+      for (const std::string& pattern : config._ignore) out += "  ignore " + pattern + "\n";
+    }
+  }
   return out;
 }
 
@@ -63,7 +69,8 @@ TEST(QueueFileTest, LoadAppendsWhatAFileHoldsAndSaveWritesItBack) {
   std::vector<std::pair<std::string, std::string>> cases = {
       {"[]", "1 pre,"},
       {R"([{"queue":"a"},{"queue":"b"},{"queue":["c"]},{"queue":"d"}])", "0 pre,a,b,"},
-      {R"([1, "x", null, [], {"queue": "a"}, {"queue": "a"}])", "1 pre,,,,,a,a,"}};
+      {R"([1, "x", null, [], {"queue": "a"}, {"queue": "a"}])", "1 pre,,,,,a,a,"},
+      {R"([{"queue":"a"}, {"config":[{"mask":4294967296}]}, {"queue":"b"}])", "0 pre,a,"}};
   for (const char* bad : {"", "[{\"queue\": ", "[] []", "{}", "\"[]\"", "null"})
     cases.emplace_back(bad, "0 pre,");  // not JSON, or not an array
   for (const auto& [text, seen] : cases) {
@@ -72,6 +79,22 @@ TEST(QueueFileTest, LoadAppendsWhatAFileHoldsAndSaveWritesItBack) {
     std::string got = MonitorQueue::LoadFromFile(queues, kFile) ? "1 " : "0 ";
     for (const auto& q : queues) got += q._name + std::string(q._configs.size(), '+') + ",";
     EXPECT_EQ(got, seen) << text;
+  }
+  // Whatever reads a file, the records are those of the JSON reader's value:
+  // plain files with escapes, raw bytes and missing members, and files with
+  // comments, \u escapes, repeated keys (the last wins), other keys and
+  // numbers in other forms.
+  for (const std::string text :
+       {"[ {\"config\":[{},{\"ignore\":[]}]} "
+        ",\r\n\t{\"queue\":\"\\\"\\\\\\/\\b\\f\\n\\r\\t\x01\xff\","
+        "\"config\":[{\"mask\":0,\"ignore\":[\"\",\"a\"],\"path\":\"/p\"}]}]\n",
+        R"([{"queue":"a","queue":"b","config":[{"mask":7,"mask":9,"path":"x","path":"y"}]}])",
+        R"([{"queue":"a"}, {"queue":"\u00e9\ud83d\ude00\u0000x"}])",
+        R"([/**/{"queue":"a","x":1,"config":[{"mask":1e1},{"mask":0012}]}] // end)"}) {
+    std::ofstream(kFile) << text;
+    std::vector<MonitorQueue> queues = Parse(R"([{"queue": "pre"}])");
+    EXPECT_TRUE(MonitorQueue::LoadFromFile(queues, kFile)) << text;
+    EXPECT_EQ(Describe(queues), Describe(Parse(R"([{"queue": "pre"}])")) + Describe(Parse(text)));
   }
 
   const std::vector<MonitorQueue> saved = Parse(R"([

@@ -5,10 +5,12 @@
 #include <unistd.h>
 
 #include <exception>
+#include <string>
 
 #include "monitor_queue.h"
 #include "monitor_queue/log.h"
 #include "monitor_queue/privileged_section.h"
+#include "monitor_queue/queue_file_parser.h"
 #include "platform/platform.h"
 #include "platform/scoped.h"
 #include "syslog_percent_m.h"
@@ -48,7 +50,14 @@ bool MonitorQueue::LoadFromFile(std::vector<MonitorQueue>& queues, const std::st
   Json::Value root(Json::arrayValue);
   PrivilegedSection section(kSource, __LINE__);
   if (!RootCheck(kSource, __LINE__)) return false;
-  if (ZORBCFileExist(path.c_str()) == 1 && !platform::JsonFromFile(root, path)) return false;
+  if (ZORBCFileExist(path.c_str()) == 1) {
+    std::string text;
+    if (!platform::ReadRegularFile(path, text)) return false;
+    // Files in the form the library writes are read straight into records;
+    // the JSON reader decides every other text, the same bytes.
+    if (ParseQueueFileSubset(text.data(), text.size(), queues)) return true;
+    if (!platform::JsonFromText(root, text)) return false;
+  }
   if (!root.isArray()) return false;
   try {
     // Made in place, in room reserved: a MonitorQueue is copied, not moved.

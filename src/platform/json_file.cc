@@ -100,7 +100,7 @@ void RemoveAbandoned(const std::string& dir, const std::string& prefix) {
 
 }  // namespace
 
-bool JsonFromFile(Json::Value& value, const std::string& path) {
+bool ReadRegularFile(const std::string& path, std::string& text) {
   // Non-blocking, so that opening a fifo never waits for a writer; the type
   // and size are those of the file opened, not of whatever the path names
   // by then.  Only a regular file is read, and never past one byte over the
@@ -111,13 +111,16 @@ bool JsonFromFile(Json::Value& value, const std::string& path) {
       st.st_size > static_cast<off_t>(kMaxJsonFileSize)) {
     return false;
   }
-  std::string text;
-  text.reserve(static_cast<size_t>(st.st_size));
-  if (!ReadAll(fd.get(), text, kMaxJsonFileSize + 1) || text.size() > kMaxJsonFileSize) {
+  std::string read;
+  read.reserve(static_cast<size_t>(st.st_size));
+  if (!ReadAll(fd.get(), read, kMaxJsonFileSize + 1) || read.size() > kMaxJsonFileSize) {
     return false;
   }
-  fd.Reset();
+  text.swap(read);
+  return true;
+}
 
+bool JsonFromText(Json::Value& value, const std::string& text) {
   Json::CharReaderBuilder builder;
   builder["collectComments"] = false;
   builder["failIfExtra"] = true;
@@ -134,6 +137,11 @@ bool JsonFromFile(Json::Value& value, const std::string& path) {
   }
   value.swap(parsed);
   return true;
+}
+
+bool JsonFromFile(Json::Value& value, const std::string& path) {
+  std::string text;
+  return ReadRegularFile(path, text) && JsonFromText(value, text);
 }
 
 bool JsonToFile(const Json::Value& value, const std::string& path, ScopedFd& written) {

@@ -65,16 +65,30 @@ void SetLastError(unsigned int code, const char* file, int line);
 #define ZORB_SET_ERROR(code) ::ZORV::ZORVNOTIFYD::platform::SetLastError((code), __FILE__, __LINE__)
 #endif
 
-// The largest JSON file JsonFromFile reads, in bytes: 16 MiB, far more than
-// any catalogue needs, and a bound on the memory and time a load can take.
+// The largest file ReadRegularFile (and so JsonFromFile) reads, in bytes:
+// 16 MiB, far more than any catalogue needs, and a bound on the memory and
+// time a load can take.
 constexpr size_t kMaxJsonFileSize = size_t{16} << 20;
 
+// Replaces |text| with the bytes of the file at |path| (links are followed).
+// The file is opened without blocking and only a regular file is read, and
+// never more than one byte past kMaxJsonFileSize.  False, with |text|
+// unchanged, when the file cannot be opened or read, is not a regular file
+// (a fifo, a device, a directory) or holds more than kMaxJsonFileSize bytes.
+bool ReadRegularFile(const std::string& path, std::string& text);
+
+// Replaces |value| with the one JSON value |text| holds, read as the queue
+// files are: comments allowed, nothing but whitespace and comments after
+// the value.  False, with |value| unchanged, when |text| is not such a text
+// (an empty text included).
+bool JsonFromText(Json::Value& value, const std::string& text);
+
 // Replaces |value| with the JSON text of the file at |path| (links are
-// followed).  The whole file must be one valid JSON value: an empty file or
-// trailing garbage fails.  False when the file cannot be read or is not
-// valid JSON, and also, without blocking or reading it, when it is not a
-// regular file (a fifo, a device, a directory) or holds more than
-// kMaxJsonFileSize bytes.
+// followed): ReadRegularFile, then JsonFromText.  The whole file must be one
+// valid JSON value: an empty file or trailing garbage fails.  False when
+// the file cannot be read or is not valid JSON, and also, without blocking
+// or reading it, when it is not a regular file (a fifo, a device, a
+// directory) or holds more than kMaxJsonFileSize bytes.
 bool JsonFromFile(Json::Value& value, const std::string& path);
 
 // Writes |value| as JSON text to |path| atomically and durably: a temporary

@@ -1,0 +1,217 @@
+// The fast reader of queue files: a recursive-descent parser of the subset,
+// writing the records' members in place.
+
+#include "monitor_queue/queue_file_parser.h"
+
+#include <stdint.h>
+
+#include <deque>
+#include <exception>
+#include <string>
+#include <string_view>
+
+namespace ZORV {
+namespace ZORVNOTIFYD {
+
+namespace {
+
+using Config = MonitorQueue::MonitorQueueConfig;
+
+bool IsSpace(char c) { return c == ' ' || c == '\t' || c == '\n' || c == '\r'; }
+
+// Reads one text from its start.  Every function returns false at the
+// first byte outside the subset, leaving the position anywhere.
+class Parser {
+ public:
+  Parser(const char* text, size_t size) : p_(text), end_(text + size) {}
+
+  // The whole text: the array, then whitespace to the end.
+  bool File(std::deque<MonitorQueue>& queues) {
+    const bool ok = Array([&] {
+      queues.emplace_back(Json::Value::nullSingleton());  // name "", no configurations
+      return Queue(queues.back());
+    });
+    return ok && Peek() == '\0' && p_ == end_;
+  }
+
+ private:
+  // Skips whitespace; returns the byte there, or '\0' at the end.
+  char Peek() {
+    while (p_ != end_ && IsSpace(*p_)) ++p_;
+    return p_ != end_ ? *p_ : '\0';
+  }
+
+  // Skips whitespace and the byte |c|, which must be there.
+  bool Take(char c) {
+    if (Peek() != c) return false;
+    ++p_;
+    return true;
+  }
+
+  // "[", elements separated by ",", "]"; |element| reads one.
+  template <typename Element>
+  bool Array(Element element) {
+    if (!Take('[')) return false;
+    if (Take(']')) return true;
+    do {
+      if (!element()) return false;
+    } while (Take(','));
+    return Take(']');
+  }
+
+  // "{", members separated by ",", "}"; |member| reads the value of a key.
+  template <typename Member>
+  bool Object(Member member) {
+    if (!Take('{')) return false;
+    if (Take('}')) return true;
+    do {
+      std::string_view key;
+      if (!Key(key) || !Take(':') || !member(key)) return false;
+    } while (Take(','));
+    return Take('}');
+  }
+
+  // A key without escapes: an escape never yields the letters of a key the
+  // subset has, so a key with one is refused as any unknown key is.
+  bool Key(std::string_view& key) {
+    if (!Take('"')) return false;
+    const char* begin = p_;
+    while (p_ != end_ && *p_ != '"' && *p_ != '\\' && *p_ != '\0') ++p_;
+    if (p_ == end_ || *p_ != '"') return false;
+    key = std::string_view(begin, static_cast<size_t>(p_ - begin));
+    ++p_;
+    return true;
+  }
+
+  // A string, appended to |out|.
+  bool String(std::string& out) {
+    if (!Take('"')) return false;
+    for (;;) {
+      const char* run = p_;
+      while (p_ != end_ && *p_ != '"' && *p_ != '\\' && *p_ != '\0') ++p_;
+      out.append(run, static_cast<size_t>(p_ - run));
+      if (p_ == end_ || *p_ == '\0') return false;
+      if (*p_++ == '"') return true;
+      if (p_ == end_) return false;
+      switch (*p_++) {
+        case '"':
+          out.push_back('"');
+          break;
+        case '\\':
+          out.push_back('\\');
+          break;
+        case '/':
+          out.push_back('/');
+          break;
+        case 'b':
+          out.push_back('\b');
+          break;
+        case 'f':
+          out.push_back('\f');
+          break;
+        case 'n':
+          out.push_back('\n');
+          break;
+        case 'r':
+          out.push_back('\r');
+          break;
+        case 't':
+          out.push_back('\t');
+          break;
+        default:  // \u, or not an escape at all
+          return false;
+      }
+    }
+  }
+
+  // Digits of a value up to 4294967295, "0" or without a leading zero,
+  // followed by whitespace, "," or "}" (so no fraction or exponent).
+  bool Mask(unsigned int& mask) {
+    const char first = Peek();
+    if (first < '0' || first > '9') return false;
+    uint64_t value = 0;
+    if (first == '0') {
+      ++p_;
+    } else {
+      while (p_ != end_ && *p_ >= '0' && *p_ <= '9') {
+        value = value * 10 + static_cast<unsigned>(*p_++ - '0');
+        if (value > UINT32_MAX) return false;
+      }
+    }
+    if (p_ == end_ || !(IsSpace(*p_) || *p_ == ',' || *p_ == '}')) return false;
+    mask = static_cast<unsigned int>(value);
+    return true;
+  }
+
+  // A queue object into |queue|, which is empty.
+  bool Queue(MonitorQueue& queue) {
+    bool named = false;
+    bool configured = false;
+    return Object([&](std::string_view key) {
+      if (key == "queue" && !named) {
+        named = true;
+        return String(queue._name);
+      }
+      if (key == "config" && !configured) {
+        configured = true;
+        return Array([&] {
+          queue._configs.emplace_back(Json::Value::nullSingleton());  // "", 0, no patterns
+          return Configuration(queue._configs.back());
+        });
+      }
+      return false;  // another key, or one seen before
+    });
+  }
+
+  // A configuration object into |config|, which is empty.
+  bool Configuration(Config& config) {
+    bool has_path = false;
+    bool has_mask = false;
+    bool has_ignore = false;
+    return Object([&](std::string_view key) {
+      if (key == "path" && !has_path) {
+        has_path = true;
+        return String(config._path);
+      }
+      if (key == "mask" && !has_mask) {
+        has_mask = true;
+        return Mask(config._mask);
+      }
+      if (key == "ignore" && !has_ignore) {
+        has_ignore = true;
+        return Array([&] {
+          config._ignore.emplace_back();
+          return String(config._ignore.back());
+        });
+      }
+      return false;
+    });
+  }
+
+  const char* p_;
+  const char* const end_;
+};
+
+}  // namespace
+
+bool ParseQueueFileSubset(const char* text, size_t size, std::vector<MonitorQueue>& queues) {
+  try {
+    // Built apart, in a deque, which never copies a queue as it grows (a
+    // MonitorQueue has no move), so that a refused text leaves |queues| as
+    // it was, capacity included.
+    std::deque<MonitorQueue> parsed;
+    if (!Parser(text, size).File(parsed)) return false;
+    queues.reserve(queues.size() + parsed.size());
+    for (MonitorQueue& queue : parsed) {  // nothing below allocates
+      queues.emplace_back(Json::Value::nullSingleton());
+      queues.back()._name.swap(queue._name);
+      queues.back()._configs.swap(queue._configs);
+    }
+    return true;
+  } catch (const std::exception&) {
+    return false;  // out of memory: the JSON reader decides, as for any refused text
+  }
+}
+
+}  // namespace ZORVNOTIFYD
+}  // namespace ZORV
