@@ -2,10 +2,7 @@
 
 #include "queue_log.h"
 
-#include <syslog.h>
-
 #include <algorithm>
-#include <system_error>
 
 #include "json_writer.h"
 #include "text.h"
@@ -127,8 +124,7 @@ void QueueLogs::Follow(const Catalogue& catalogue, std::vector<QueueLog*>* by_po
                                   zorvcommon::QueueTypeName(entry.type) + "/" +
                                   zorvcommon::Printable(entry.file) + ")";
         opening_.push_back(
-            {log.get(), std::make_unique<Journal>(journal_dir_, key, shown, journal_size_, boot_),
-             JournalStart()});
+            {log.get(), std::make_unique<Journal>(journal_dir_, key, shown, journal_size_, boot_)});
       }
       created->push_back(log.get());
     }
@@ -140,31 +136,17 @@ void QueueLogs::Follow(const Catalogue& catalogue, std::vector<QueueLog*>* by_po
     }
     by_position->push_back(log.get());
   }
+  // The rest waits for Opened: opening a thousand journals is a few reads
+  // each, which need not delay the watches or the daemon's readiness.
   following_ = true;
-  // Each journal opened is a few reads: a thousand new queues take a while,
-  // which the caller's walk of the trees may spend meanwhile.
-  if (opening_.empty()) return Opened();
-  try {
-    opener_ = std::thread([this] {
-      for (Opening& opening : opening_) opening.start = opening.journal->Open();
-    });
-  } catch (const std::system_error& error) {
-    syslog(LOG_WARNING, "cannot open the journals aside (%s): they are opened in turn",
-           error.what());
-  }
 }
 
 void QueueLogs::FinishFollow() {
   following_ = false;
-  if (opener_.joinable()) {
-    opener_.join();
-  } else {
-    for (Opening& opening : opening_) opening.start = opening.journal->Open();
-  }
   std::vector<QueueLog*> damaged;
   for (Opening& opening : opening_) {
     QueueLog* log = opening.log;
-    const JournalStart& start = opening.start;
+    const JournalStart start = opening.journal->Open();
     log->NumberAfter(std::max(log->last_seq(), start.last_seq));
     order_ = std::max(order_, start.last_order);
     log->UseJournal(std::move(opening.journal), &written_);

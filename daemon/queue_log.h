@@ -12,7 +12,6 @@
 #include <map>
 #include <memory>
 #include <string>
-#include <thread>
 #include <vector>
 
 #include "catalogue.h"
@@ -179,15 +178,15 @@ class QueueLogs {
   // one file).  A followed queue that left the catalogue gets a "removed"
   // notice, one that came back a "registered" notice; logs no longer
   // present nor followed are forgotten.  |created| gets the new logs.
-  // The journals of new queues are opened on a thread of their own
-  // meanwhile: the logs are usable, and the notices and forgetting done,
-  // once Opened returns, which the caller must call before it records,
-  // reads or syncs any log (each call below that changes the logs calls
-  // it first).
+  // The new queues' journals are opened, and the notices and forgetting
+  // done, by Opened, which the caller must call before it reads or syncs
+  // any log (each call below that changes the logs calls it first, and
+  // every record does through NextOrder): opening a thousand journals
+  // need not delay the watches or the daemon's readiness.
   void Follow(const Catalogue& catalogue, std::vector<QueueLog*>* by_position,
               std::vector<QueueLog*>* created);
-  // Waits for the journals the last Follow opens, and finishes it.  Cheap
-  // when it has nothing left to do.
+  // Finishes the last Follow: opens the new queues' journals and numbers
+  // their logs after what they hold.  Cheap when it has nothing to do.
   void Opened() {
     if (following_) FinishFollow();
   }
@@ -216,19 +215,15 @@ class QueueLogs {
   // Puts |log| on the list of journals the next Sync syncs, once.
   void NeedsSync(QueueLog* log);
 
-  // A journal of a new queue being opened by Follow, and what it found.
+  // A journal of a new queue, made by Follow for Opened to open.
   struct Opening {
     QueueLog* log;
     std::unique_ptr<Journal> journal;
-    JournalStart start;
   };
 
   size_t keep_;
-  // A Follow not finished by Opened yet: |opening_| belongs to |opener_|
-  // (when it runs) until Opened joins it.
-  bool following_ = false;
+  bool following_ = false;  // a Follow not finished by Opened yet
   std::vector<Opening> opening_;
-  std::thread opener_;
   std::map<QueueLog*, bool> was_present_;  // for the notices of a Follow
   uint64_t order_ = 0;
   int journal_dir_ = -1;

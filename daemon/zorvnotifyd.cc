@@ -285,21 +285,30 @@ int Serve(const Options& options) {
   if (!server.Listen()) return 1;
   reporter.OnRecord([&server](QueueLog* log) { server.Recorded(log); });
   logs.OnRecord([&server](QueueLog* log) { server.Recorded(log); });
-  // Reads the catalogue, and makes the records, the watches and the
-  // clients' subscriptions follow it.
+  // Reads the catalogue, and makes the records and the watches follow it;
+  // returns the logs of the queues new to the daemon.
   auto load = [&] {
     Catalogue catalogue = loader.Load();
     const std::vector<std::string> roots = loader.Honour(&catalogue);
     std::vector<QueueLog*> created;
     reporter.Use(std::move(catalogue), &created);
-    tree.Sync(roots, reporter.index());  // while the new queues' journals open aside
+    tree.Sync(roots, reporter.index());
+    return created;
+  };
+  // Opens the new queues' journals and makes the clients' subscriptions
+  // follow the catalogue.
+  auto follow = [&](const std::vector<QueueLog*>& created) {
     logs.Opened();
     server.FollowNew(created);
   };
   tree.CompareLater();
-  load();
+  const std::vector<QueueLog*> created = load();
   syslog(LOG_INFO, "ready: watching %zu directories for %zu queues", tree.size(), reporter.size());
   NotifyServiceManager(ReadyState(tree.size(), reporter.size()));
+  // Once the watches are in place no change goes unseen: the journals are
+  // opened after, before any client is served or any event read (a record
+  // made meanwhile opens them first).
+  follow(created);
   tree.LogChoices();
   CompareAfterReady(tree);
   sync.Wrote(NowMs());  // the views of the trees compared
@@ -365,7 +374,7 @@ int Serve(const Options& options) {
     const bool changed = ready > 0 && (fds[2].revents & POLLIN) && catalogue_watch.ReadChanges();
     if (hangup || changed || (tick && catalogue_watch.WatchMissing())) {
       NotifyServiceManager("RELOADING=1");
-      load();
+      follow(load());
       tree.LogChoices();
       sync.Wrote(NowMs());
       syslog(LOG_INFO, "catalogue reloaded: watching %zu directories for %zu queues", tree.size(),
