@@ -2,6 +2,8 @@
 
 #include "watch_path.h"
 
+#include <string>
+#include <string_view>
 #include <vector>
 
 namespace zorvcommon {
@@ -28,6 +30,22 @@ std::string Normalised(const std::string& path) {
   return result.empty() ? "/" : result;
 }
 
+// True when |path| is absolute and already normal: a "/" and then
+// components that are neither empty, "." nor "..", with no "/" at the end
+// (so not "/" itself).  The common case, told without building the
+// normalised form.
+bool IsNormal(std::string_view path) {
+  if (path.size() < 2 || path[0] != '/' || path.back() == '/') return false;
+  for (size_t start = 1;;) {
+    size_t end = path.find('/', start);
+    if (end == std::string_view::npos) end = path.size();
+    const std::string_view part = path.substr(start, end - start);
+    if (part.empty() || part == "." || part == "..") return false;
+    if (end == path.size()) return true;
+    start = end + 1;
+  }
+}
+
 }  // namespace
 
 std::string WatchPathProblem(const std::string& path) {
@@ -41,6 +59,7 @@ std::string WatchPathProblem(const std::string& path) {
            "such as \"/" +
            path + "\"";
   }
+  if (IsNormal(path)) return "";
   const std::string normal = Normalised(path);
   if (normal == "/") {
     return "it is the root directory, which is never watched as a whole; name the directory "
