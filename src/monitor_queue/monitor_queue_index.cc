@@ -171,15 +171,19 @@ MonitorQueueIndex::MonitorQueueIndex(const std::vector<MonitorQueue>& queues) {
     for (const MonitorQueue::MonitorQueueConfig& config : queues[queue]._configs) {
       GroupKey key{config._mask, {}};
       for (const std::string& text : config._ignore) {
-        auto found = pattern_by_text.emplace(text.c_str(), kDropped);
-        if (found.second) {
-          auto pattern = std::make_unique<Pattern>(found.first->first);
+        // Looked up before it is added: most patterns recur across
+        // configurations, and an insertion attempt costs a node each time.
+        std::string seen(text.c_str());
+        auto found = pattern_by_text.find(seen);
+        if (found == pattern_by_text.end()) {
+          found = pattern_by_text.emplace(std::move(seen), kDropped).first;
+          auto pattern = std::make_unique<Pattern>(found->first);
           if (pattern->ok()) {
-            found.first->second = static_cast<uint32_t>(data->patterns.size());
+            found->second = static_cast<uint32_t>(data->patterns.size());
             data->patterns.push_back(std::move(pattern));
           }
         }
-        if (found.first->second != kDropped) key.second.push_back(found.first->second);
+        if (found->second != kDropped) key.second.push_back(found->second);
       }
       // Whether the patterns ignore a path depends neither on their order
       // nor on how often one is named.
