@@ -94,8 +94,9 @@ void WatchTree::Sync(const std::vector<std::string>& roots,
   synced_ = true;
   roots_ = std::set<std::string, std::less<>>(roots.begin(), roots.end());
   index_ = index;
-  std::set<int> synced;
-  std::set<std::string> visited;
+  // Looked up once per directory walked, so hashed rather than ordered.
+  std::unordered_set<int> synced(watches_.size());
+  std::unordered_set<std::string> visited(by_path_.size());
   std::set<std::string> tops;
   std::map<std::string, std::string> was_missing = std::move(missing_);
   std::map<std::string, size_t> was_limited = std::move(limited_);
@@ -588,10 +589,12 @@ int WatchTree::Add(int dir, const struct stat& st, const std::string& path, Walk
   by_inode_[id] = wd;
   if (context.synced != nullptr) context.synced->insert(wd);
   if (context.visited != nullptr) context.visited->insert(path);
-  const auto old = by_path_.find(path);
-  if (old != by_path_.end() && old->second != wd) Unmap(path, true, nullptr);  // replaced
+  const auto [known_path, added] = by_path_.try_emplace(path, wd);
+  if (!added && known_path->second != wd) {
+    Unmap(path, true, nullptr);  // replaced
+    by_path_[path] = wd;
+  }
   watch.paths.insert(path);
-  by_path_[path] = wd;
   if (!missing_.empty() && missing_.erase(path) != 0) {
     syslog(LOG_NOTICE, "watching tree %s again", Quoted(path).c_str());
   }
@@ -658,7 +661,7 @@ bool WatchTree::Move(const std::vector<std::string>& from, const std::vector<std
       continue;  // moved again since; its own events follow
     }
     WalkContext context;
-    std::set<int> synced;
+    std::unordered_set<int> synced;
     context.synced = &synced;  // an exact mask
     Add(dir.get(), st, path, context);
   }

@@ -15,6 +15,7 @@
 #include <string>
 #include <string_view>
 #include <unordered_map>
+#include <unordered_set>
 #include <vector>
 
 #include "monitor_queue_index.h"
@@ -209,16 +210,16 @@ class WatchTree {
   };
   // What one walk of a tree does (see Walk).
   struct WalkContext {
-    std::set<int>* synced = nullptr;           // Sync: watches given their exact mask this round
-    std::set<std::string>* visited = nullptr;  // Sync: every path watched this round
-    EventSink* found = nullptr;                // report entries as Found
-    size_t dirs = 0;                           // directories met
-    size_t unwatched = 0;                      // of which the watch limit refused
-    std::vector<std::string> tops;             // the highest unwatched directories
-    size_t in_unwatched = 0;                   // unwatched directories being walked
-    OfflineChanges* compare = nullptr;         // compare with the snapshot
-    std::vector<std::pair<dev_t, ino_t>> ancestors;  // loop guard
-    bool out_of_descriptors = false;                 // a subdirectory could not be opened, logged
+    std::unordered_set<int>* synced = nullptr;  // Sync: watches given their exact mask this round
+    std::unordered_set<std::string>* visited = nullptr;  // Sync: every path watched this round
+    EventSink* found = nullptr;                          // report entries as Found
+    size_t dirs = 0;                                     // directories met
+    size_t unwatched = 0;                                // of which the watch limit refused
+    std::vector<std::string> tops;                       // the highest unwatched directories
+    size_t in_unwatched = 0;                             // unwatched directories being walked
+    OfflineChanges* compare = nullptr;                   // compare with the snapshot
+    std::vector<std::pair<dev_t, ino_t>> ancestors;      // loop guard
+    bool out_of_descriptors = false;  // a subdirectory could not be opened, logged
   };
 
   // Reads one buffer of events into pending_.  False when nothing was read
