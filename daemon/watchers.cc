@@ -10,6 +10,8 @@
 #include <algorithm>
 #include <fstream>
 #include <sstream>
+#include <string_view>
+#include <unordered_map>
 #include <utility>
 
 #include "directory.h"
@@ -101,20 +103,31 @@ void Watchers::Sync(const std::vector<std::string>& roots,
   const bool can = backend_ != Backend::kInotify && fanotify_.Open(&cannot);
   std::vector<std::string> sorted(roots);
   std::sort(sorted.begin(), sorted.end());
-  std::map<std::string, Choice, std::less<>> chosen;
+  sorted.erase(std::unique(sorted.begin(), sorted.end()), sorted.end());
+  // The choice of each tree of |sorted|, and where each tree chosen is
+  // there: looking a path up hashes it, rather than comparing it with
+  // paths that share most of it along a tree of thousands.
+  std::vector<Choice> choices;
+  choices.reserve(sorted.size());
+  std::unordered_map<std::string_view, size_t> chosen_at;
+  chosen_at.reserve(sorted.size());
   for (const std::string& root : sorted) {
     // The innermost tree chosen already that holds this one: its nearest
     // ancestor among them (ancestors sort first, so all are chosen by now),
     // looked up by each of its leading paths.
     const std::string* outer = nullptr;
+    const Choice* outer_choice = nullptr;
     ForEachLeadingPath(root, [&](std::string_view prefix) {
-      const auto found = chosen.find(prefix);
-      if (found != chosen.end() && prefix.size() < root.size()) outer = &found->first;
+      const auto found = prefix.size() < root.size() ? chosen_at.find(prefix) : chosen_at.end();
+      if (found != chosen_at.end()) {
+        outer = &sorted[found->second];
+        outer_choice = &choices[found->second];
+      }
       return true;
     });
     std::string why;
     Choice choice{kInotify, ""};
-    if (outer != nullptr && chosen[*outer].backend == kInotify) {
+    if (outer != nullptr && outer_choice->backend == kInotify) {
       choice.why = "it lies in tree " + zorvcommon::Quoted(*outer) + ", which inotify serves";
     } else if (backend_ == Backend::kInotify) {
       choice.why = "--backend inotify";
@@ -143,7 +156,12 @@ void Watchers::Sync(const std::vector<std::string>& roots,
         choice = {kFanotify, "it is a whole file system, with file handles"};
       }
     }
-    chosen[root] = choice;
+    chosen_at.emplace(root, choices.size());
+    choices.push_back(std::move(choice));
+  }
+  std::map<std::string, Choice, std::less<>> chosen;
+  for (size_t i = 0; i < sorted.size(); ++i) {
+    chosen.emplace_hint(chosen.end(), std::move(sorted[i]), std::move(choices[i]));
   }
   // A tree fanotify refuses (a mark it cannot have) goes to inotify, and
   // the trees inside it with it, since inotify's walk covers them.
