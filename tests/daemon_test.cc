@@ -815,10 +815,16 @@ TEST_F(DaemonTest, ListensOnItsOwnSocketInARootOnlyDirectory) {
   }
 
   // Started by hand, without the runtime directory its service makes: the
-  // daemon makes it.
+  // daemon makes it.  Of 23 trees' watchers, 20 are logged, then a count.
+  for (int i = 0; i < 23; ++i) {
+    const std::string name = "t" + std::to_string(i);
+    Register(name.c_str(), ("/tmp/" + name).c_str(), IN_CREATE);
+  }
   Daemon by_hand({}, PrivateTmpfs("/run", "mode=0755"), nullptr);
   EXPECT_TRUE(by_hand.Logged("made the socket's directory \"/run/zorvnotifyd\""));
   ASSERT_TRUE(by_hand.Logged("ready:"));
+  EXPECT_TRUE(by_hand.Logged("tree \"/tmp/t6\" is served by inotify: "));  // the 20th by name
+  EXPECT_TRUE(by_hand.Logged("and 3 trees more, as the status reply lists"));
   const std::string run = "/proc/" + std::to_string(by_hand.pid()) + "/root/run/zorvnotifyd";
   struct stat st;
   ASSERT_EQ(lstat(run.c_str(), &st), 0);
