@@ -807,8 +807,8 @@ void FanotifyTree::Relist() {
         if (!listed) {
           const UniqueFd dir = OpenBelow(root, path);
           struct stat st;
-          if (dir.get() < 0 || fstat(dir.get(), &st) != 0)
-            return false;  // its parent's listing tells
+          // Gone since it was marked: its parent's listing tells.
+          if (dir.get() < 0 || fstat(dir.get(), &st) != 0) return false;
           listing.ino = st.st_ino;
           if (!(listed = ListWithStatus(dir.get(), &listing))) return false;
         }

@@ -59,11 +59,11 @@ class QueueLog {
   void ReadJournal(uint64_t seq, size_t max_bytes, std::deque<JournalRecord>* out) const {
     if (journal_) journal_->Read(seq, max_bytes, out);
   }
+  // The next record is numbered |last_seq| + 1; only before the first.
+  void NumberAfter(uint64_t last_seq) { next_seq_ = last_seq + 1; }
   // Numbers from |from| to before |to| were never given to a record (the
   // numbering went on past a damaged journal): a client is not told of
   // them as missed.
-  // The next record is numbered |last_seq| + 1; only before the first.
-  void NumberAfter(uint64_t last_seq) { next_seq_ = last_seq + 1; }
   void Skip(uint64_t from, uint64_t to) {
     skipped_from_ = from;
     skipped_to_ = to;
