@@ -8,14 +8,13 @@
 #include <syslog.h>
 
 #include <algorithm>
-#include <fstream>
-#include <sstream>
 #include <string_view>
 #include <unordered_map>
 #include <utility>
 
 #include "directory.h"
 #include "json_writer.h"
+#include "mount_table.h"
 #include "text.h"
 
 namespace zorvnotifyd {
@@ -31,32 +30,14 @@ bool Below(const std::string& path, const std::string& top) {
          path[top.size()] == '/';
 }
 
-constexpr const char* kPartWhy =
-    "it is a part of its file system (fanotify would pay for the events of the rest; "
-    "--backend fanotify serves it so)";
-
-// What one statx of a configured tree's path, followed as its open follows
-// it, tells without opening it.
-enum class Look {
-  kMissing,  // no directory there: the open would fail
-  kPart,     // a directory the kernel says is not the root of a mount
-  kAsk,      // the open directory must be asked
-};
-
-Look LookAt(const std::string& path) {
-  struct statx stx;
-  if (statx(AT_FDCWD, path.c_str(), AT_STATX_DONT_SYNC, STATX_TYPE, &stx) != 0) {
-    return errno == ENOENT || errno == ENOTDIR || errno == ELOOP ? Look::kMissing : Look::kAsk;
-  }
-  if (!S_ISDIR(stx.stx_mode)) return Look::kMissing;
-  const bool known = stx.stx_attributes_mask & STATX_ATTR_MOUNT_ROOT;
-  return known && !(stx.stx_attributes & STATX_ATTR_MOUNT_ROOT) ? Look::kPart : Look::kAsk;
-}
+constexpr const char* kNotMountPointWhy =
+    "it is not a mount point (fanotify would pay for the events of the rest of its file "
+    "system; --backend fanotify serves it so)";
 
 // True when the open directory |dir| is the root of its file system, as
-// mounted: a mount whose root is the file system's own (a bind mount of a
-// directory inside one is not).
-bool IsFileSystemRoot(int dir) {
+// mounted: a mount of |mounts| whose root is the file system's own (a bind
+// mount of a directory inside one is not).
+bool IsFileSystemRoot(int dir, const MountTable& mounts) {
   struct statx stx;
   if (statx(dir, "", AT_EMPTY_PATH | AT_STATX_DONT_SYNC, STATX_BASIC_STATS | STATX_MNT_ID, &stx) !=
           0 ||
@@ -66,17 +47,8 @@ bool IsFileSystemRoot(int dir) {
            (self.st_dev != parent.st_dev || self.st_ino == parent.st_ino);
   }
   if (!(stx.stx_attributes & STATX_ATTR_MOUNT_ROOT)) return false;
-  // "ID PARENT MAJOR:MINOR ROOT ..." in the mount table of the daemon.
-  std::ifstream table("/proc/self/mountinfo");
-  const std::string id = std::to_string(stx.stx_mnt_id) + " ";
-  for (std::string line; std::getline(table, line);) {
-    if (line.compare(0, id.size(), id) != 0) continue;
-    std::istringstream fields(line);
-    std::string skip, root;
-    fields >> skip >> skip >> skip >> root;
-    return root == "/";
-  }
-  return false;
+  const std::string* root = mounts.RootOf(stx.stx_mnt_id);
+  return root != nullptr && *root == "/";
 }
 
 }  // namespace
@@ -101,6 +73,12 @@ void Watchers::Sync(const std::vector<std::string>& roots,
                     const ZORV::ZORVNOTIFYD::MonitorQueueIndex& index) {
   std::string cannot;
   const bool can = backend_ != Backend::kInotify && fanotify_.Open(&cannot);
+  MountTable mounts;
+  std::string unread;
+  if (can && backend_ == Backend::kAuto && !mounts.Read(&unread)) {
+    syslog(LOG_WARNING, "cannot read the mount table (%s): inotify serves every tree",
+           unread.c_str());
+  }
   std::vector<std::string> sorted(roots);
   std::sort(sorted.begin(), sorted.end());
   sorted.erase(std::unique(sorted.begin(), sorted.end()), sorted.end());
@@ -134,17 +112,18 @@ void Watchers::Sync(const std::vector<std::string>& roots,
     } else if (!can) {
       choice.why = cannot;
     } else {
-      // Asked first: one statx of the path tells most trees apart without
-      // opening them or probing file handles and file systems below.
+      // The mount table tells most trees apart without a look at each.
       const bool top = backend_ == Backend::kAuto && outer == nullptr;
-      const Look look = top ? LookAt(root) : Look::kAsk;
-      const UniqueFd dir = look == Look::kAsk ? OpenConfiguredDir(root) : UniqueFd();
-      if (look == Look::kMissing || (look == Look::kAsk && dir.get() < 0)) {
+      const bool point = top && mounts.IsMountPoint(root);
+      const UniqueFd dir = !top || point ? OpenConfiguredDir(root) : UniqueFd();
+      if (top && !point) {
+        choice.why = kNotMountPointWhy;
+      } else if (dir.get() < 0) {
         // Looked for again by the watcher chosen.
         choice = backend_ == Backend::kFanotify ? Choice{kFanotify, "--backend fanotify"}
                                                 : Choice{kInotify, "it is missing"};
-      } else if (look == Look::kPart || (top && !IsFileSystemRoot(dir.get()))) {
-        choice.why = kPartWhy;
+      } else if (top && !IsFileSystemRoot(dir.get(), mounts)) {
+        choice.why = kNotMountPointWhy;
       } else if (!FanotifySupports(dir.get(), &why)) {
         choice.why = why;
       } else if (backend_ == Backend::kFanotify) {

@@ -1249,6 +1249,13 @@ TEST_F(DaemonTest, ServesWholeFileSystemsWithFanotify) {
   // with the snapshot, after ready.
   ASSERT_TRUE(Put("/tmp/all/t/c3/offline", ""));
   Register("all", "/tmp/all", IN_CREATE, nullptr, "fall");
+  // Mount points as the mount table spells them ("\040" for a space); a
+  // link to one is not a mount point.
+  ASSERT_EQ(std::system("mkdir '/tmp/sp ace' && mount -t tmpfs tmpfs '/tmp/sp ace' && "
+                        "ln -s '/tmp/sp ace' /tmp/lnk"),
+            0);
+  Register("sp", "/tmp/sp ace", IN_CREATE);
+  Register("lnk", "/tmp/lnk", IN_CREATE);
   daemon = std::make_unique<Daemon>(Lines{"--json"});
   ASSERT_TRUE(daemon->Logged("ready:"));
   ASSERT_TRUE(
@@ -1257,8 +1264,11 @@ TEST_F(DaemonTest, ServesWholeFileSystemsWithFanotify) {
   ASSERT_TRUE(daemon->Logged(
       "tree \"/tmp/all/r\" is served by fanotify: it lies in tree \"/tmp/all\", which fanotify "
       "serves"));
+  ASSERT_TRUE(daemon->Logged("tree \"/tmp/lnk\" is served by inotify: it is not a mount point"));
   ASSERT_TRUE(daemon->Logged(
       "tree \"/tmp/ram\" is served by inotify: its file system gives no file handles"));
+  ASSERT_TRUE(daemon->Logged(
+      "tree \"/tmp/sp ace\" is served by fanotify: it is a whole file system, with file handles"));
   // The file made while no daemon ran comes as an offline record, or its
   // tree is named for a rescan when the first daemon stopped before it
   // could save its view of the tree (its walk after the overflow was not
@@ -1268,14 +1278,14 @@ TEST_F(DaemonTest, ServesWholeFileSystemsWithFanotify) {
               std::count(offline.begin(), offline.end(), "t rescan /tmp/all/t") > 0)
       << ::testing::PrintToString(offline);
   const Json::Value trees = Status()["trees"];
-  ASSERT_EQ(trees.size(), 4u);
+  ASSERT_EQ(trees.size(), 6u);
   EXPECT_EQ(trees[0]["path"].asString() + " " + trees[0]["backend"].asString(),
             "/tmp/all fanotify");
-  EXPECT_EQ(trees[3]["path"].asString() + " " + trees[3]["backend"].asString(), "/tmp/ram inotify");
+  EXPECT_EQ(trees[4]["path"].asString() + " " + trees[4]["backend"].asString(), "/tmp/ram inotify");
   ASSERT_TRUE(Put("/tmp/all/out/x", ""));
   EXPECT_TRUE(daemon->Heard("all etc fall /tmp/all/out/x 256"));
   EXPECT_EQ(daemon->Stop(SIGTERM), 0);
-  EXPECT_EQ(std::system("umount /tmp/all /tmp/ram && rm /tmp/img"), 0);
+  EXPECT_EQ(std::system("umount /tmp/all /tmp/ram '/tmp/sp ace' && rm /tmp/img"), 0);
 }
 
 // The Python module and its example against this daemon, which

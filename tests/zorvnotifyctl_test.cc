@@ -295,11 +295,11 @@ TEST(ZorvnotifyctlTest, WatchAndStatusAskTheDaemon) {
   EXPECT_THAT(json.Read(), ::testing::HasSubstr(R"("path":"/tmp/wd/b\udcff")"));
   EXPECT_EQ(RunTool("--socket " + socket + " status", "", &out, &err), 0) << err;
   EXPECT_THAT(out, ::testing::ContainsRegex("\nqueues +1\n(.*\n)*state +ok\n"));
-  // A tree that is part of a file system stays with inotify by default
+  // A tree that is not a mount point stays with inotify by default
   // (under qemu-user there is no fanotify at all), and the table says why.
-  EXPECT_THAT(out, ::testing::ContainsRegex(
-                       "\n/tmp/wd  inotify  (it is a part of its file system \\(|the kernel "
-                       "has no fanotify\n)"));
+  EXPECT_THAT(
+      out, ::testing::ContainsRegex("\n/tmp/wd  inotify  (it is not a mount point \\(|the kernel "
+                                    "has no fanotify\n)"));
   EXPECT_THAT(out, ::testing::ContainsRegex("\nbackup \\[etc/nas\\] +1 +3 +[0-9]+ +ok\n"));
   EXPECT_EQ(daemon.Stop(SIGTERM), 0);
   EXPECT_EQ(json.Read(),
