@@ -95,8 +95,17 @@ void WatchTree::Sync(const std::vector<std::string>& roots,
   roots_ = std::set<std::string, std::less<>>(roots.begin(), roots.end());
   index_ = index;
   // Looked up once per directory walked, so hashed rather than ordered.
+  // A first Sync (nothing watched before) visits just what by_path_ will
+  // hold: it serves as the set of paths visited, with no copy of each.
+  const bool first = by_path_.empty();
   std::unordered_set<int> synced(watches_.size());
   std::unordered_set<std::string> visited(by_path_.size());
+  const auto was_visited = [&](const std::string& path) {
+    return first ? by_path_.count(path) != 0 : visited.count(path) != 0;
+  };
+  // In a first Sync, the roots met so far that hold the next one (they
+  // sort before it): only a root inside another can have been walked.
+  std::vector<const std::string*> enclosing;
   std::set<std::string> tops;
   std::map<std::string, std::string> was_missing = std::move(missing_);
   std::map<std::string, size_t> was_limited = std::move(limited_);
@@ -109,12 +118,23 @@ void WatchTree::Sync(const std::vector<std::string>& roots,
       missing_.insert(*known);
       continue;
     }
-    if (visited.count(root) != 0) continue;
+    if (first) {
+      const auto below = [&root](const std::string& top) {
+        return root.size() > top.size() && root.compare(0, top.size(), top) == 0 &&
+               root[top.size()] == '/';
+      };
+      while (!enclosing.empty() && !below(*enclosing.back())) enclosing.pop_back();
+      const bool inside = !enclosing.empty();
+      enclosing.push_back(&root);
+      if (inside && was_visited(root)) continue;
+    } else if (was_visited(root)) {
+      continue;
+    }
     WalkContext context;
     context.synced = &synced;
-    context.visited = &visited;
+    context.visited = first ? nullptr : &visited;
     std::string why;
-    if (!WatchRootTree(root, context, &why, by_path_.count(root) == 0)) {
+    if (!WatchRootTree(root, context, &why, first || by_path_.count(root) == 0)) {
       NoteRootMissing(root, why);
       continue;
     }
@@ -138,7 +158,7 @@ void WatchTree::Sync(const std::vector<std::string>& roots,
   // Paths not met in this round are no longer wanted, or no longer there.
   std::vector<std::string> stale;
   for (const auto& [path, wd] : by_path_) {
-    if (visited.count(path) == 0) stale.push_back(path);
+    if (!was_visited(path)) stale.push_back(path);
   }
   for (const std::string& path : stale) Unmap(path, true, nullptr);
   // Directories over the watch limit are rescanned when found so, and
@@ -589,8 +609,11 @@ int WatchTree::Add(int dir, const struct stat& st, const std::string& path, Walk
   by_inode_[id] = wd;
   if (context.synced != nullptr) context.synced->insert(wd);
   if (context.visited != nullptr) context.visited->insert(path);
-  const auto [known_path, added] = by_path_.try_emplace(path, wd);
-  if (!added && known_path->second != wd) {
+  // A walk meets paths mostly in their order: each is tried at the end
+  // first, which costs one comparison where a descent costs a dozen.
+  const size_t paths = by_path_.size();
+  const auto known_path = by_path_.try_emplace(by_path_.end(), path, wd);
+  if (by_path_.size() == paths && known_path->second != wd) {
     Unmap(path, true, nullptr);  // replaced
     by_path_[path] = wd;
   }

@@ -211,15 +211,16 @@ class WatchTree {
   // What one walk of a tree does (see Walk).
   struct WalkContext {
     std::unordered_set<int>* synced = nullptr;  // Sync: watches given their exact mask this round
-    std::unordered_set<std::string>* visited = nullptr;  // Sync: every path watched this round
-    EventSink* found = nullptr;                          // report entries as Found
-    size_t dirs = 0;                                     // directories met
-    size_t unwatched = 0;                                // of which the watch limit refused
-    std::vector<std::string> tops;                       // the highest unwatched directories
-    size_t in_unwatched = 0;                             // unwatched directories being walked
-    OfflineChanges* compare = nullptr;                   // compare with the snapshot
-    std::vector<std::pair<dev_t, ino_t>> ancestors;      // loop guard
-    bool out_of_descriptors = false;  // a subdirectory could not be opened, logged
+    // Sync: every path watched this round, when by_path_ held some before
+    std::unordered_set<std::string>* visited = nullptr;
+    EventSink* found = nullptr;                      // report entries as Found
+    size_t dirs = 0;                                 // directories met
+    size_t unwatched = 0;                            // of which the watch limit refused
+    std::vector<std::string> tops;                   // the highest unwatched directories
+    size_t in_unwatched = 0;                         // unwatched directories being walked
+    OfflineChanges* compare = nullptr;               // compare with the snapshot
+    std::vector<std::pair<dev_t, ino_t>> ancestors;  // loop guard
+    bool out_of_descriptors = false;                 // a subdirectory could not be opened, logged
   };
 
   // Reads one buffer of events into pending_.  False when nothing was read
@@ -305,13 +306,19 @@ class WatchTree {
   bool away_ = false;                         // Add moved the working directory away from home_
   std::set<std::string, std::less<>> roots_;  // the configured trees
   ZORV::ZORVNOTIFYD::MonitorQueueIndex index_{{}};
-  std::unordered_map<int, Watch> watches_;           // by watch descriptor
-  std::map<std::string, int> by_path_;               // watch descriptor by path
-  std::map<std::pair<dev_t, ino_t>, int> by_inode_;  // watch descriptor by directory
-  std::map<std::string, std::string> missing_;       // unwatched roots and why
-  std::map<std::string, size_t> limited_;            // roots the watch limit kept partly unwatched
-  EventQueue pending_;                               // events read but not yet handled
-  bool drained_ = false;                             // the last read left the kernel's queue empty
+  std::unordered_map<int, Watch> watches_;  // by watch descriptor
+  std::map<std::string, int> by_path_;      // watch descriptor by path
+  // Hashes a directory's device and inode.
+  struct InodeHash {
+    size_t operator()(const std::pair<dev_t, ino_t>& id) const {
+      return std::hash<uint64_t>()(uint64_t(id.second) * 0x9E3779B97F4A7C15u ^ uint64_t(id.first));
+    }
+  };
+  std::unordered_map<std::pair<dev_t, ino_t>, int, InodeHash> by_inode_;  // watch by directory
+  std::map<std::string, std::string> missing_;                            // unwatched roots and why
+  std::map<std::string, size_t> limited_;  // roots the watch limit kept partly unwatched
+  EventQueue pending_;                     // events read but not yet handled
+  bool drained_ = false;                   // the last read left the kernel's queue empty
   std::set<uint32_t> moves_;  // cookies of directory moves within the trees, already done
   std::string entry_path_;    // Handle's buffer for the path of an event's entry
   Snapshot* snapshot_ = nullptr;
