@@ -45,12 +45,7 @@ void Reporter::Use(Catalogue catalogue, std::vector<QueueLog*>* created) {
   logs_.Follow(catalogue, &logs_by_position_, created);
   catalogue_ = std::move(catalogue);
   found_wanted_.assign(catalogue_.size(), 0);
-  trees_.clear();
-  for (size_t i = 0; i < catalogue_.size(); ++i) {
-    const auto& configs = catalogue_[i].queue._configs;
-    for (size_t j = 0; j < configs.size(); ++j) trees_.emplace_back(configs[j]._path, i, j);
-  }
-  std::sort(trees_.begin(), trees_.end());
+  trees_.clear();  // made again by the first rescan
 }
 
 void Reporter::Record(size_t i, const std::string& path, uint32_t mask, uint64_t order,
@@ -148,6 +143,13 @@ void Reporter::Rescan(const std::string& path) {
   // the queue hears of nothing outside its trees.  (queue, rank, tree):
   // rank 0 for a tree holding |path|, 1 + position for one below it.
   std::vector<std::tuple<size_t, size_t, const std::string*>> hits;
+  if (trees_.empty()) {
+    for (size_t i = 0; i < catalogue_.size(); ++i) {
+      const auto& configs = catalogue_[i].queue._configs;
+      for (size_t j = 0; j < configs.size(); ++j) trees_.emplace_back(configs[j]._path, i, j);
+    }
+    std::sort(trees_.begin(), trees_.end());
+  }
   const auto add = [&](const std::string& tree, bool holds) {
     auto it =
         std::lower_bound(trees_.begin(), trees_.end(), tree,

@@ -85,7 +85,8 @@ class Reporter : public EventSink {
   std::vector<uint32_t> found_wanted_;  // per queue, for Found
   // Every configured tree as (path, queue, position in the queue), sorted:
   // a rescan finds the queues it concerns by its path's prefixes and the
-  // trees below it, not by a pass over every configuration.
+  // trees below it, not by a pass over every configuration.  Made by the
+  // first rescan after each Use, which a start-up need not wait for.
   std::vector<std::tuple<std::string, size_t, size_t>> trees_;
   std::string line_;  // reused for standard output
   uint64_t events_ = 0;
