@@ -111,7 +111,7 @@ Catalogue CatalogueLoader::Load() {
       if (catalogue.capacity() < needed) {
         catalogue.reserve(std::max(needed, 2 * catalogue.capacity()));
       }
-      for (const MonitorQueue& queue : queues) catalogue.push_back({type, file, queue});
+      for (const MonitorQueue& queue : queues) catalogue.emplace_back(type, file, queue);
       if (has_good) good[key] = std::move(queues);
     }
   }

@@ -22,6 +22,10 @@ using zorvcommon::QueueType;
 
 // One queue and where it is stored.
 struct CatalogueQueue {
+  // Made in place: MonitorQueue has no move, so a temporary costs a copy.
+  CatalogueQueue(QueueType type, std::string file, const ZORV::ZORVNOTIFYD::MonitorQueue& queue)
+      : type(type), file(std::move(file)), queue(queue) {}
+
   QueueType type;
   std::string file;  // the queue file's name in the configuration directory of |type|
   ZORV::ZORVNOTIFYD::MonitorQueue queue;
