@@ -195,12 +195,18 @@ MonitorQueueIndex::MonitorQueueIndex(const std::vector<MonitorQueue>& queues) {
       }
     }
   }
-  data->nodes.reserve(by_path.size());
-  for (const auto& entry : by_path) {
-    data->nodes.push_back({entry.first, Hash(entry.first), 0, 0, 0});
+  // The paths sorted by reference, each node then made once in its place
+  // (sorting the nodes would move their strings at every swap), with its
+  // groups at hand without a second lookup of its path.
+  std::vector<const decltype(by_path)::value_type*> sorted;
+  sorted.reserve(by_path.size());
+  for (const auto& entry : by_path) sorted.push_back(&entry);
+  std::sort(sorted.begin(), sorted.end(),
+            [](const auto* a, const auto* b) { return a->first < b->first; });
+  data->nodes.reserve(sorted.size());
+  for (const auto* entry : sorted) {
+    data->nodes.push_back({entry->first, Hash(entry->first), 0, 0, 0});
   }
-  std::sort(data->nodes.begin(), data->nodes.end(),
-            [](const IndexNode& a, const IndexNode& b) { return a.path < b.path; });
   size_t slots = 1;
   while (slots < 2 * data->nodes.size()) slots *= 2;
   data->slots.assign(data->nodes.empty() ? 0 : slots, 0);
@@ -235,7 +241,7 @@ MonitorQueueIndex::MonitorQueueIndex(const std::vector<MonitorQueue>& queues) {
       return chain_slots[i]++;
     };
     node.first_group = static_cast<uint32_t>(data->groups.size());
-    for (const auto& [key, members] : by_path[node.path]) {
+    for (const auto& [key, members] : sorted[i]->second) {
       const IndexGroup group{key.first, static_cast<uint32_t>(data->refs.size()),
                              static_cast<uint32_t>(key.second.size()),
                              static_cast<uint32_t>(data->queue_ids.size()),
