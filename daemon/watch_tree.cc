@@ -155,10 +155,12 @@ void WatchTree::Sync(const std::vector<std::string>& roots,
              context.unwatched, context.dirs, Quoted(root).c_str(), retry_seconds_);
     }
   }
-  // Paths not met in this round are no longer wanted, or no longer there.
+  // Paths not met in this round are no longer wanted, or no longer there;
+  // a first round met every path it holds.
   std::vector<std::string> stale;
   for (const auto& [path, wd] : by_path_) {
-    if (!was_visited(path)) stale.push_back(path);
+    if (first) break;
+    if (visited.count(path) == 0) stale.push_back(path);
   }
   for (const std::string& path : stale) Unmap(path, true, nullptr);
   // Directories over the watch limit are rescanned when found so, and
