@@ -230,16 +230,15 @@ bool FanotifyTree::Attach(Root& root, int dir, std::string* why) {
 }
 
 std::vector<std::string> FanotifyTree::Sync(const std::vector<std::string>& roots,
-                                            const ZORV::ZORVNOTIFYD::MonitorQueueIndex& index,
+                                            const WatchMasks& masks,
                                             std::map<std::string, std::string>* refused) {
   Relist();  // while the cache still names the directories marked
   reloading_ = synced_;
   synced_ = true;
-  index_ = index;
   // Every mark asks for the kinds some queue wants, and those that keep
   // the cache: file writes on a whole file system cost only when wanted.
   uint32_t wanted = 0;
-  for (const std::string& root : roots) wanted |= index.GetWatchMask(root);
+  for (const std::string& root : roots) wanted |= masks.For(root);
   uint64_t mask = FAN_CREATE | FAN_DELETE | FAN_ONDIR |
                   (renames_ ? FAN_RENAME : FAN_MOVED_FROM | FAN_MOVED_TO) |
                   (wanted & (IN_MODIFY | IN_CLOSE_WRITE | IN_ATTRIB));

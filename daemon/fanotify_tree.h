@@ -19,10 +19,10 @@
 #include <unordered_set>
 #include <vector>
 
-#include "monitor_queue_index.h"
 #include "offline_changes.h"
 #include "snapshot.h"
 #include "unique_fd.h"
+#include "watch_masks.h"
 #include "watch_tree.h"
 
 namespace zorvnotifyd {
@@ -57,13 +57,12 @@ class FanotifyTree {
 
   // Serves |roots| (absolute, normalised paths) from now on: marks each
   // file system holding one (once), and adds to the marks' event kinds
-  // those |index| asks for (file events only when some queue wants them).
+  // those |masks| ask for (file events only when some queue wants them).
   // Walks nothing: each tree new to it is compared with the snapshot by
   // WalkPending.  Returns the roots it serves (a missing one is looked for
   // by Tick); each one it cannot mark goes to |refused| with the reason,
   // for the caller to serve otherwise.
-  std::vector<std::string> Sync(const std::vector<std::string>& roots,
-                                const ZORV::ZORVNOTIFYD::MonitorQueueIndex& index,
+  std::vector<std::string> Sync(const std::vector<std::string>& roots, const WatchMasks& masks,
                                 std::map<std::string, std::string>* refused);
 
   // Goes on with the walks that compare trees with the snapshot (a tree
@@ -216,7 +215,6 @@ class FanotifyTree {
   std::map<std::string, UniqueFd> mount_fds_;         // by root path, this round
   std::string key_;                                   // Resolve's buffer
   std::vector<std::string> paths_;                    // Configured's result
-  ZORV::ZORVNOTIFYD::MonitorQueueIndex index_{{}};
   Snapshot* snapshot_ = nullptr;
   EventSink* sink_ = nullptr;
   bool reloading_ = false;  // within a Sync that is not the first

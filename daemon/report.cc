@@ -38,14 +38,21 @@ void Head(const CatalogueQueue& entry, bool json, std::string* line) {
 }  // namespace
 
 void Reporter::Use(Catalogue catalogue, std::vector<QueueLog*>* created) {
-  std::vector<ZORV::ZORVNOTIFYD::MonitorQueue> queues;
-  queues.reserve(catalogue.size());
-  for (const CatalogueQueue& entry : catalogue) queues.push_back(entry.queue);
-  index_ = ZORV::ZORVNOTIFYD::MonitorQueueIndex(queues);
+  masks_ = WatchMasks(catalogue);
+  indexed_ = false;
   logs_.Follow(catalogue, &logs_by_position_, created);
   catalogue_ = std::move(catalogue);
   found_wanted_.assign(catalogue_.size(), 0);
   trees_.clear();  // made again by the first rescan
+}
+
+void Reporter::BuildIndex() {
+  if (indexed_) return;
+  std::vector<ZORV::ZORVNOTIFYD::MonitorQueue> queues;
+  queues.reserve(catalogue_.size());
+  for (const CatalogueQueue& entry : catalogue_) queues.push_back(entry.queue);
+  index_ = ZORV::ZORVNOTIFYD::MonitorQueueIndex(queues);
+  indexed_ = true;
 }
 
 void Reporter::Record(size_t i, const std::string& path, uint32_t mask, uint64_t order,
@@ -73,6 +80,7 @@ void Reporter::Record(size_t i, const std::string& path, uint32_t mask, uint64_t
 
 void Reporter::Event(const std::string& path, uint32_t mask) {
   ++events_;
+  BuildIndex();
   index_.Match(path, mask, matches_);
   if (matches_.empty()) return;
   const uint64_t order = logs_.NextOrder();
@@ -92,6 +100,7 @@ void Reporter::RecordWanted(const std::string& path, uint32_t kinds, uint32_t ex
   // Each kind on its own: a queue gets the kinds that some configuration
   // of it wants at |path|.
   std::vector<size_t> wanting;
+  BuildIndex();
   for (uint32_t bit = 1; bit != 0; bit <<= 1) {
     if ((kinds & bit) == 0) continue;
     index_.Match(path, bit, matches_);

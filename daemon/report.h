@@ -13,6 +13,7 @@
 #include "catalogue.h"
 #include "monitor_queue_index.h"
 #include "queue_log.h"
+#include "watch_masks.h"
 #include "watch_tree.h"
 
 namespace zorvnotifyd {
@@ -38,10 +39,14 @@ class Reporter : public EventSink {
   Reporter(QueueLogs& logs, Stdout out) : logs_(logs), stdout_(out) {}
 
   // Reports to the queues of |catalogue| from now on; |created| gets the
-  // logs of queues new to the daemon.
+  // logs of queues new to the daemon.  Their index is made by BuildIndex,
+  // or by the first report that needs it.
   void Use(Catalogue catalogue, std::vector<QueueLog*>* created);
-  // The index over the queues in use.
-  const ZORV::ZORVNOTIFYD::MonitorQueueIndex& index() const { return index_; }
+  // Makes the index over the queues in use unless it is made already: the
+  // daemon calls it once its watches are in place, before it reads events.
+  void BuildIndex();
+  // The masks of the configurations in use, for the watchers.
+  const WatchMasks& masks() const { return masks_; }
   // Calls |recorded| after each record added to a log.
   void OnRecord(std::function<void(QueueLog*)> recorded) { recorded_ = std::move(recorded); }
   // The number of queues in use.
@@ -81,6 +86,8 @@ class Reporter : public EventSink {
   Catalogue catalogue_;
   std::vector<QueueLog*> logs_by_position_;
   ZORV::ZORVNOTIFYD::MonitorQueueIndex index_{{}};
+  bool indexed_ = true;  // index_ is over catalogue_
+  WatchMasks masks_;
   std::vector<size_t> matches_;         // reused by every event
   std::vector<uint32_t> found_wanted_;  // per queue, for Found
   // Every configured tree as (path, queue, position in the queue), sorted:

@@ -82,18 +82,17 @@ WatchTree::HomeAtReturn::~HomeAtReturn() {
 
 void WatchTree::Resync() {
   const std::vector<std::string> roots(roots_.begin(), roots_.end());
-  const ZORV::ZORVNOTIFYD::MonitorQueueIndex index = index_;
-  Sync(roots, index);
+  const WatchMasks masks = masks_;
+  Sync(roots, masks);
 }
 
-void WatchTree::Sync(const std::vector<std::string>& roots,
-                     const ZORV::ZORVNOTIFYD::MonitorQueueIndex& index) {
+void WatchTree::Sync(const std::vector<std::string>& roots, const WatchMasks& masks) {
   const HomeAtReturn home(*this);
   Relist();  // while the directories marked are still watched
   reloading_ = synced_;
   synced_ = true;
   roots_ = std::set<std::string, std::less<>>(roots.begin(), roots.end());
-  index_ = index;
+  masks_ = masks;
   // Looked up once per directory walked, so hashed rather than ordered.
   // A first Sync (nothing watched before) visits just what by_path_ will
   // hold: it serves as the set of paths visited, with no copy of each.
@@ -454,7 +453,7 @@ bool WatchTree::ToldByParent(const std::string& path, const RawEvent& event) con
 }
 
 uint32_t WatchTree::MaskFor(const std::string& dir) const {
-  return index_.GetWatchMask(dir) & IN_ALL_EVENTS;
+  return masks_.For(dir) & IN_ALL_EVENTS;
 }
 
 std::string WatchTree::RootOf(const std::string& dir) const {

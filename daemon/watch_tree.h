@@ -18,9 +18,9 @@
 #include <unordered_set>
 #include <vector>
 
-#include "monitor_queue_index.h"
 #include "snapshot.h"
 #include "unique_fd.h"
+#include "watch_masks.h"
 
 namespace zorvnotifyd {
 
@@ -92,14 +92,13 @@ class WatchTree {
 
   // Makes the watches match |roots|, the configured trees (absolute,
   // normalised paths; see common/watch_path.h): every directory at or below
-  // a root is watched with index.GetWatchMask(directory), limited to
+  // a root is watched with masks.For(directory), limited to
   // inotify's event kinds; other watches are removed.  A
   // watch whose mask does not change keeps its events.  Roots that do not
   // exist or are not directories are logged once and looked for by Tick.
   // Over the kernel's watch limit it watches what it can, logs per tree
   // how many directories it could not watch, and Tick tries again.
-  void Sync(const std::vector<std::string>& roots,
-            const ZORV::ZORVNOTIFYD::MonitorQueueIndex& index);
+  void Sync(const std::vector<std::string>& roots, const WatchMasks& masks);
 
   // The periodic check: watches again every root that is missing or whose
   // directory was replaced (deleted and made again, moved back, a file
@@ -287,7 +286,7 @@ class WatchTree {
   void Unmap(const std::string& path, bool release, const char* why);
   // Logs, once while it lasts, that root |path| is not watched and why.
   void NoteRootMissing(const std::string& path, const std::string& why);
-  // Sync again with the same roots and index.
+  // Sync again with the same roots and masks.
   void Resync();
 
   // Puts the working directory back to home_ as the public call that made
@@ -305,7 +304,7 @@ class WatchTree {
   UniqueFd home_;                             // the working directory between public calls
   bool away_ = false;                         // Add moved the working directory away from home_
   std::set<std::string, std::less<>> roots_;  // the configured trees
-  ZORV::ZORVNOTIFYD::MonitorQueueIndex index_{{}};
+  WatchMasks masks_;
   std::unordered_map<int, Watch> watches_;  // by watch descriptor
   std::map<std::string, int> by_path_;      // watch descriptor by path
   // Hashes a directory's device and inode.

@@ -69,8 +69,7 @@ bool ParseBackend(const std::string& text, Backend* backend) {
 Watchers::Watchers(UniqueFd inotify, double retry_seconds, Backend backend)
     : inotify_(std::move(inotify), retry_seconds), fanotify_(retry_seconds), backend_(backend) {}
 
-void Watchers::Sync(const std::vector<std::string>& roots,
-                    const ZORV::ZORVNOTIFYD::MonitorQueueIndex& index) {
+void Watchers::Sync(const std::vector<std::string>& roots, const WatchMasks& masks) {
   std::string cannot;
   const bool can = backend_ != Backend::kInotify && fanotify_.Open(&cannot);
   MountTable mounts;
@@ -152,7 +151,7 @@ void Watchers::Sync(const std::vector<std::string>& roots,
       (choice.backend == kFanotify ? by_fanotify : by_inotify).push_back(root);
     }
     std::map<std::string, std::string> refused;
-    fanotify_.Sync(by_fanotify, index, &refused);
+    fanotify_.Sync(by_fanotify, masks, &refused);
     again = false;
     for (const auto& [root, why] : refused) {
       chosen[root] = {kInotify, why};
@@ -168,7 +167,7 @@ void Watchers::Sync(const std::vector<std::string>& roots,
       for (const auto& [root, why] : refused) by_inotify.push_back(root);
     }
   }
-  inotify_.Sync(by_inotify, index);
+  inotify_.Sync(by_inotify, masks);
   for (const auto& [root, choice] : chosen) {
     const auto before = chosen_.find(root);
     if (before != chosen_.end() && before->second.backend == choice.backend &&

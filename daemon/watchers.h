@@ -10,9 +10,9 @@
 #include <vector>
 
 #include "fanotify_tree.h"
-#include "monitor_queue_index.h"
 #include "snapshot.h"
 #include "unique_fd.h"
+#include "watch_masks.h"
 #include "watch_tree.h"
 
 namespace zorvnotifyd {
@@ -57,8 +57,7 @@ class Watchers {
 
   // Chooses the backend of each root and syncs both watchers.  Each new
   // choice and why waits for LogChoices.
-  void Sync(const std::vector<std::string>& roots,
-            const ZORV::ZORVNOTIFYD::MonitorQueueIndex& index);
+  void Sync(const std::vector<std::string>& roots, const WatchMasks& masks);
   // Logs the choices Sync made that differ from the earlier ones, a line
   // per tree for the first 20, then one line with the count of the rest.
   // The daemon calls it once it is ready rather than before.

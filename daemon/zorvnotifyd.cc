@@ -292,13 +292,14 @@ int Serve(const Options& options) {
     const std::vector<std::string> roots = loader.Honour(&catalogue);
     std::vector<QueueLog*> created;
     reporter.Use(std::move(catalogue), &created);
-    tree.Sync(roots, reporter.index());
+    tree.Sync(roots, reporter.masks());
     return created;
   };
-  // Opens the new queues' journals and makes the clients' subscriptions
-  // follow the catalogue.
+  // Opens the new queues' journals, makes the index over the queues and
+  // makes the clients' subscriptions follow the catalogue.
   auto follow = [&](const std::vector<QueueLog*>& created) {
     logs.Opened();
+    reporter.BuildIndex();
     server.FollowNew(created);
   };
   tree.CompareLater();
@@ -306,8 +307,8 @@ int Serve(const Options& options) {
   syslog(LOG_INFO, "ready: watching %zu directories for %zu queues", tree.size(), reporter.size());
   NotifyServiceManager(ReadyState(tree.size(), reporter.size()));
   // Once the watches are in place no change goes unseen: the journals are
-  // opened after, before any client is served or any event read (a record
-  // made meanwhile opens them first).
+  // opened and the index made after, before any client is served or any
+  // event read (a record made meanwhile opens and makes them first).
   follow(created);
   tree.LogChoices();
   CompareAfterReady(tree);
