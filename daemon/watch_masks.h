@@ -6,7 +6,6 @@
 #include <memory>
 #include <string>
 #include <string_view>
-#include <unordered_map>
 #include <vector>
 
 #include "catalogue.h"
@@ -30,9 +29,15 @@ class WatchMasks {
   uint32_t For(std::string_view dir) const;
 
  private:
+  // Open addressing over FNV-1a hashes, which For computes along the
+  // directory's path once for all its leading parts.
   struct Table {
-    std::vector<std::string> paths;  // the keys' text, each once
-    std::unordered_map<std::string_view, uint32_t> masks;
+    std::vector<std::string> paths;  // each configured path once
+    std::vector<uint64_t> hashes;    // of paths[i]
+    std::vector<uint32_t> masks;     // of paths[i]
+    std::vector<uint32_t> slots;     // 1 + an index into paths, or 0; a power of 2 long
+    // The index of |path| (whose hash is |hash|), or -1.
+    long Find(uint64_t hash, std::string_view path) const;
   };
   std::shared_ptr<const Table> table_;
 };
