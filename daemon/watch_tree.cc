@@ -12,6 +12,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <iterator>
 #include <utility>
 
 #include "directory.h"
@@ -81,17 +82,18 @@ WatchTree::HomeAtReturn::~HomeAtReturn() {
 }
 
 void WatchTree::Resync() {
-  const std::vector<std::string> roots(roots_.begin(), roots_.end());
+  std::vector<std::string> roots(roots_.begin(), roots_.end());
   const WatchMasks masks = masks_;
-  Sync(roots, masks);
+  Sync(std::move(roots), masks);
 }
 
-void WatchTree::Sync(const std::vector<std::string>& roots, const WatchMasks& masks) {
+void WatchTree::Sync(std::vector<std::string> roots, const WatchMasks& masks) {
   const HomeAtReturn home(*this);
   Relist();  // while the directories marked are still watched
   reloading_ = synced_;
   synced_ = true;
-  roots_ = std::set<std::string, std::less<>>(roots.begin(), roots.end());
+  roots_ = std::set<std::string, std::less<>>(std::make_move_iterator(roots.begin()),
+                                              std::make_move_iterator(roots.end()));
   masks_ = masks;
   // Looked up once per directory walked, so hashed rather than ordered.
   // A first Sync (nothing watched before) visits just what by_path_ will

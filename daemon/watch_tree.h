@@ -98,7 +98,7 @@ class WatchTree {
   // exist or are not directories are logged once and looked for by Tick.
   // Over the kernel's watch limit it watches what it can, logs per tree
   // how many directories it could not watch, and Tick tries again.
-  void Sync(const std::vector<std::string>& roots, const WatchMasks& masks);
+  void Sync(std::vector<std::string> roots, const WatchMasks& masks);
 
   // The periodic check: watches again every root that is missing or whose
   // directory was replaced (deleted and made again, moved back, a file

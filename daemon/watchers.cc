@@ -69,7 +69,7 @@ bool ParseBackend(const std::string& text, Backend* backend) {
 Watchers::Watchers(UniqueFd inotify, double retry_seconds, Backend backend)
     : inotify_(std::move(inotify), retry_seconds), fanotify_(retry_seconds), backend_(backend) {}
 
-void Watchers::Sync(const std::vector<std::string>& roots, const WatchMasks& masks) {
+void Watchers::Sync(std::vector<std::string> roots, const WatchMasks& masks) {
   std::string cannot;
   const bool can = backend_ != Backend::kInotify && fanotify_.Open(&cannot);
   MountTable mounts;
@@ -78,7 +78,7 @@ void Watchers::Sync(const std::vector<std::string>& roots, const WatchMasks& mas
     syslog(LOG_WARNING, "cannot read the mount table (%s): inotify serves every tree",
            unread.c_str());
   }
-  std::vector<std::string> sorted(roots);
+  std::vector<std::string> sorted = std::move(roots);
   std::sort(sorted.begin(), sorted.end());
   sorted.erase(std::unique(sorted.begin(), sorted.end()), sorted.end());
   // The choice of each tree of |sorted|, and where each tree chosen is
@@ -167,7 +167,7 @@ void Watchers::Sync(const std::vector<std::string>& roots, const WatchMasks& mas
       for (const auto& [root, why] : refused) by_inotify.push_back(root);
     }
   }
-  inotify_.Sync(by_inotify, masks);
+  inotify_.Sync(std::move(by_inotify), masks);
   for (const auto& [root, choice] : chosen) {
     const auto before = chosen_.find(root);
     if (before != chosen_.end() && before->second.backend == choice.backend &&

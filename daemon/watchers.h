@@ -57,7 +57,7 @@ class Watchers {
 
   // Chooses the backend of each root and syncs both watchers.  Each new
   // choice and why waits for LogChoices.
-  void Sync(const std::vector<std::string>& roots, const WatchMasks& masks);
+  void Sync(std::vector<std::string> roots, const WatchMasks& masks);
   // Logs the choices Sync made that differ from the earlier ones, a line
   // per tree for the first 20, then one line with the count of the rest.
   // The daemon calls it once it is ready rather than before.

@@ -289,10 +289,10 @@ int Serve(const Options& options) {
   // returns the logs of the queues new to the daemon.
   auto load = [&] {
     Catalogue catalogue = loader.Load();
-    const std::vector<std::string> roots = loader.Honour(&catalogue);
+    std::vector<std::string> roots = loader.Honour(&catalogue);
     std::vector<QueueLog*> created;
     reporter.Use(std::move(catalogue), &created);
-    tree.Sync(roots, reporter.masks());
+    tree.Sync(std::move(roots), reporter.masks());
     return created;
   };
   // Opens the new queues' journals, makes the index over the queues and
