@@ -34,6 +34,11 @@ constexpr const char* kNotMountPointWhy =
     "it is not a mount point (fanotify would pay for the events of the rest of its file "
     "system; --backend fanotify serves it so)";
 
+// A reason for a choice, to share among the trees it is given to.
+std::shared_ptr<const std::string> Why(std::string text) {
+  return std::make_shared<const std::string>(std::move(text));
+}
+
 // True when the open directory |dir| is the root of its file system, as
 // mounted: a mount of |mounts| whose root is the file system's own (a bind
 // mount of a directory inside one is not).
@@ -78,6 +83,10 @@ void Watchers::Sync(std::vector<std::string> roots, const WatchMasks& masks) {
     syslog(LOG_WARNING, "cannot read the mount table (%s): inotify serves every tree",
            unread.c_str());
   }
+  const auto not_mount_point = Why(kNotMountPointWhy);
+  const auto by_option =
+      Why(backend_ == Backend::kInotify ? "--backend inotify" : "--backend fanotify");
+  const auto cannot_why = Why(cannot);
   std::vector<std::string> sorted = std::move(roots);
   std::sort(sorted.begin(), sorted.end());
   sorted.erase(std::unique(sorted.begin(), sorted.end()), sorted.end());
@@ -103,35 +112,35 @@ void Watchers::Sync(std::vector<std::string> roots, const WatchMasks& masks) {
       return true;
     });
     std::string why;
-    Choice choice{kInotify, ""};
+    Choice choice{kInotify, nullptr};
     if (outer != nullptr && outer_choice->backend == kInotify) {
-      choice.why = "it lies in tree " + zorvcommon::Quoted(*outer) + ", which inotify serves";
+      choice.why = Why("it lies in tree " + zorvcommon::Quoted(*outer) + ", which inotify serves");
     } else if (backend_ == Backend::kInotify) {
-      choice.why = "--backend inotify";
+      choice.why = by_option;
     } else if (!can) {
-      choice.why = cannot;
+      choice.why = cannot_why;
     } else {
       // The mount table tells most trees apart without a look at each.
       const bool top = backend_ == Backend::kAuto && outer == nullptr;
       const bool point = top && mounts.IsMountPoint(root);
       const UniqueFd dir = !top || point ? OpenConfiguredDir(root) : UniqueFd();
       if (top && !point) {
-        choice.why = kNotMountPointWhy;
+        choice.why = not_mount_point;
       } else if (dir.get() < 0) {
         // Looked for again by the watcher chosen.
-        choice = backend_ == Backend::kFanotify ? Choice{kFanotify, "--backend fanotify"}
-                                                : Choice{kInotify, "it is missing"};
+        choice = backend_ == Backend::kFanotify ? Choice{kFanotify, by_option}
+                                                : Choice{kInotify, Why("it is missing")};
       } else if (top && !IsFileSystemRoot(dir.get(), mounts)) {
-        choice.why = kNotMountPointWhy;
+        choice.why = not_mount_point;
       } else if (!FanotifySupports(dir.get(), &why)) {
-        choice.why = why;
+        choice.why = Why(why);
       } else if (backend_ == Backend::kFanotify) {
-        choice = {kFanotify, "--backend fanotify"};
+        choice = {kFanotify, by_option};
       } else if (outer != nullptr) {
         choice = {kFanotify,
-                  "it lies in tree " + zorvcommon::Quoted(*outer) + ", which fanotify serves"};
+                  Why("it lies in tree " + zorvcommon::Quoted(*outer) + ", which fanotify serves")};
       } else {
-        choice = {kFanotify, "it is a whole file system, with file handles"};
+        choice = {kFanotify, Why("it is a whole file system, with file handles")};
       }
     }
     chosen_at.emplace(root, choices.size());
@@ -154,11 +163,12 @@ void Watchers::Sync(std::vector<std::string> roots, const WatchMasks& masks) {
     fanotify_.Sync(by_fanotify, masks, &refused);
     again = false;
     for (const auto& [root, why] : refused) {
-      chosen[root] = {kInotify, why};
+      chosen[root] = {kInotify, Why(why)};
+      const auto inside =
+          Why("it lies in tree " + zorvcommon::Quoted(root) + ", which inotify serves");
       for (auto& [path, choice] : chosen) {
         if (Below(path, root) && choice.backend == kFanotify) {
-          choice = {kInotify,
-                    "it lies in tree " + zorvcommon::Quoted(root) + ", which inotify serves"};
+          choice = {kInotify, inside};
           again = true;
         }
       }
@@ -171,7 +181,7 @@ void Watchers::Sync(std::vector<std::string> roots, const WatchMasks& masks) {
   for (const auto& [root, choice] : chosen) {
     const auto before = chosen_.find(root);
     if (before != chosen_.end() && before->second.backend == choice.backend &&
-        before->second.why == choice.why) {
+        *before->second.why == *choice.why) {
       continue;
     }
     // Only the lines LogChoices prints are made: a catalogue of thousands
@@ -181,7 +191,7 @@ void Watchers::Sync(std::vector<std::string> roots, const WatchMasks& masks) {
       continue;
     }
     unlogged_.push_back("tree " + zorvcommon::Quoted(root) + " is served by " + choice.backend +
-                        ": " + choice.why);
+                        ": " + *choice.why);
   }
   chosen_ = std::move(chosen);
 }
@@ -206,7 +216,7 @@ void Watchers::AppendStatus(std::string* out) const {
     out->push_back(',');
     AppendJsonField(out, "backend", choice.backend);
     out->push_back(',');
-    AppendJsonField(out, "why", choice.why);
+    AppendJsonField(out, "why", *choice.why);
     out->push_back('}');
   }
   out->push_back(']');

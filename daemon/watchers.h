@@ -6,6 +6,7 @@
 #define ZORVNOTIFYD_DAEMON_WATCHERS_H_
 
 #include <map>
+#include <memory>
 #include <string>
 #include <vector>
 
@@ -101,7 +102,8 @@ class Watchers {
  private:
   struct Choice {
     const char* backend;
-    std::string why;
+    // Shared: thousands of trees mostly have one of a few reasons.
+    std::shared_ptr<const std::string> why;
   };
   WatchTree inotify_;
   FanotifyTree fanotify_;
