@@ -9,6 +9,8 @@
 #include <exception>
 #include <string>
 #include <string_view>
+#include <utility>
+#include <vector>
 
 namespace ZORV {
 namespace ZORVNOTIFYD {
@@ -154,10 +156,15 @@ class Parser {
       }
       if (key == "config" && !configured) {
         configured = true;
-        return Array([&] {
-          queue._configs.emplace_back(Json::Value::nullSingleton());  // "", 0, no patterns
-          return Configuration(queue._configs.back());
-        });
+        configs_.clear();
+        if (!Array([&] {
+              configs_.emplace_back(Json::Value::nullSingleton());  // "", 0, no patterns
+              return Configuration(configs_.back());
+            })) {
+          return false;
+        }
+        MoveExactly(configs_, queue._configs);
+        return true;
       }
       return false;  // another key, or one seen before
     });
@@ -179,17 +186,34 @@ class Parser {
       }
       if (key == "ignore" && !has_ignore) {
         has_ignore = true;
-        return Array([&] {
-          config._ignore.emplace_back();
-          return String(config._ignore.back());
-        });
+        patterns_.clear();
+        if (!Array([&] {
+              patterns_.emplace_back();
+              return String(patterns_.back());
+            })) {
+          return false;
+        }
+        MoveExactly(patterns_, config._ignore);
+        return true;
       }
       return false;
     });
   }
 
+  // Moves the elements of |from| into the empty |to|, which gets room for
+  // just them: |from| keeps its room for the next list, where growing
+  // |to| element by element would allocate and move it several times.
+  template <typename T>
+  static void MoveExactly(std::vector<T>& from, std::vector<T>& to) {
+    to.reserve(from.size());
+    for (T& element : from) to.push_back(std::move(element));
+    from.clear();
+  }
+
   const char* p_;
   const char* const end_;
+  std::vector<Config> configs_;        // the configurations of the queue being read
+  std::vector<std::string> patterns_;  // the patterns of the configuration being read
 };
 
 }  // namespace
