@@ -133,6 +133,7 @@ void WatchTree::Sync(std::vector<std::string> roots, const WatchMasks& masks) {
     }
     WalkContext context;
     context.synced = &synced;
+    context.fresh = first;
     context.visited = first ? nullptr : &visited;
     std::string why;
     if (!WatchRootTree(root, context, &why, first || by_path_.count(root) == 0)) {
@@ -575,8 +576,9 @@ int WatchTree::Add(int dir, const struct stat& st, const std::string& path, Walk
   // In a Sync the first path of a directory sets its mask exactly, so kinds
   // no longer wanted go; every other path, and every later add, adds to it.
   const auto known = by_inode_.find(id);
-  const bool exact = context.synced != nullptr &&
-                     (known == by_inode_.end() || context.synced->count(known->second) == 0);
+  const bool exact =
+      context.synced != nullptr &&
+      (known == by_inode_.end() || (!context.fresh && context.synced->count(known->second) == 0));
   // The open directory itself, never a path that a link could redirect:
   // "." while it is the working directory.  (Naming it as /proc/self/fd/N
   // does the same, at the cost of a walk through /proc that was most of the
@@ -610,7 +612,7 @@ int WatchTree::Add(int dir, const struct stat& st, const std::string& path, Walk
   }
   watch.mask = exact ? wanted : watch.mask | wanted;
   by_inode_[id] = wd;
-  if (context.synced != nullptr) context.synced->insert(wd);
+  if (context.synced != nullptr && !context.fresh) context.synced->insert(wd);
   if (context.visited != nullptr) context.visited->insert(path);
   // A walk meets paths mostly in their order: each is tried at the end
   // first, which costs one comparison where a descent costs a dozen.

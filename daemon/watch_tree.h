@@ -210,6 +210,9 @@ class WatchTree {
   // What one walk of a tree does (see Walk).
   struct WalkContext {
     std::unordered_set<int>* synced = nullptr;  // Sync: watches given their exact mask this round
+    // A first Sync: every directory by_inode_ knows was watched this round,
+    // so |synced| is not kept.
+    bool fresh = false;
     // Sync: every path watched this round, when by_path_ held some before
     std::unordered_set<std::string>* visited = nullptr;
     EventSink* found = nullptr;                      // report entries as Found
