@@ -1014,7 +1014,8 @@ const std::string kVolumeState = kRoot + "/vol-state";
 bool UseVolume(int dirs) {
   static int made = -1;
   if (made == dirs) return true;
-  std::system(("umount " + kVolume + " 2>/dev/null").c_str());
+  [[maybe_unused]] const int unmounted =  // fails when nothing is mounted there yet
+      std::system(("umount " + kVolume + " 2>/dev/null").c_str());
   const std::string inodes = std::to_string(dirs + 100000);
   const std::string make =
       "rm -f " + kVolumeImage + " && truncate -s " + std::to_string(128 + dirs / 512) + "M " +
