@@ -101,9 +101,6 @@ void WatchTree::Sync(std::vector<std::string> roots, const WatchMasks& masks) {
   const bool first = by_path_.empty();
   std::unordered_set<int> synced(watches_.size());
   std::unordered_set<std::string> visited(by_path_.size());
-  const auto was_visited = [&](const std::string& path) {
-    return first ? by_path_.count(path) != 0 : visited.count(path) != 0;
-  };
   // In a first Sync, the roots met so far that hold the next one (they
   // sort before it): only a root inside another can have been walked.
   std::vector<const std::string*> enclosing;
@@ -127,8 +124,8 @@ void WatchTree::Sync(std::vector<std::string> roots, const WatchMasks& masks) {
       while (!enclosing.empty() && !below(*enclosing.back())) enclosing.pop_back();
       const bool inside = !enclosing.empty();
       enclosing.push_back(&root);
-      if (inside && was_visited(root)) continue;
-    } else if (was_visited(root)) {
+      if (inside && by_path_.count(root) != 0) continue;
+    } else if (visited.count(root) != 0) {
       continue;
     }
     WalkContext context;
@@ -160,9 +157,10 @@ void WatchTree::Sync(std::vector<std::string> roots, const WatchMasks& masks) {
   // Paths not met in this round are no longer wanted, or no longer there;
   // a first round met every path it holds.
   std::vector<std::string> stale;
-  for (const auto& [path, wd] : by_path_) {
-    if (first) break;
-    if (visited.count(path) == 0) stale.push_back(path);
+  if (!first) {
+    for (const auto& [path, wd] : by_path_) {
+      if (visited.count(path) == 0) stale.push_back(path);
+    }
   }
   for (const std::string& path : stale) Unmap(path, true, nullptr);
   // Directories over the watch limit are rescanned when found so, and

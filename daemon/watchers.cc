@@ -2,7 +2,6 @@
 
 #include "watchers.h"
 
-#include <errno.h>
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <syslog.h>

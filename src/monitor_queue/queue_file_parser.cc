@@ -95,34 +95,13 @@ class Parser {
       if (p_ == end_ || *p_ == '\0') return false;
       if (*p_++ == '"') return true;
       if (p_ == end_) return false;
-      switch (*p_++) {
-        case '"':
-          out.push_back('"');
-          break;
-        case '\\':
-          out.push_back('\\');
-          break;
-        case '/':
-          out.push_back('/');
-          break;
-        case 'b':
-          out.push_back('\b');
-          break;
-        case 'f':
-          out.push_back('\f');
-          break;
-        case 'n':
-          out.push_back('\n');
-          break;
-        case 'r':
-          out.push_back('\r');
-          break;
-        case 't':
-          out.push_back('\t');
-          break;
-        default:  // \u, or not an escape at all
-          return false;
-      }
+      // The escaped letters and what each stands for; \u, or anything else
+      // after a backslash, is refused.
+      static constexpr std::string_view kEscaped = "\"\\/bfnrt";
+      static constexpr std::string_view kMeant = "\"\\/\b\f\n\r\t";
+      const size_t at = kEscaped.find(*p_++);
+      if (at == std::string_view::npos) return false;
+      out.push_back(kMeant[at]);
     }
   }
 
